@@ -1,0 +1,30 @@
+#pragma once
+
+#include <filesystem>
+#include <stdlib.h>
+#include <string>
+
+namespace support {
+
+/// A directory of its own under /tmp, removed with everything in it.
+class ScratchDirectory {
+public:
+    ScratchDirectory() {
+        std::string name = "/tmp/zbd-test-XXXXXX";
+        _path = std::filesystem::canonical(mkdtemp(name.data())).string();
+    }
+    ~ScratchDirectory() {
+        std::error_code ignored; // a test that made something undeletable has failed already
+        std::filesystem::remove_all(_path, ignored);
+    }
+    ScratchDirectory(const ScratchDirectory&) = delete;
+    ScratchDirectory& operator=(const ScratchDirectory&) = delete;
+
+    const std::string& path() const { return _path; }
+    std::string operator/(const std::string& name) const { return _path + "/" + name; }
+
+private:
+    std::string _path;
+};
+
+} // namespace support
