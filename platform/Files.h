@@ -1,0 +1,44 @@
+#pragma once
+
+#include "platform/Error.h"
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+
+namespace platform {
+
+/// Domain and codes of file errors. Other failures carry `fileReadUnknownCode` or `fileWriteUnknownCode` and the
+/// system's text in the description.
+inline constexpr const char* fileErrorDomain = "Files";
+inline constexpr int fileReadUnknownCode = 256;
+inline constexpr int fileReadNoPermissionCode = 257;
+inline constexpr int fileReadNoSuchFileCode = 260;
+inline constexpr int fileReadTooLargeCode = 263;
+inline constexpr int fileWriteUnknownCode = 512;
+inline constexpr int fileWriteNoPermissionCode = 513;
+inline constexpr int fileWriteOutOfSpaceCode = 640;
+
+class Files {
+public:
+    virtual ~Files() = default;
+
+    /// Where a well-known absolute path of the platform ("/System/", "/var/db/...") lies: the path itself, or the same
+    /// path below the root of a scratch platform.
+    virtual std::string locate(const std::string& wellKnownPath) = 0;
+
+    /// Bytes of a whole regular file (anything else, a device or a pipe included, is an error: nothing here blocks).
+    /// A file larger than `limit` is an error.
+    virtual Result<std::string> read(const std::string& path, std::size_t limit) = 0;
+
+    /// Replaces the file as a whole: readers, and whoever looks after a crash at any moment, find the old bytes or the
+    /// new ones. On failure the old file is untouched and nothing is left beside it. Keeps the mode of an existing
+    /// file, else 0600. A symbolic link at `path` is followed.
+    virtual Failure writeAtomically(const std::string& path, std::string_view bytes) = 0;
+
+    /// The canonical path, as realpath(3) gives it; an error for what does not exist and for results of `limit` bytes
+    /// or more.
+    virtual Result<std::string> realPath(const std::string& path, std::size_t limit) = 0;
+};
+
+} // namespace platform

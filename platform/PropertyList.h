@@ -1,0 +1,252 @@
+#pragma once
+
+#include "platform/Error.h"
+#include "platform/Uuid.h"
+
+#include <atomic>
+#include <concepts>
+#include <cstddef>
+#include <cstdint>
+#include <initializer_list>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+/// The one value type of the whole system: what manifests, messages, the registry and preferences are made of.
+namespace platform {
+
+class Array;
+class Dictionary;
+
+/// A moment, in seconds since 1970-01-01 00:00 UTC; fractions count.
+struct Date {
+    double seconds = 0;
+    friend auto operator<=>(const Date&, const Date&) = default;
+};
+
+enum class Kind : std::uint8_t { none, boolean, integer, real, date, string, data, uuid, array, dictionary };
+
+namespace detail {
+struct Node; // reference-counted storage; defined in PropertyList.cpp
+void retain(Node* node) noexcept;
+void release(Kind kind, Node* node) noexcept;
+struct Contents; // reaches into values for PropertyList.cpp
+} // namespace detail
+
+/// One value. Copying it never copies what it holds: strings, data, arrays and dictionaries are shared storage.
+/// A default-made value holds nothing and stands for "absent"; it is never stored inside an array or dictionary.
+/// Values may be read from any thread; storage that one thread changes must not be read by another meanwhile.
+class Value {
+public:
+    Value() noexcept : _bits(0), _kind(Kind::none), _unsigned(false) {}
+    Value(bool value) noexcept;                     // NOLINT(google-explicit-constructor)
+    template <std::signed_integral T>
+    Value(T value) noexcept : Value(Signed{static_cast<std::int64_t>(value)}) {} // NOLINT(google-explicit-constructor)
+    template <std::unsigned_integral T>
+        requires(!std::same_as<T, bool>)
+    Value(T value) noexcept : Value(Unsigned{static_cast<std::uint64_t>(value)}) {} // NOLINT
+    Value(double value) noexcept;                   // NOLINT(google-explicit-constructor)
+    Value(Date value) noexcept;                     // NOLINT(google-explicit-constructor)
+    Value(std::string_view value);                  // NOLINT(google-explicit-constructor)
+    Value(const std::string& value) : Value(std::string_view(value)) {} // NOLINT(google-explicit-constructor)
+    Value(const char* value) : Value(std::string_view(value)) {}        // NOLINT(google-explicit-constructor)
+    Value(const UUID& value);                       // NOLINT(google-explicit-constructor)
+    Value(const Array& value);                      // NOLINT(google-explicit-constructor)
+    Value(const Dictionary& value);                 // NOLINT(google-explicit-constructor)
+    static Value data(std::string_view bytes);
+
+    Value(const Value& other) noexcept;
+    Value(Value&& other) noexcept;
+    Value& operator=(const Value& other) noexcept;
+    Value& operator=(Value&& other) noexcept;
+    ~Value();
+
+    Kind kind() const noexcept { return _kind; }
+    /// False only for "absent".
+    explicit operator bool() const noexcept { return _kind != Kind::none; }
+
+    // Each answers none when the value is of another kind. Views stay good as long as some value shares the storage.
+    std::optional<bool> boolean() const noexcept;
+    /// Integers only; none also for an integer outside the asked range.
+    std::optional<std::int64_t> int64() const noexcept;
+    std::optional<std::uint64_t> uint64() const noexcept;
+    /// Reals only.
+    std::optional<double> real() const noexcept;
+    std::optional<Date> date() const noexcept;
+    std::optional<std::string_view> string() const noexcept;
+    std::optional<std::string_view> data() const noexcept;
+    std::optional<UUID> uuid() const noexcept;
+    std::optional<Array> array() const noexcept;
+    std::optional<Dictionary> dictionary() const noexcept;
+
+    /// A boolean, an integer or a real: the kinds that compare by number.
+    bool isNumber() const noexcept;
+    /// The number as an integer, as a property list's number object reads: booleans give 0 or 1, reals are truncated
+    /// toward zero and clamped, integers beyond the signed range wrap. None when this is no number.
+    std::optional<std::int64_t> integerValue() const noexcept;
+    /// The number as a boolean: true unless it is zero. None when this is no number.
+    std::optional<bool> booleanValue() const noexcept;
+
+    /// Equal kinds and contents; numbers and booleans compare by exact numeric value, so 1 equals true and 1.0. A real
+    /// that is not a number equals nothing, itself included.
+    friend bool operator==(const Value& left, const Value& right) noexcept;
+
+    /// The value as one line for logs: strings bare, `{key = value; ...}`, `(item, ...)`, "(null)" for an absent one.
+    /// Control characters and bytes that are no UTF-8 are escaped, and long values are cut (see
+    /// `maximumDescriptionLength` in PropertyList.cpp), so that no message can forge or flood the log.
+    std::string description() const;
+
+private:
+    struct Signed { std::int64_t value; };
+    struct Unsigned { std::uint64_t value; };
+    explicit Value(Signed value) noexcept;
+    explicit Value(Unsigned value) noexcept;
+    Value(Kind kind, detail::Node* node) noexcept;
+    bool hasNode() const noexcept { return _kind >= Kind::string; }
+    detail::Node* node() const noexcept;
+
+    friend class Array;
+    friend class MutableArray;
+    friend class Dictionary;
+    friend class MutableDictionary;
+    friend struct detail::Contents;
+
+    std::uint64_t _bits;
+    Kind _kind;
+    bool _unsigned; // an integer above the signed range; smaller ones are always held signed
+};
+
+/// A read-only view of ordered values: a handle on shared storage.
+class Array {
+public:
+    Array();
+    Array(std::initializer_list<Value> values);
+    explicit Array(std::vector<Value> values);
+    template <class Range>
+        requires(!std::same_as<Range, std::vector<Value>> && !std::derived_from<Range, Array> &&
+                 requires(const Range& range) { Value(*range.begin()); })
+    static Array of(const Range& range) {
+        std::vector<Value> values;
+        for (const auto& element : range) values.emplace_back(element);
+        return Array(std::move(values));
+    }
+
+    std::size_t size() const noexcept;
+    bool empty() const noexcept { return size() == 0; }
+    const Value& operator[](std::size_t index) const noexcept;
+    const Value* begin() const noexcept;
+    const Value* end() const noexcept;
+
+    friend bool operator==(const Array& left, const Array& right) noexcept;
+
+protected:
+    explicit Array(Value storage) noexcept : _storage(std::move(storage)) {}
+    Value _storage; // always of kind array
+
+    friend class Value;
+};
+
+/// An array handle that may also change the storage it shares; it converts to `Array` without copying.
+class MutableArray : public Array {
+public:
+    MutableArray() = default;
+    /// A new array with the same elements; the elements themselves are shared.
+    static MutableArray copyOf(const Array& other);
+    void append(Value value);
+};
+
+/// A read-only view of string keys to values: a handle on shared storage. Enumerates in the order in which the keys
+/// were first set. Lookup costs a short walk up to `indexThreshold` keys and a binary search beyond, so no choice of
+/// keys makes it slow.
+class Dictionary {
+public:
+    struct Entry {
+        Value key; // always a string
+        Value value;
+        std::string_view name() const noexcept { return *key.string(); }
+    };
+
+    Dictionary();
+    Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries);
+    /// Takes the entries in order. None when two keys are equal.
+    static std::optional<Dictionary> fromUniqueEntries(std::vector<Entry> entries);
+
+    std::size_t size() const noexcept;
+    bool empty() const noexcept { return size() == 0; }
+    bool contains(std::string_view key) const noexcept { return find(key) != nullptr; }
+    /// The value under `key`; an absent value when there is none.
+    Value operator[](std::string_view key) const noexcept;
+    /// As `operator[]` without sharing the value; null when there is none. Good until the storage changes.
+    const Value* find(std::string_view key) const noexcept;
+    const Entry* begin() const noexcept;
+    const Entry* end() const noexcept;
+
+    // Typed lookups: none when absent or of another kind.
+    std::optional<std::string_view> string(std::string_view key) const noexcept;
+    std::optional<std::uint64_t> uint64(std::string_view key) const noexcept;
+    std::optional<UUID> uuid(std::string_view key) const noexcept;
+    std::optional<Array> array(std::string_view key) const noexcept;
+    std::optional<Dictionary> dictionary(std::string_view key) const noexcept;
+
+    /// True when both handles share one storage.
+    bool sharesStorageWith(const Dictionary& other) const noexcept;
+    /// Same keys with equal values, in any order.
+    friend bool operator==(const Dictionary& left, const Dictionary& right) noexcept;
+
+protected:
+    explicit Dictionary(Value storage) noexcept : _storage(std::move(storage)) {}
+    Value _storage; // always of kind dictionary
+
+    friend class Value;
+};
+
+/// A dictionary handle that may also change the storage it shares; it converts to `Dictionary` without copying.
+class MutableDictionary : public Dictionary {
+public:
+    MutableDictionary() = default;
+    MutableDictionary(std::initializer_list<std::pair<std::string_view, Value>> entries) : Dictionary(entries) {}
+    /// A new dictionary with the same entries; the values themselves are shared.
+    static MutableDictionary copyOf(const Dictionary& other);
+
+    /// Sets or replaces. `value` must not be absent.
+    void set(std::string_view key, Value value);
+    /// Does nothing when there is no such key. The other keys keep their order.
+    void remove(std::string_view key);
+    /// Sets every entry of `other`.
+    void merge(const Dictionary& other);
+};
+
+/// Bounds of the decoders. Each protects the daemon from its input; none is reachable by a sensible value.
+inline constexpr std::size_t maximumNesting = 64; // recursion in decoders, encoders and comparison stays shallow
+
+/// Domain of decoding errors; the description says what was wrong and where.
+inline constexpr const char* propertyListErrorDomain = "PropertyList";
+
+enum class UUIDs { allowed, refused }; // property lists on disk hold none; messages may
+
+// The compact encoding. It serves files, the wire and values carried inside messages. `docs/wire-protocol.md` is its
+// definition. A file begins with `compactMagic`; a message body does not.
+inline constexpr std::string_view compactMagic = "vlist16\n";
+
+/// Appends the encoding of `value`, without magic. The value must not be absent. A string that is no UTF-8 or holds
+/// NUL, a date outside the years 1 to 9999 and nesting beyond `maximumNesting` are encoded, but no decoder takes them.
+void appendCompact(std::string& out, const Value& value);
+/// Decodes exactly one value that fills `bytes`. Strict: UTF-8 checked, no NUL in strings and keys, no duplicate
+/// keys, every size checked against what is left before anything is allocated, nesting bounded.
+Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids);
+
+/// The XML encoding of a whole file, ending in a newline. An error for what no XML file can hold: UUIDs, control
+/// characters other than tab, newline and carriage return, text that is no UTF-8, dates outside the years 1 to 9999,
+/// nesting beyond `maximumNesting`. All else comes back from `decodePropertyList` as it was, to the last bit of a date
+/// (written as 2026-11-22T21:00:00Z, with as many decimals of a second as it takes).
+Result<std::string> encodeXML(const Value& value);
+
+/// Decodes a file in either encoding, told apart by its first bytes. Equally strict; XML with a document type or
+/// with entities beyond the five predefined ones is refused.
+Result<Value> decodePropertyList(std::string_view bytes);
+
+} // namespace platform
