@@ -1,0 +1,172 @@
+#include "zbd/Transaction.h"
+
+#include "Zembra/ZBLog.h"
+#include "platform/Format.h"
+#include "platform/TracePoints.h"
+#include "zbd/ZBDQmxClient.h"
+#include "zbd/ZBDServer.h"
+
+#include <array>
+#include <optional>
+#include <utility>
+
+namespace zbd {
+
+namespace log = zembra::log;
+namespace key = zembra::key;
+namespace code = zembra::code;
+namespace requestType = zembra::requestType;
+using platform::Array;
+using platform::UUID;
+using platform::Value;
+
+namespace {
+
+constexpr std::size_t maximumPath = 1024; // bytes of a resolved path with its NUL; longer ones count as unresolved
+
+struct RequestType {
+    std::string_view name;
+    void (Transaction::*handler)();
+};
+
+constexpr std::array requestTypes{
+    RequestType{requestType::add, &Transaction::addPlugIns},
+    RequestType{requestType::remove, &Transaction::removePlugIns},
+    RequestType{requestType::bulk, &Transaction::bulkPlugIns},
+    RequestType{requestType::match, &Transaction::matchPlugIns},
+    RequestType{requestType::ready, &Transaction::readyPlugIns},
+    RequestType{requestType::access, &Transaction::accessPlugIns},
+    RequestType{requestType::annotate, &Transaction::annotatePlugIns},
+    RequestType{requestType::bulkAnnotate, &Transaction::bulkAnnotatePlugIns},
+    RequestType{requestType::lock, &Transaction::lockDownPlugIns},
+    RequestType{requestType::find, &Transaction::findPlugIn},
+};
+
+} // namespace
+
+Transaction::Transaction(const platform::ReceivedMessage& message, std::shared_ptr<ZBDQmxClient> client)
+    : _client(std::move(client)), _request(*message.content.dictionary()), _reply(platform::createReply(message)) {}
+
+std::shared_ptr<Transaction> Transaction::initWithRequest(const platform::ReceivedMessage& message,
+                                                          std::shared_ptr<ZBDQmxClient> client) {
+    return std::shared_ptr<Transaction>(new Transaction(message, std::move(client)));
+}
+
+const std::shared_ptr<ZBDServer>& Transaction::server() const { return _client->server(); }
+
+std::shared_ptr<platform::Connection> Transaction::connection() const { return _client->connection(); }
+
+void Transaction::dispatch() {
+    const auto type = _request.string(key::request);
+    _version = _request.uint64(key::version).value_or(0);
+    if (!zembra::isSupportedVersion(_version)) {
+        return fail(code::version, platform::format("unsupported protocol version %d (current %d)", _version,
+                                                    zembra::currentVersion));
+    }
+    if (!_client->acceptWork()) return;
+
+    const std::optional<std::string> typeText(type);
+    log::ops().debug("client %d requested %{public}s", _client->pid(), typeText);
+    platform::trace::request(_client->pid(), typeText ? typeText->c_str() : nullptr);
+    if (!type) return fail(code::malformed, "invalid request format (missing type)");
+    for (const RequestType& known : requestTypes) {
+        if (known.name == *type) return (this->*known.handler)();
+    }
+    fail(code::malformed, "unrecognized request");
+}
+
+void Transaction::done() {
+    if (platform::trace::requestOutputEnabled()) {
+        platform::trace::requestOutput(_client->pid(), Value(_reply.content).description().c_str());
+    }
+    if (const auto peer = connection()) peer->send(_reply);
+}
+
+void Transaction::fail(std::int64_t errorCode, std::string_view message) {
+    reply().set(key::errorcode, static_cast<std::uint64_t>(errorCode));
+    reply().set(key::error, message);
+    done();
+}
+
+void Transaction::fail(std::int64_t errorCode, const platform::Error& error) {
+    const bool own = error.domain == zembra::errorDomain;
+    fail(own ? error.code : errorCode, error.text());
+}
+
+bool Transaction::marshalPaths(const PathCallback& callback) {
+    const auto paths = _request.array(key::paths);
+    if (!paths) {
+        fail(code::malformed, "invalid request format");
+        return false;
+    }
+    for (const Value& element : *paths) {
+        const auto text = element.string();
+        if (!text) {
+            fail(code::malformed, "invalid request format");
+            return false;
+        }
+        const std::string path(*text);
+        if (!path.starts_with('/')) {
+            fail(code::badPath, platform::format("absolute path required: %s", path));
+            return false;
+        }
+        const auto resolved = server()->platform().files.realPath(path, maximumPath);
+        if (!callback(resolved ? *resolved : path, static_cast<bool>(resolved))) return false;
+    }
+    return true;
+}
+
+bool Transaction::processPaths(const PathCallback& callback) {
+    if (!marshalPaths(callback)) return false;
+    done();
+    return true;
+}
+
+bool Transaction::processUuidList(const PlugInCallback& callback) {
+    const auto uuids = _request.array(key::uuids);
+    if (!uuids) {
+        fail(code::malformed, "invalid request format (uuid)");
+        return false;
+    }
+    std::optional<Array> paths;
+    if (const Value value = _request[key::paths]) {
+        paths = value.array();
+        if (!paths) {
+            log::traffic().notice("Paths present but not an array (ignoring values)");
+        } else if (paths->size() != uuids->size()) {
+            log::traffic().notice("Paths present but has different count than UUIDs (ignoring)");
+            paths.reset();
+        }
+    }
+    for (std::size_t i = 0; i < uuids->size(); ++i) {
+        const Value element = (*uuids)[i];
+        if (element.kind() != platform::Kind::uuid) {
+            fail(code::malformed, "invalid request (bad uuid array)");
+            return false;
+        }
+        const auto uuid = element.uuid();
+        if (!uuid) {
+            fail(code::malformed, "invalid request (uuid allocation failure)");
+            return false;
+        }
+        const auto plugIn = plugInOfList(*uuid, paths ? &*paths : nullptr, i);
+        if (!plugIn) {
+            fail(code::malformed, "no such plugin (uuid not found)");
+            return false;
+        }
+        if (!callback(plugIn)) return false;
+    }
+    return true;
+}
+
+ZBDPlugInRef Transaction::plugInOfList(const UUID& uuid, const Array* paths, std::size_t index) {
+    if (auto plugIn = server()->findPlugIn(uuid)) return plugIn;
+    if (paths == nullptr) return nullptr;
+    log::traffic().info("Failed to find plugin by %{uuid_t}.16P", uuid);
+    const auto path = (*paths)[index].string();
+    if (!path) return nullptr;
+    log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", uuid, *path);
+    return server()->findPlugInAtPath(platform::URL::file(*path));
+}
+
+} // namespace zbd

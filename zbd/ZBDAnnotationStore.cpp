@@ -1,0 +1,121 @@
+#include "zbd/ZBDAnnotationStore.h"
+
+#include "Zembra/ZBLog.h"
+#include "Zembra/ZBUtilities.h"
+#include "platform/Format.h"
+#include "platform/TracePoints.h"
+#include "zbd/ZBDPlugIn.h"
+
+namespace zbd {
+
+namespace log = zembra::log;
+using platform::Dictionary;
+using platform::Error;
+using platform::MutableDictionary;
+using platform::URL;
+using platform::Value;
+
+namespace {
+
+constexpr std::string_view versionKey = "version";
+constexpr std::string_view dataKey = "data";
+
+} // namespace
+
+ZBDAnnotationStore::ZBDAnnotationStore(platform::Platform& platform, URL url)
+    : _platform(platform), _annotationsURL(std::move(url)) {}
+
+std::unique_ptr<ZBDAnnotationStore> ZBDAnnotationStore::initWithDatabase(platform::Platform& platform,
+                                                                         const std::optional<std::string>& path) {
+    std::unique_ptr<ZBDAnnotationStore> store(
+        new ZBDAnnotationStore(platform, path ? URL::file(*path) : defaultDatabaseURL(platform)));
+    Error error;
+    if (store->loadDb(store->_annotationsURL, error)) return store;
+    if (error.code != platform::fileReadNoSuchFileCode) {
+        log::ops().error("unable to load annotation database:%{public}@ error:%{public}@ (resetting)",
+                         store->_annotationsURL, error);
+    }
+    if (store->loadDb(containerURL(platform), error)) {
+        log::ops().info("migrating shared annotations");
+        if (!store->saveDb(error)) {
+            log::ops().error("unable to save migrated annotations to %{public}@ error:%{public}@",
+                             store->_annotationsURL, error);
+        }
+    }
+    return store;
+}
+
+std::optional<Dictionary> ZBDAnnotationStore::annotationForIdentifier(std::string_view annotationKey) const {
+    return _annotations.dictionary(annotationKey);
+}
+
+std::optional<Dictionary> ZBDAnnotationStore::annotationForPlugIn(const ZBDPlugIn& plugIn) const {
+    return annotationForIdentifier(plugIn.annotationKey());
+}
+
+void ZBDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation, const ZBDPlugIn& plugIn) {
+    const std::string key = plugIn.annotationKey();
+    if (annotation) {
+        // A new dictionary each time: requests may still be reading the stored one.
+        auto merged = MutableDictionary::copyOf(annotationForIdentifier(key).value_or(Dictionary()));
+        merged.merge(*annotation);
+        _annotations.set(key, merged);
+    } else {
+        _annotations.remove(key);
+    }
+    Error error;
+    if (!saveDb(error)) {
+        log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, error);
+    }
+}
+
+bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
+    const auto load = [&]() -> platform::Failure {
+        auto bytes = _platform.files.read(url.path(), maximumFileSize);
+        if (!bytes) return bytes.error();
+        auto content = platform::decodePropertyList(*bytes);
+        if (!content) return content.error();
+        const Dictionary database = content->dictionary().value_or(Dictionary());
+        const auto version = database[versionKey].integerValue().value_or(0);
+        if (version != databaseVersion) {
+            return zembra::errorWithCode(zembra::code::version,
+                                         platform::format("found database version %d needed version %d", version,
+                                                          databaseVersion));
+        }
+        _annotations = MutableDictionary::copyOf(database.dictionary(dataKey).value_or(Dictionary()));
+        return std::nullopt;
+    };
+    auto failure = load();
+    if (!failure) return true;
+    error = std::move(*failure);
+    platform::trace::dbLoad(error.domain.c_str(), static_cast<std::uint64_t>(error.code));
+    return false;
+}
+
+bool ZBDAnnotationStore::saveDb(Error& error) const {
+    auto bytes = platform::encodeXML(Dictionary{{versionKey, databaseVersion}, {dataKey, _annotations}});
+    if (!bytes) {
+        error = bytes.error();
+        return false;
+    }
+    auto failure = _platform.files.writeAtomically(_annotationsURL.path(), *bytes);
+    if (!failure) return true;
+    error = std::move(*failure);
+    return false;
+}
+
+URL ZBDAnnotationStore::defaultDatabaseURL(platform::Platform& platform) { return globalURL(platform); }
+
+URL ZBDAnnotationStore::globalURL(platform::Platform& platform) {
+    return URL::file(platform.files.locate("/var/db/Zembra-Annotations"));
+}
+
+URL ZBDAnnotationStore::containerURL(platform::Platform& platform) {
+    auto path = platform.containers.userContainer("com.nordane.zbd");
+    if (path) return URL::file(*path);
+    const auto number = static_cast<std::uint64_t>(path.error().code);
+    log::ops().error("failed to get storage container: error=%llu", number);
+    zembra::fatalInternalError(platform::format("unable to locate user container: error %llu", number));
+}
+
+} // namespace zbd

@@ -1,0 +1,56 @@
+#pragma once
+
+#include "platform/Platform.h"
+#include "platform/PropertyList.h"
+#include "platform/Url.h"
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace zbd {
+
+class ZBDPlugIn;
+
+/// Keeps the user's annotations of plug-ins in one small property-list file that survives restarts.
+/// Takes no lock: the database calls it on its own queue, or while no change can happen.
+class ZBDAnnotationStore {
+public:
+    /// The one format that is read and written; older files start afresh.
+    static constexpr int databaseVersion = 16;
+    /// More than any user's annotations can come to, and little enough to read into memory without thought.
+    static constexpr std::size_t maximumFileSize = 64U << 20U;
+
+    /// A store with its table loaded, migrated or empty. `path` is taken as written; none means the default location.
+    /// Never writes unless it migrates. Ends the process when the container service fails.
+    static std::unique_ptr<ZBDAnnotationStore> initWithDatabase(platform::Platform& platform,
+                                                               const std::optional<std::string>& path);
+
+    std::optional<platform::Dictionary> annotationForIdentifier(std::string_view annotationKey) const;
+    std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn) const;
+
+    /// Merges `annotation` into what is stored for the plug-in, or removes that when it is none; then saves. A failure
+    /// to save is logged; the change stays in memory and goes out with the next one.
+    void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
+
+    /// False, with `error` set, when no table could be loaded; the present table then is as it was.
+    bool loadDb(const platform::URL& url, platform::Error& error);
+    bool saveDb(platform::Error& error) const;
+
+    const platform::URL& annotationsURL() const { return _annotationsURL; }
+    const platform::MutableDictionary& annotations() const { return _annotations; }
+
+    static platform::URL defaultDatabaseURL(platform::Platform& platform);
+    static platform::URL globalURL(platform::Platform& platform);
+    static platform::URL containerURL(platform::Platform& platform);
+
+private:
+    ZBDAnnotationStore(platform::Platform& platform, platform::URL url);
+
+    platform::Platform& _platform;
+    platform::URL _annotationsURL;
+    platform::MutableDictionary _annotations; // annotation key to annotation
+};
+
+} // namespace zbd

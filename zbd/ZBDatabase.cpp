@@ -1,0 +1,227 @@
+#include "zbd/ZBDatabase.h"
+
+#include "Zembra/ZBLog.h"
+#include "Zembra/ZBProtocol.h"
+#include "Zembra/ZBUtilities.h"
+
+#include <algorithm>
+
+namespace zbd {
+
+namespace log = zembra::log;
+using platform::Dictionary;
+using platform::PlugInProxyRef;
+using platform::URL;
+using platform::UUID;
+using platform::Value;
+
+namespace {
+
+std::optional<std::string> pathOf(const std::optional<URL>& url) {
+    return url ? std::optional(url->path()) : std::nullopt;
+}
+
+/// The election that a pattern asks for, or none when the pattern is more than "equals".
+std::optional<std::string> electionOfPattern(const Value& pattern) {
+    const auto text = pattern.string();
+    if (!text || text->empty()) return std::nullopt;
+    const char first = text->front();
+    if (first == '=') return std::string(text->substr(1));
+    const bool alphanumeric =
+        (first >= '0' && first <= '9') || (first >= 'A' && first <= 'Z') || (first >= 'a' && first <= 'z');
+    if (alphanumeric) return std::string(*text);
+    return std::nullopt;
+}
+
+} // namespace
+
+ZBDatabase::ZBDatabase(platform::Platform& platform) : _platform(platform), _workspace(platform.registry) {}
+
+bool ZBDatabase::initWithDatabase(const std::optional<std::string>& annotationDatabasePath) {
+    _annotations = ZBDAnnotationStore::initWithDatabase(_platform, annotationDatabasePath);
+    if (!_annotations) return false;
+    _sync = _platform.queues.makeSerial("ZBDatabase");
+    _workspace.addObserver(weak_from_this());
+    _regionObserver =
+        _platform.locale.observeChanges(_platform.runLoop.mainQueue(), [self = weak_from_this(), sync = _sync] {
+            log::ops().notice("locale change detected; purging cache");
+            sync->async([self] {
+                if (const auto database = self.lock()) database->purgeCachesToLimit(0);
+            });
+        });
+    return true;
+}
+
+ZBDPlugInRef ZBDatabase::cachedPlugIn(const UUID& uuid) {
+    const auto found = _cache.find(uuid);
+    if (found == _cache.end()) return nullptr;
+    if (found->second->isStillValid()) return found->second;
+    _cache.erase(found);
+    return nullptr;
+}
+
+ZBDPlugInRef ZBDatabase::plugInForProxy(const PlugInProxyRef& proxy) {
+    return _sync->sync([&]() -> ZBDPlugInRef {
+        // A proxy without a UUID gives a record with a random one: never found again, so made anew each time.
+        if (proxy->uuid) {
+            if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
+        }
+        return createPlugInForProxy(proxy);
+    });
+}
+
+ZBDPlugInRef ZBDatabase::createPlugInForProxy(const PlugInProxyRef& proxy) {
+    _sync->assertCurrent();
+    log::ops().notice("createPlugInForProxy");
+    auto plugIn = ZBDPlugIn::initWithCXData(_platform, proxy);
+    if (!plugIn) return nullptr;
+    if (plugIn->hasEntitlement(zembra::entitlement::autoElectPlugIn)) autoElect(*plugIn);
+    purgeCachesToLimit(_cacheLimit);
+    _cache.insert_or_assign(*plugIn->uuid(), plugIn);
+    return plugIn;
+}
+
+void ZBDatabase::purgeCachesToLimit(std::uint32_t limit) {
+    _sync->assertCurrent();
+    if (_cache.size() <= limit) return;
+    log::ops().info("purging cache for %d > %d", _cache.size(), limit);
+    _cache.clear();
+    _workspace.clearSchemaCaches();
+}
+
+std::size_t ZBDatabase::cacheCount() {
+    return _sync->sync([&] { return _cache.size(); });
+}
+
+ZBDPlugInRef ZBDatabase::findPlugIn(const UUID& uuid) {
+    return _sync->sync([&]() -> ZBDPlugInRef {
+        if (auto cached = cachedPlugIn(uuid)) return cached;
+        if (const auto proxy = _workspace.plugInForUUID(uuid)) return createPlugInForProxy(proxy);
+        log::ops().info("Catalix cannot find plug-in with UUID:%{public}@", uuid);
+        return nullptr;
+    });
+}
+
+ZBDPlugInRef ZBDatabase::findPlugInAtPath(const URL& url) {
+    const auto proxy = _workspace.plugInForURL(url);
+    if (!proxy) {
+        log::ops().info("Catalix cannot find plug-in at path:%@", url.path());
+        return nullptr;
+    }
+    return proxy->uuid ? findPlugIn(*proxy->uuid) : plugInForProxy(proxy);
+}
+
+std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::plugInsWithinApplication(const URL& url) {
+    const auto application = _workspace.applicationForURL(url);
+    if (!application) return std::nullopt;
+    const auto proxies = _workspace.plugInsOfApplication(*application);
+    if (proxies.empty()) return std::nullopt;
+    std::vector<ZBDPlugInRef> plugIns;
+    for (const PlugInProxyRef& proxy : proxies) {
+        if (auto plugIn = plugInForProxy(proxy)) plugIns.push_back(std::move(plugIn));
+    }
+    return plugIns;
+}
+
+std::optional<ZBDatabase::ElectionValues> ZBDatabase::electionPrefilter(const Dictionary& query) {
+    const Value rule = query[zembra::ruleKey::userElection];
+    if (const auto patterns = rule.array()) {
+        ElectionValues values;
+        for (const Value& pattern : *patterns) {
+            auto value = electionOfPattern(pattern);
+            if (!value) return std::nullopt;
+            values.push_back(std::move(*value));
+        }
+        return values;
+    }
+    if (auto value = electionOfPattern(rule)) return ElectionValues{std::move(*value)};
+    return std::nullopt;
+}
+
+bool ZBDatabase::acceptByElection(const ElectionValues& elections, const std::string& identifier,
+                                  const std::optional<Dictionary>& entitlements) const {
+    const auto annotation = _annotations->annotationForIdentifier(identifier);
+    const Value stored = annotation ? (*annotation)[zembra::annotationKey::election] : Value();
+    std::int64_t election = 0;
+    if (stored) {
+        election = stored.integerValue().value_or(0);
+    } else if (entitlements) {
+        election = (*entitlements)[zembra::entitlement::autoElectPlugIn].booleanValue().value_or(false) ? 1 : 0;
+    }
+    const std::string text = std::to_string(election & 255);
+    return std::find(elections.begin(), elections.end(), text) != elections.end();
+}
+
+std::optional<ZBDPlugInSet> ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
+    std::optional<std::vector<PlugInProxyRef>> proxies;
+    if (!query || query->empty()) {
+        proxies = _workspace.installedPlugIns();
+        log::cx().debug("%d installedPlugins: %@", proxies ? proxies->size() : 0, proxies);
+    } else {
+        const auto elections = electionPrefilter(*query);
+        proxies = _workspace.plugInsMatching(
+            *query, [&](const std::string& identifier, const std::optional<Dictionary>& entitlements) {
+                // A replacing plug-in shares the annotation of the one it replaces.
+                const auto replaced = entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
+                const std::string key(replaced.value_or(identifier));
+                const bool accepted = !elections || acceptByElection(*elections, key, entitlements);
+                if (elections) log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);
+                return accepted;
+            });
+        log::cx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, *query, proxies);
+    }
+
+    const std::size_t countBefore = cacheCount();
+    if (!proxies) return std::nullopt;
+    ZBDPlugInSet plugIns;
+    for (const PlugInProxyRef& proxy : *proxies) {
+        if (!proxy->bundleURL) {
+            log::ops().info("skipping cx proxy %@ with nil bundleURL", proxy);
+            continue;
+        }
+        if (const auto& container = proxy->containingBundle) {
+            if (!container->isApplication) {
+                log::ops().error("CX reported containingBundle is not an application");
+                continue;
+            }
+            if (container->isPlaceholder) {
+                log::ops().info("skipping cx proxy %@ because its app is a placeholder", proxy);
+                continue;
+            }
+        }
+        if (auto plugIn = plugInForProxy(proxy)) plugIns.insert(std::move(plugIn));
+    }
+    log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns.size(), countBefore, cacheCount());
+    return plugIns;
+}
+
+platform::Failure ZBDatabase::addPlugIn(const URL& url) {
+    if (_workspace.registerPlugIn(url)) return std::nullopt;
+    return zembra::errorWithCode(zembra::code::registrationFailed, "Catalix failed to register the plug-in");
+}
+
+platform::Failure ZBDatabase::removePlugIn(const URL& url) {
+    if (_workspace.unregisterPlugIn(url)) return std::nullopt;
+    return zembra::errorWithCode(zembra::code::registrationFailed, "Catalix failed to deregister the plug-in");
+}
+
+void ZBDatabase::pluginsDidInstall(const std::vector<PlugInProxyRef>& proxies) {
+    for (const PlugInProxyRef& proxy : proxies) {
+        log::ops().notice("plug-in INSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier, proxy->plugInIdentifier,
+                          proxy->bundleVersion, proxy->uuid, pathOf(proxy->bundleURL));
+    }
+}
+
+void ZBDatabase::pluginsWillUninstall(const std::vector<PlugInProxyRef>& proxies) {
+    _sync->sync([&] {
+        for (const PlugInProxyRef& proxy : proxies) {
+            log::ops().notice("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier,
+                              proxy->plugInIdentifier, proxy->bundleVersion, proxy->uuid, pathOf(proxy->bundleURL));
+            if (proxy->uuid) _cache.erase(*proxy->uuid);
+        }
+    });
+    // Outside the queue, so that the delegate may use the database.
+    if (const auto receiver = delegate()) receiver->removedPlugIns(proxies);
+}
+
+} // namespace zbd

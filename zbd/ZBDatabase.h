@@ -1,0 +1,97 @@
+#pragma once
+
+#include "platform/Platform.h"
+#include "zbd/ZBDAnnotationStore.h"
+#include "zbd/ZBDPlugIn.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+namespace zbd {
+
+using ZBDPlugInRef = std::shared_ptr<ZBDPlugIn>;
+using ZBDPlugInSet = std::unordered_set<ZBDPlugInRef, zembra::ZBPlugInHash, zembra::ZBPlugInEqual>;
+
+/// Told of uninstalled plug-ins after the database has let go of them. Called on the registry's thread.
+class ZBDatabaseDelegate {
+public:
+    virtual ~ZBDatabaseDelegate() = default;
+    virtual void removedPlugIns(const std::vector<platform::PlugInProxyRef>& proxies) = 0;
+};
+
+/// The daemon's view of the installed plug-ins: turns the registry's proxies into cached records, answers lookups, and
+/// owns the user's annotations. The record cache and the annotation store belong to the database queue; lookups enter
+/// it synchronously, so none may be made from work that runs on it.
+class ZBDatabase : public platform::RegistryObserver, public std::enable_shared_from_this<ZBDatabase> {
+public:
+    static constexpr std::uint32_t defaultCacheLimit = 1'000'000;
+
+    /// Reads the annotations and begins to follow the registry and the locale. The object must be held by a shared
+    /// pointer. False when it cannot work at all.
+    bool initWithDatabase(const std::optional<std::string>& annotationDatabasePath);
+
+    ZBDPlugInRef plugInForProxy(const platform::PlugInProxyRef& proxy);
+    /// On the database queue only.
+    ZBDPlugInRef createPlugInForProxy(const platform::PlugInProxyRef& proxy);
+    /// All or nothing: a cache of more than `limit` records is emptied. On the database queue only.
+    void purgeCachesToLimit(std::uint32_t limit);
+
+    /// The records of the plug-ins that may match `query`; of all installed ones when it is absent or empty. The
+    /// caller judges them by its rules. None when the registry does not answer.
+    std::optional<ZBDPlugInSet> findPlugIns(const std::optional<platform::Dictionary>& query);
+    ZBDPlugInRef findPlugIn(const platform::UUID& uuid);
+    ZBDPlugInRef findPlugInAtPath(const platform::URL& url);
+    /// None when the application is unknown or has no plug-ins.
+    std::optional<std::vector<ZBDPlugInRef>> plugInsWithinApplication(const platform::URL& url);
+
+    platform::Failure addPlugIn(const platform::URL& url);
+    platform::Failure removePlugIn(const platform::URL& url);
+
+    // ZBDatabaseAnnotations.cpp
+    std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn);
+    void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
+    /// Tells every host, on this machine, that annotations or holds changed. Any thread.
+    void notifyAnnotationChange();
+    /// Elects a plug-in that asks for it, unless the user decided otherwise. On the database queue only.
+    void autoElect(const ZBDPlugIn& plugIn);
+
+    // platform::RegistryObserver
+    void pluginsDidInstall(const std::vector<platform::PlugInProxyRef>& proxies) override;
+    void pluginsWillUninstall(const std::vector<platform::PlugInProxyRef>& proxies) override;
+
+    std::uint32_t cacheLimit() const { return _cacheLimit; }
+    /// Before the first request.
+    void setCacheLimit(std::uint32_t limit) { _cacheLimit = limit; }
+    std::shared_ptr<ZBDatabaseDelegate> delegate() const { return _delegate.lock(); }
+    /// Before the first notice. Held weakly.
+    void setDelegate(std::weak_ptr<ZBDatabaseDelegate> delegate) { _delegate = std::move(delegate); }
+
+    platform::Platform& platform() const { return _platform; }
+
+protected:
+    explicit ZBDatabase(platform::Platform& platform);
+
+private:
+    using ElectionValues = std::vector<std::string>;
+    static std::optional<ElectionValues> electionPrefilter(const platform::Dictionary& query);
+    bool acceptByElection(const ElectionValues& elections, const std::string& identifier,
+                          const std::optional<platform::Dictionary>& entitlements) const;
+    ZBDPlugInRef cachedPlugIn(const platform::UUID& uuid);
+    std::size_t cacheCount();
+
+    platform::Platform& _platform;
+    std::uint32_t _cacheLimit = defaultCacheLimit;
+    std::weak_ptr<ZBDatabaseDelegate> _delegate;
+    platform::Registry& _workspace;
+    std::unique_ptr<ZBDAnnotationStore> _annotations; // changed on _sync; read there and by the service queue
+    std::shared_ptr<platform::WorkQueue> _sync;
+    std::unordered_map<platform::UUID, ZBDPlugInRef> _cache; // on _sync only
+    std::unique_ptr<platform::LocaleObservation> _regionObserver;
+};
+
+} // namespace zbd
