@@ -1,0 +1,739 @@
+#include "platform/PropertyList.h"
+
+#include "platform/linux/Utf8.h"
+
+#include <algorithm>
+#include <bit>
+#include <charconv>
+#include <cmath>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+
+namespace platform {
+
+namespace {
+
+/// From this many keys on a dictionary keeps a sorted index; below it a walk is faster.
+constexpr std::size_t indexThreshold = 16;
+
+/// A log line stays readable, and no peer fills the log with one message.
+constexpr std::size_t maximumDescriptionLength = 4096;
+constexpr std::string_view ellipsis = "…";
+
+/// How many bytes of data a description shows.
+constexpr std::size_t describedDataBytes = 16;
+
+void require(bool condition, const char* text) noexcept {
+    if (condition) return;
+    std::fprintf(stderr, "%s\n", text);
+    std::abort();
+}
+
+} // namespace
+
+namespace detail {
+
+struct Node {
+    std::atomic<std::uint32_t> references{1};
+};
+
+/// The bytes follow the node in the same allocation.
+struct BytesNode : Node {
+    explicit BytesNode(std::size_t count) noexcept : length(count) {}
+    const char* bytes() const noexcept { return reinterpret_cast<const char*>(this + 1); }
+    std::string_view view() const noexcept { return {bytes(), length}; }
+
+    const std::size_t length;
+
+    static BytesNode* make(std::string_view bytes) {
+        void* storage = ::operator new(sizeof(BytesNode) + bytes.size());
+        auto* node = new (storage) BytesNode(bytes.size());
+        if (!bytes.empty()) std::memcpy(reinterpret_cast<char*>(node + 1), bytes.data(), bytes.size());
+        return node;
+    }
+    static void destroy(BytesNode* node) noexcept {
+        node->~BytesNode();
+        ::operator delete(node);
+    }
+};
+
+struct UUIDNode : Node {
+    explicit UUIDNode(const UUID& value) noexcept : uuid(value) {}
+    const UUID uuid;
+};
+
+struct ContainerNode : Node {
+    explicit ContainerNode(Kind containerKind) noexcept : kind(containerKind) {}
+    ContainerNode* next = nullptr; // links containers whose last reference is gone
+    const Kind kind;
+};
+
+struct ArrayNode : ContainerNode {
+    explicit ArrayNode(std::vector<Value> content = {}) noexcept
+        : ContainerNode(Kind::array), values(std::move(content)) {}
+    std::vector<Value> values;
+};
+
+struct DictionaryNode : ContainerNode {
+    DictionaryNode() noexcept : ContainerNode(Kind::dictionary) {}
+
+    std::vector<Dictionary::Entry> entries;
+    std::vector<std::uint32_t> index; // positions in `entries` by `before`; empty up to `indexThreshold` keys
+
+    /// Any total order will do: comparing lengths first settles most pairs without looking at the bytes.
+    static bool before(std::string_view left, std::string_view right) noexcept {
+        if (left.size() != right.size()) return left.size() < right.size();
+        return left < right;
+    }
+
+    std::vector<std::uint32_t>::const_iterator lowerBound(std::string_view key) const noexcept {
+        return std::lower_bound(
+            index.begin(), index.end(), key,
+            [this](std::uint32_t position, std::string_view wanted) { return before(name(position), wanted); });
+    }
+
+    std::optional<std::size_t> find(std::string_view key) const noexcept {
+        if (index.empty()) {
+            for (std::size_t i = 0; i < entries.size(); ++i)
+                if (name(i) == key) return i;
+            return std::nullopt;
+        }
+        const auto place = lowerBound(key);
+        if (place == index.end() || name(*place) != key) return std::nullopt;
+        return *place;
+    }
+
+    void set(std::string_view key, Value value);
+    void erase(std::size_t position) noexcept;
+
+    /// Sorts all keys anew; false when two are equal.
+    bool rebuildIndex();
+
+    std::string_view name(std::size_t position) const noexcept;
+};
+
+/// Reaches into values for what their public operations need not show.
+struct Contents {
+    static Kind kind(const Value& value) noexcept { return value._kind; }
+    static std::uint64_t bits(const Value& value) noexcept { return value._bits; }
+    static bool isUnsigned(const Value& value) noexcept { return value._unsigned; }
+    static Node* node(const Value& value) noexcept {
+        return reinterpret_cast<Node*>(static_cast<std::uintptr_t>(value._bits));
+    }
+    static const BytesNode& bytes(const Value& value) noexcept { return *static_cast<BytesNode*>(node(value)); }
+    static ArrayNode& array(const Value& value) noexcept { return *static_cast<ArrayNode*>(node(value)); }
+    static DictionaryNode& dictionary(const Value& value) noexcept {
+        return *static_cast<DictionaryNode*>(node(value));
+    }
+
+    /// Takes the reference out of `value`, which becomes absent.
+    static Node* take(Value& value) noexcept {
+        Node* taken = value.hasNode() ? node(value) : nullptr;
+        value._kind = Kind::none;
+        return taken;
+    }
+};
+
+std::string_view DictionaryNode::name(std::size_t position) const noexcept {
+    return Contents::bytes(entries[position].key).view();
+}
+
+void DictionaryNode::set(std::string_view key, Value value) {
+    require(static_cast<bool>(value), "an absent value cannot be in a dictionary");
+    if (const auto position = find(key)) {
+        std::swap(entries[*position].value, value); // the old value goes last: `key` may point into it
+        return;
+    }
+    Value name(key);
+    if (!index.empty()) {
+        const auto place = lowerBound(key);
+        index.insert(place, static_cast<std::uint32_t>(entries.size()));
+    }
+    entries.push_back({std::move(name), std::move(value)});
+    if (index.empty() && entries.size() > indexThreshold) rebuildIndex();
+}
+
+void DictionaryNode::erase(std::size_t position) noexcept {
+    if (!index.empty()) {
+        index.erase(lowerBound(name(position)));
+        for (auto& later : index)
+            if (later > position) --later;
+    }
+    entries.erase(entries.begin() + static_cast<std::ptrdiff_t>(position));
+    if (entries.size() <= indexThreshold) index.clear();
+}
+
+bool DictionaryNode::rebuildIndex() {
+    index.clear();
+    if (entries.size() <= indexThreshold) {
+        std::string_view names[indexThreshold];
+        for (std::size_t i = 0; i < entries.size(); ++i) {
+            names[i] = name(i);
+            for (std::size_t j = 0; j < i; ++j)
+                if (names[j] == names[i]) return false;
+        }
+        return true;
+    }
+    require(entries.size() <= UINT32_MAX, "a dictionary holds too many keys");
+    index.resize(entries.size());
+    for (std::size_t i = 0; i < index.size(); ++i) index[i] = static_cast<std::uint32_t>(i);
+    std::sort(index.begin(), index.end(),
+              [this](std::uint32_t left, std::uint32_t right) { return before(name(left), name(right)); });
+    return std::adjacent_find(index.begin(), index.end(), [this](std::uint32_t left, std::uint32_t right) {
+               return name(left) == name(right);
+           }) == index.end();
+}
+
+namespace {
+
+/// True when that was the last reference.
+bool drop(Node* node) noexcept {
+    // The only holder needs no atomic subtraction: nobody else can take a reference meanwhile.
+    if (node->references.load(std::memory_order_acquire) == 1) return true;
+    return node->references.fetch_sub(1, std::memory_order_acq_rel) == 1;
+}
+
+void destroyLeaf(Kind kind, Node* node) noexcept {
+    if (kind == Kind::uuid)
+        delete static_cast<UUIDNode*>(node);
+    else
+        BytesNode::destroy(static_cast<BytesNode*>(node));
+}
+
+} // namespace
+
+void retain(Node* node) noexcept { node->references.fetch_add(1, std::memory_order_relaxed); }
+
+void release(Kind kind, Node* node) noexcept {
+    if (!drop(node)) return;
+    if (kind < Kind::array) return destroyLeaf(kind, node);
+
+    // Containers are emptied one after another instead of one within another: however deep they nest, the stack
+    // stays as it is. The list needs no memory, so this cannot fail.
+    auto* pending = static_cast<ContainerNode*>(node);
+    const auto discard = [&pending](Value& value) {
+        const Kind valueKind = value.kind();
+        Node* taken = Contents::take(value);
+        if (taken == nullptr || !drop(taken)) return;
+        if (valueKind < Kind::array) return destroyLeaf(valueKind, taken);
+        auto* container = static_cast<ContainerNode*>(taken);
+        container->next = pending;
+        pending = container;
+    };
+    while (pending != nullptr) {
+        ContainerNode* container = pending;
+        pending = container->next;
+        if (container->kind == Kind::array) {
+            auto* array = static_cast<ArrayNode*>(container);
+            for (auto& value : array->values) discard(value);
+            delete array;
+        } else {
+            auto* dictionary = static_cast<DictionaryNode*>(container);
+            for (auto& entry : dictionary->entries) {
+                discard(entry.key);
+                discard(entry.value);
+            }
+            delete dictionary;
+        }
+    }
+}
+
+} // namespace detail
+
+using detail::Contents;
+
+namespace {
+
+std::uint64_t bitsOf(detail::Node* node) noexcept {
+    return static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(node));
+}
+
+// 2^63 and 2^64 as reals; both are exact.
+constexpr double signedEnd = 9223372036854775808.0;
+constexpr double unsignedEnd = 18446744073709551616.0;
+
+/// An integer is `sign` times a magnitude, or a real that is none; so that unlike numbers compare without rounding.
+struct Integer {
+    bool isNegative;
+    std::uint64_t bits; // two's complement
+    friend bool operator==(const Integer&, const Integer&) = default;
+};
+
+/// None for reals with a fraction or beyond 64 bits, which equal no integer.
+std::optional<Integer> asInteger(const Value& value) noexcept {
+    if (const auto real = value.real()) {
+        if (!(*real >= -signedEnd && *real < unsignedEnd) || std::trunc(*real) != *real) return std::nullopt;
+        if (*real < 0) return Integer{true, static_cast<std::uint64_t>(static_cast<std::int64_t>(*real))};
+        return Integer{false, static_cast<std::uint64_t>(*real)};
+    }
+    const bool isNegative = !Contents::isUnsigned(value) && static_cast<std::int64_t>(Contents::bits(value)) < 0;
+    return Integer{isNegative, Contents::bits(value)};
+}
+
+bool numbersEqual(const Value& left, const Value& right) noexcept {
+    const auto leftReal = left.real();
+    const auto rightReal = right.real();
+    if (leftReal && rightReal) return *leftReal == *rightReal;
+    const auto leftInteger = asInteger(left);
+    return leftInteger && leftInteger == asInteger(right);
+}
+
+/// Compares everything but the contents of containers, of which only kinds and sizes are looked at.
+bool outsidesEqual(const Value& left, const Value& right) noexcept {
+    if (left.isNumber()) return right.isNumber() && numbersEqual(left, right);
+    if (left.kind() != right.kind()) return false;
+    switch (left.kind()) {
+    case Kind::date:
+        return left.date()->seconds == right.date()->seconds;
+    case Kind::string:
+    case Kind::data:
+        return Contents::bytes(left).view() == Contents::bytes(right).view();
+    case Kind::uuid:
+        return left.uuid() == right.uuid();
+    case Kind::array:
+        return Contents::array(left).values.size() == Contents::array(right).values.size();
+    case Kind::dictionary:
+        return Contents::dictionary(left).entries.size() == Contents::dictionary(right).entries.size();
+    default:
+        return true;
+    }
+}
+
+} // namespace
+
+Value::Value(bool value) noexcept : _bits(value ? 1 : 0), _kind(Kind::boolean), _unsigned(false) {}
+
+Value::Value(Signed value) noexcept
+    : _bits(static_cast<std::uint64_t>(value.value)), _kind(Kind::integer), _unsigned(false) {}
+
+Value::Value(Unsigned value) noexcept
+    : _bits(value.value), _kind(Kind::integer), _unsigned(value.value > static_cast<std::uint64_t>(INT64_MAX)) {}
+
+Value::Value(double value) noexcept : _bits(std::bit_cast<std::uint64_t>(value)), _kind(Kind::real), _unsigned(false) {}
+
+Value::Value(Date value) noexcept
+    : _bits(std::bit_cast<std::uint64_t>(value.seconds)), _kind(Kind::date), _unsigned(false) {}
+
+Value::Value(Kind kind, detail::Node* node) noexcept : _bits(bitsOf(node)), _kind(kind), _unsigned(false) {}
+
+Value::Value(std::string_view value) : Value(Kind::string, detail::BytesNode::make(value)) {}
+
+Value Value::data(std::string_view bytes) { return Value(Kind::data, detail::BytesNode::make(bytes)); }
+
+Value::Value(const UUID& value) : Value(Kind::uuid, new detail::UUIDNode(value)) {}
+
+Value::Value(const Array& value) : Value(value._storage) {}
+
+Value::Value(const Dictionary& value) : Value(value._storage) {}
+
+Value::Value(const Value& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
+    if (hasNode()) detail::retain(node());
+}
+
+Value::Value(Value&& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
+    other._kind = Kind::none;
+    other._bits = 0;
+}
+
+Value& Value::operator=(const Value& other) noexcept {
+    Value copy(other); // first, for `other` may live inside what this value lets go
+    return *this = std::move(copy);
+}
+
+Value& Value::operator=(Value&& other) noexcept {
+    Value taken(std::move(other));
+    std::swap(_bits, taken._bits);
+    std::swap(_kind, taken._kind);
+    std::swap(_unsigned, taken._unsigned);
+    return *this;
+}
+
+Value::~Value() {
+    if (hasNode()) detail::release(_kind, node());
+}
+
+detail::Node* Value::node() const noexcept { return Contents::node(*this); }
+
+std::optional<bool> Value::boolean() const noexcept {
+    if (_kind != Kind::boolean) return std::nullopt;
+    return _bits != 0;
+}
+
+std::optional<std::int64_t> Value::int64() const noexcept {
+    if (_kind != Kind::integer || _unsigned) return std::nullopt;
+    return static_cast<std::int64_t>(_bits);
+}
+
+std::optional<std::uint64_t> Value::uint64() const noexcept {
+    if (_kind != Kind::integer || (!_unsigned && static_cast<std::int64_t>(_bits) < 0)) return std::nullopt;
+    return _bits;
+}
+
+std::optional<double> Value::real() const noexcept {
+    if (_kind != Kind::real) return std::nullopt;
+    return std::bit_cast<double>(_bits);
+}
+
+std::optional<Date> Value::date() const noexcept {
+    if (_kind != Kind::date) return std::nullopt;
+    return Date{std::bit_cast<double>(_bits)};
+}
+
+std::optional<std::string_view> Value::string() const noexcept {
+    if (_kind != Kind::string) return std::nullopt;
+    return Contents::bytes(*this).view();
+}
+
+std::optional<std::string_view> Value::data() const noexcept {
+    if (_kind != Kind::data) return std::nullopt;
+    return Contents::bytes(*this).view();
+}
+
+std::optional<UUID> Value::uuid() const noexcept {
+    if (_kind != Kind::uuid) return std::nullopt;
+    return static_cast<detail::UUIDNode*>(node())->uuid;
+}
+
+std::optional<Array> Value::array() const noexcept {
+    if (_kind != Kind::array) return std::nullopt;
+    return Array(*this);
+}
+
+std::optional<Dictionary> Value::dictionary() const noexcept {
+    if (_kind != Kind::dictionary) return std::nullopt;
+    return Dictionary(*this);
+}
+
+bool Value::isNumber() const noexcept {
+    return _kind == Kind::boolean || _kind == Kind::integer || _kind == Kind::real;
+}
+
+std::optional<std::int64_t> Value::integerValue() const noexcept {
+    if (!isNumber()) return std::nullopt;
+    const auto number = real();
+    if (!number) return static_cast<std::int64_t>(_bits);
+    if (std::isnan(*number)) return 0;
+    if (*number >= signedEnd) return INT64_MAX;
+    if (*number < -signedEnd) return INT64_MIN;
+    return static_cast<std::int64_t>(*number);
+}
+
+std::optional<bool> Value::booleanValue() const noexcept {
+    if (!isNumber()) return std::nullopt;
+    if (const auto number = real()) return *number != 0;
+    return _bits != 0;
+}
+
+bool operator==(const Value& left, const Value& right) noexcept {
+    if (!outsidesEqual(left, right)) return false;
+    if (left.kind() < Kind::array) return true;
+
+    // A list of what is still to be compared, instead of recursion: containers built in the process may nest deeper
+    // than decoded ones.
+    std::vector<std::pair<const Value*, const Value*>> pending{{&left, &right}};
+    const auto differs = [&pending](const Value& one, const Value& other) {
+        if (!outsidesEqual(one, other)) return true;
+        if (one.kind() >= Kind::array) pending.emplace_back(&one, &other);
+        return false;
+    };
+    while (!pending.empty()) {
+        const auto [one, other] = pending.back();
+        pending.pop_back();
+        if (one->kind() == Kind::array) {
+            const auto& values = Contents::array(*one).values;
+            const auto& others = Contents::array(*other).values;
+            for (std::size_t i = 0; i < values.size(); ++i)
+                if (differs(values[i], others[i])) return false;
+            continue;
+        }
+        const auto& others = Contents::dictionary(*other);
+        for (const auto& entry : Contents::dictionary(*one).entries) {
+            const auto position = others.find(entry.name());
+            if (!position || differs(entry.value, others.entries[*position].value)) return false;
+        }
+    }
+    return true;
+}
+
+namespace {
+
+/// Writes a description and stops taking text once the limit is reached.
+class Describer {
+public:
+    std::string describe(const Value& value) {
+        append(value, 0);
+        if (_out.size() > limit) {
+            std::size_t end = limit;
+            while (end > 0 && (static_cast<unsigned char>(_out[end]) & 0xC0U) == 0x80U) --end;
+            _out.resize(end);
+            _out += ellipsis;
+        }
+        return std::move(_out);
+    }
+
+private:
+    static constexpr std::size_t limit = maximumDescriptionLength - ellipsis.size();
+
+    bool isFull() const { return _out.size() > limit; }
+
+    void append(const Value& value, std::size_t depth) {
+        if (isFull()) return;
+        switch (value.kind()) {
+        case Kind::none:
+            _out += "(null)";
+            break;
+        case Kind::boolean:
+            _out += *value.boolean() ? "true" : "false";
+            break;
+        case Kind::integer:
+            if (const auto number = value.int64())
+                appendNumber(*number);
+            else
+                appendNumber(*value.uint64());
+            break;
+        case Kind::real:
+            appendNumber(*value.real());
+            break;
+        case Kind::date:
+            _out += "<date ";
+            appendNumber(value.date()->seconds);
+            _out += '>';
+            break;
+        case Kind::string:
+            appendText(*value.string());
+            break;
+        case Kind::data:
+            appendData(*value.data());
+            break;
+        case Kind::uuid:
+            _out += value.uuid()->text();
+            break;
+        case Kind::array:
+            appendArray(Contents::array(value).values, depth);
+            break;
+        case Kind::dictionary:
+            appendDictionary(Contents::dictionary(value).entries, depth);
+            break;
+        }
+    }
+
+    template <class Number> void appendNumber(Number number) {
+        char digits[32];
+        _out.append(digits, std::to_chars(digits, digits + sizeof digits, number).ptr);
+    }
+
+    void appendData(std::string_view bytes) {
+        _out += '<';
+        appendNumber(bytes.size());
+        _out += bytes.size() == 1 ? " byte" : " bytes";
+        if (!bytes.empty()) _out += ' ';
+        for (const char c : bytes.substr(0, describedDataBytes)) appendHexadecimal(c);
+        if (bytes.size() > describedDataBytes) _out += ellipsis;
+        _out += '>';
+    }
+
+    void appendHexadecimal(char c) {
+        static constexpr char digits[] = "0123456789abcdef";
+        _out += digits[static_cast<unsigned char>(c) >> 4U];
+        _out += digits[static_cast<unsigned char>(c) & 0x0FU];
+    }
+
+    /// Text as it is, but for what could end a line, steer a terminal or break the encoding of the log.
+    void appendText(std::string_view text) {
+        for (std::size_t at = 0; at < text.size() && !isFull();) {
+            const std::size_t length = linux_::utf8Length(text, at);
+            const std::string_view character = text.substr(at, length == 0 ? 1 : length);
+            if (length == 0 || isControl(character)) {
+                for (const char c : character) {
+                    _out += "\\x";
+                    appendHexadecimal(c);
+                }
+            } else {
+                _out += character;
+            }
+            at += character.size();
+        }
+    }
+
+    static bool isControl(std::string_view character) {
+        const auto first = static_cast<unsigned char>(character[0]);
+        if (character.size() == 1) return first < 0x20 || first == 0x7F;
+        if (first == 0xC2) return static_cast<unsigned char>(character[1]) < 0xA0; // U+0080 to U+009F
+        return character == "\u2028" || character == "\u2029";                     // line and paragraph separator
+    }
+
+    void appendArray(const std::vector<Value>& values, std::size_t depth) {
+        if (depth == maximumNesting) return appendNested();
+        _out += '(';
+        bool isFirst = true;
+        for (const auto& value : values) {
+            if (isFull()) return;
+            if (!isFirst) _out += ", ";
+            isFirst = false;
+            append(value, depth + 1);
+        }
+        _out += ')';
+    }
+
+    void appendDictionary(const std::vector<Dictionary::Entry>& entries, std::size_t depth) {
+        if (depth == maximumNesting) return appendNested();
+        _out += '{';
+        bool isFirst = true;
+        for (const auto& entry : entries) {
+            if (isFull()) return;
+            if (!isFirst) _out += "; ";
+            isFirst = false;
+            appendText(entry.name());
+            _out += " = ";
+            append(entry.value, depth + 1);
+        }
+        _out += '}';
+    }
+
+    void appendNested() { _out += ellipsis; }
+
+    std::string _out;
+};
+
+} // namespace
+
+std::string Value::description() const { return Describer().describe(*this); }
+
+Array::Array() : _storage(Kind::array, new detail::ArrayNode) {}
+
+Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) {}
+
+Array::Array(std::vector<Value> values) {
+    for (const auto& value : values) require(static_cast<bool>(value), "an absent value cannot be in an array");
+    _storage = Value(Kind::array, new detail::ArrayNode(std::move(values)));
+}
+
+std::size_t Array::size() const noexcept { return Contents::array(_storage).values.size(); }
+
+const Value& Array::operator[](std::size_t index) const noexcept {
+    const auto& values = Contents::array(_storage).values;
+    require(index < values.size(), "array index out of range");
+    return values[index];
+}
+
+const Value* Array::begin() const noexcept { return Contents::array(_storage).values.data(); }
+
+const Value* Array::end() const noexcept { return begin() + size(); }
+
+bool operator==(const Array& left, const Array& right) noexcept { return left._storage == right._storage; }
+
+MutableArray MutableArray::copyOf(const Array& other) {
+    MutableArray copy;
+    auto& values = Contents::array(copy._storage).values;
+    values.assign(other.begin(), other.end());
+    return copy;
+}
+
+void MutableArray::append(Value value) {
+    require(static_cast<bool>(value), "an absent value cannot be in an array");
+    Contents::array(_storage).values.push_back(std::move(value));
+}
+
+Dictionary::Dictionary() : _storage(Kind::dictionary, new detail::DictionaryNode) {}
+
+Dictionary::Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries) : Dictionary() {
+    for (const auto& [key, value] : entries) Contents::dictionary(_storage).set(key, value);
+}
+
+std::optional<Dictionary> Dictionary::fromUniqueEntries(std::vector<Entry> entries) {
+    for (const auto& entry : entries)
+        require(entry.key.kind() == Kind::string && entry.value, "a dictionary entry is a string and a value");
+    Dictionary made;
+    auto& node = Contents::dictionary(made._storage);
+    node.entries = std::move(entries);
+    if (!node.rebuildIndex()) return std::nullopt;
+    return made;
+}
+
+std::size_t Dictionary::size() const noexcept { return Contents::dictionary(_storage).entries.size(); }
+
+Value Dictionary::operator[](std::string_view key) const noexcept {
+    const Value* value = find(key);
+    return value != nullptr ? *value : Value();
+}
+
+const Value* Dictionary::find(std::string_view key) const noexcept {
+    const auto& node = Contents::dictionary(_storage);
+    const auto position = node.find(key);
+    return position ? &node.entries[*position].value : nullptr;
+}
+
+const Dictionary::Entry* Dictionary::begin() const noexcept { return Contents::dictionary(_storage).entries.data(); }
+
+const Dictionary::Entry* Dictionary::end() const noexcept { return begin() + size(); }
+
+std::optional<std::string_view> Dictionary::string(std::string_view key) const noexcept {
+    const Value* value = find(key);
+    return value != nullptr ? value->string() : std::nullopt;
+}
+
+std::optional<std::uint64_t> Dictionary::uint64(std::string_view key) const noexcept {
+    const Value* value = find(key);
+    return value != nullptr ? value->uint64() : std::nullopt;
+}
+
+std::optional<UUID> Dictionary::uuid(std::string_view key) const noexcept {
+    const Value* value = find(key);
+    return value != nullptr ? value->uuid() : std::nullopt;
+}
+
+std::optional<Array> Dictionary::array(std::string_view key) const noexcept {
+    const Value* value = find(key);
+    return value != nullptr ? value->array() : std::nullopt;
+}
+
+std::optional<Dictionary> Dictionary::dictionary(std::string_view key) const noexcept {
+    const Value* value = find(key);
+    return value != nullptr ? value->dictionary() : std::nullopt;
+}
+
+bool Dictionary::sharesStorageWith(const Dictionary& other) const noexcept {
+    return Contents::node(_storage) == Contents::node(other._storage);
+}
+
+bool operator==(const Dictionary& left, const Dictionary& right) noexcept { return left._storage == right._storage; }
+
+MutableDictionary MutableDictionary::copyOf(const Dictionary& other) {
+    MutableDictionary copy;
+    const Value shared(other);
+    const auto& from = Contents::dictionary(shared);
+    auto& to = Contents::dictionary(copy._storage);
+    to.entries = from.entries;
+    to.index = from.index;
+    return copy;
+}
+
+void MutableDictionary::set(std::string_view key, Value value) {
+    Contents::dictionary(_storage).set(key, std::move(value));
+}
+
+void MutableDictionary::remove(std::string_view key) {
+    auto& node = Contents::dictionary(_storage);
+    if (const auto position = node.find(key)) node.erase(*position);
+}
+
+void MutableDictionary::merge(const Dictionary& other) {
+    if (sharesStorageWith(other)) return;
+    // One sort at the end instead of an insertion into the index for each new key.
+    auto& node = Contents::dictionary(_storage);
+    std::vector<Entry> added;
+    for (const auto& entry : other) {
+        if (const auto position = node.find(entry.name()))
+            node.entries[*position].value = entry.value;
+        else
+            added.push_back(entry);
+    }
+    if (added.empty()) return;
+    node.entries.insert(node.entries.end(), std::make_move_iterator(added.begin()),
+                        std::make_move_iterator(added.end()));
+    node.rebuildIndex();
+}
+
+} // namespace platform

@@ -1,0 +1,28 @@
+#pragma once
+
+#include "platform/PropertyList.h"
+
+#include <string>
+
+/// What the encodings of property lists share.
+namespace platform::linux_ {
+
+/// `code` of an error in propertyListErrorDomain.
+enum class CodingError { malformed = 1, notEncodable = 2 };
+
+inline Error codingError(CodingError code, std::string text) {
+    return {propertyListErrorDomain, static_cast<std::int64_t>(code), std::move(text)};
+}
+
+/// Every encoding holds the years 1 to 9999, which have a four-digit text form, so that no date is lost when a value
+/// goes from one encoding to another. False for NaN.
+inline bool isEncodableDate(Date date) {
+    constexpr double firstSecond = -62135596800.0;     // 0001-01-01T00:00:00Z
+    constexpr double endOfLastSecond = 253402300800.0; // 10000-01-01T00:00:00Z
+    return date.seconds >= firstSecond && date.seconds < endOfLastSecond;
+}
+
+/// Decodes a file that begins with compactMagic.
+Result<Value> decodeCompactFile(std::string_view bytes);
+
+} // namespace platform::linux_

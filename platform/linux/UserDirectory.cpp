@@ -1,0 +1,79 @@
+#include "platform/linux/UserDirectory.h"
+
+#include "platform/linux/SystemError.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <fcntl.h>
+#include <string>
+#include <sys/stat.h>
+
+namespace platform::linux_ {
+
+namespace {
+
+constexpr std::size_t maximumComponent = 255; // NAME_MAX of the file systems in use
+constexpr int openFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+
+/// The directory that holds the users' private ones. Made by the superuser it lets every user add their own, as /tmp
+/// does: a squatted private directory is of no use, because its owner is checked.
+Result<Descriptor> openUsersDirectory(const Root& root, uid_t user, MissingDirectory missing) {
+    const std::string path = root.users();
+    if (missing == MissingDirectory::made) {
+        for (std::size_t end = path.find('/', 1); end != std::string::npos; end = path.find('/', end + 1)) {
+            // A failure shows when the last directory is opened.
+            static_cast<void>(::mkdir(path.substr(0, end).c_str(), 0755));
+        }
+        if (::mkdir(path.c_str(), 0755) == 0 && ::geteuid() == 0 && ::chmod(path.c_str(), 01777) != 0) {
+            return systemError(errno, path);
+        }
+    }
+    Descriptor directory(::open(path.c_str(), openFlags));
+    struct stat status{};
+    if (!directory || ::fstat(directory.get(), &status) != 0) return systemError(errno, path);
+    // Whoever may rename entries here could put one user's directory in the place of another's.
+    if (status.st_uid != 0 && status.st_uid != user) return systemError(EPERM, path);
+    if ((status.st_mode & 022) != 0 && (status.st_mode & S_ISVTX) == 0) return systemError(EACCES, path);
+    return directory;
+}
+
+} // namespace
+
+int pathComponentError(std::string_view name) {
+    if (name.empty() || name == "." || name == "..") return EINVAL;
+    const auto forbidden = [](char c) { return c == '/' || static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
+    if (std::any_of(name.begin(), name.end(), forbidden)) return EINVAL;
+    return name.size() > maximumComponent ? ENAMETOOLONG : 0;
+}
+
+Result<Descriptor> openUserDirectory(const Root& root, uid_t user, std::initializer_list<std::string_view> components,
+                                     MissingDirectory missing) {
+    auto users = openUsersDirectory(root, user, missing);
+    if (!users) return users.error();
+
+    Descriptor directory = *std::move(users);
+    const std::string own = std::to_string(user);
+    std::string path = root.users();
+    const auto enter = [&](const std::string& name) -> Failure {
+        path += '/' + name;
+        if (missing == MissingDirectory::made && ::mkdirat(directory.get(), name.c_str(), 0700) != 0 &&
+            errno != EEXIST) {
+            return systemError(errno, path);
+        }
+        Descriptor next(::openat(directory.get(), name.c_str(), openFlags | O_NOFOLLOW));
+        struct stat status{};
+        if (!next || ::fstat(next.get(), &status) != 0) return systemError(errno, path);
+        if (status.st_uid != user) return systemError(EPERM, path);
+        if ((status.st_mode & 077) != 0) return systemError(EACCES, path);
+        directory = std::move(next);
+        return std::nullopt;
+    };
+
+    if (auto failure = enter(own)) return *failure;
+    for (const auto component : components) {
+        if (auto failure = enter(std::string(component))) return *failure;
+    }
+    return directory;
+}
+
+} // namespace platform::linux_
