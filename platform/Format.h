@@ -113,25 +113,21 @@ constexpr Directive nextDirective(std::string_view& rest) {
         directive.conversion != 0 && std::string_view("dux").find(directive.conversion) != std::string_view::npos;
     const bool isKnown = isInteger || (directive.conversion != 0 &&
                                        std::string_view("s@pP%").find(directive.conversion) != std::string_view::npos);
+    if (directive.fault != FormatFault::none) return directive;
     if (!isKnown || (hasLength && !isInteger) || isSixteenBytes != (directive.conversion == 'P'))
         directive.fault = FormatFault::unknownConversion;
-    if (directive.isUUID != (directive.conversion == 'P') || (directive.isErrno && directive.conversion != 'd'))
+    else if (directive.isUUID != (directive.conversion == 'P') || (directive.isErrno && directive.conversion != 'd'))
         directive.fault = FormatFault::unknownOption;
     return directive;
 }
 
 constexpr bool fits(char conversion, ArgumentKind kind) {
     switch (conversion) {
-    case 's':
-        return kind == ArgumentKind::text;
-    case '@':
-        return kind == ArgumentKind::text || kind == ArgumentKind::object || kind == ArgumentKind::uuid;
-    case 'p':
-        return kind != ArgumentKind::integer;
-    case 'P':
-        return kind == ArgumentKind::uuid || kind == ArgumentKind::bytes;
-    default:
-        return kind == ArgumentKind::integer;
+    case 's': return kind == ArgumentKind::text;
+    case '@': return kind == ArgumentKind::text || kind == ArgumentKind::object || kind == ArgumentKind::uuid;
+    case 'p': return kind != ArgumentKind::integer;
+    case 'P': return kind == ArgumentKind::uuid || kind == ArgumentKind::bytes;
+    default: return kind == ArgumentKind::integer;
     }
 }
 
@@ -288,26 +284,13 @@ public:
     template <std::size_t Size>
     consteval FormatString(const char (&text)[Size]) : _text(text, Size - 1) { // NOLINT(google-explicit-constructor)
         switch (formatFault<Args...>(_text)) {
-        case FormatFault::none:
-            break;
-        case FormatFault::unknownConversion:
-            detail::formatTextHasAnUnknownConversion();
-            break;
-        case FormatFault::unknownOption:
-            detail::formatTextHasAnUnknownOption();
-            break;
-        case FormatFault::tooFewArguments:
-            detail::formatTextHasTooFewArguments();
-            break;
-        case FormatFault::tooManyArguments:
-            detail::formatTextHasTooManyArguments();
-            break;
-        case FormatFault::wrongKindOfArgument:
-            detail::formatTextDoesNotFitTheKindOfAnArgument();
-            break;
-        case FormatFault::unprintableArgument:
-            detail::formatTextCannotPrintAnArgumentOfThisType();
-            break;
+        case FormatFault::none: break;
+        case FormatFault::unknownConversion: detail::formatTextHasAnUnknownConversion(); break;
+        case FormatFault::unknownOption: detail::formatTextHasAnUnknownOption(); break;
+        case FormatFault::tooFewArguments: detail::formatTextHasTooFewArguments(); break;
+        case FormatFault::tooManyArguments: detail::formatTextHasTooManyArguments(); break;
+        case FormatFault::wrongKindOfArgument: detail::formatTextDoesNotFitTheKindOfAnArgument(); break;
+        case FormatFault::unprintableArgument: detail::formatTextCannotPrintAnArgumentOfThisType(); break;
         }
     }
 

@@ -32,17 +32,18 @@ public:
     /// Runs `item` now, after everything submitted before it, and returns its result when it is done.
     /// On an idle queue it runs on the caller's thread, at the cost of a lock. Calling it from the queue itself is a
     /// bug and stops the process with the queue's label.
-    template <class F>
-    auto sync(F&& item) -> std::invoke_result_t<F&> {
+    template <class F> auto sync(F&& item) -> std::invoke_result_t<F&> {
         using R = std::invoke_result_t<F&>;
         if constexpr (std::is_void_v<R>) {
-            runSync(Call{&item, [](void* f) { (*static_cast<std::remove_reference_t<F>*>(f))(); }});
+            auto* function = std::addressof(item); // by its address, since the item itself may be const
+            runSync(Call{&function, [](void* f) { (**static_cast<std::remove_reference_t<F>**>(f))(); }});
         } else {
             struct Slot {
                 std::remove_reference_t<F>* item;
                 std::optional<R> result;
             } slot{&item, std::nullopt};
-            runSync(Call{&slot, [](void* s) { static_cast<Slot*>(s)->result.emplace((*static_cast<Slot*>(s)->item)()); }});
+            runSync(
+                Call{&slot, [](void* s) { static_cast<Slot*>(s)->result.emplace((*static_cast<Slot*>(s)->item)()); }});
             return std::move(*slot.result);
         }
     }
@@ -72,7 +73,8 @@ protected:
 class WorkQueues {
 public:
     virtual ~WorkQueues() = default;
-    virtual std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService quality = QualityOfService::standard) = 0;
+    virtual std::shared_ptr<WorkQueue> makeSerial(std::string label,
+                                                  QualityOfService quality = QualityOfService::standard) = 0;
 };
 
 } // namespace platform
