@@ -1,0 +1,50 @@
+#include "Zembra/ZBSandboxExtension.h"
+
+#include "Zembra/ZBLog.h"
+#include "Zembra/ZBProtocol.h"
+
+namespace zembra {
+
+platform::Result<std::string> issueFileReadToken(platform::Sandbox& sandbox, const platform::URL& url,
+                                                 const std::string& within) {
+    auto token =
+        sandbox.issueFile(platform::sandboxReadExtensionClass, url.path(), platform::SandboxFlag::canonical, within);
+    if (token) log::sandbox().debug("issued file extension for %s -> %s", url.path(), *token);
+    return token;
+}
+
+platform::Result<std::string> issueServiceLookupToken(platform::Sandbox& sandbox, const std::string& service) {
+    auto token = sandbox.issueService(serviceExtensionClass, service);
+    if (token) log::sandbox().debug("issued mach extension for %s -> %s", service, *token);
+    return token;
+}
+
+ZBSandboxExtension::ZBSandboxExtension(platform::Sandbox& sandbox, std::string token)
+    : _sandbox(sandbox), _token(std::move(token)) {}
+
+ZBSandboxExtension::~ZBSandboxExtension() { expel(); }
+
+void ZBSandboxExtension::consume() {
+    if (_handle != -1) return;
+    const std::string token = _token.get();
+    int errorNumber = 0;
+    _handle = _sandbox.consume(token, errorNumber);
+    if (_handle != -1) {
+        log::sandbox().debug("consuming extension %s -> %ld", token, _handle);
+    } else {
+        log::sandbox().notice("failed to consume extension %s - errno=%d", token, errorNumber);
+    }
+}
+
+void ZBSandboxExtension::expel() {
+    if (_handle == -1) return;
+    int errorNumber = 0;
+    if (_sandbox.release(_handle, errorNumber) == 0) {
+        log::sandbox().debug("releasing extension %ld", _handle);
+    } else {
+        log::sandbox().notice("failed to release extension %ld - errno=%d", _handle, errorNumber);
+    }
+    _handle = -1;
+}
+
+} // namespace zembra

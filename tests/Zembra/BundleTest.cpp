@@ -1,0 +1,64 @@
+#include "Zembra/ZBBundle.h"
+#include "tests/support/BundlesFake.h"
+#include "tests/support/SystemLogFake.h"
+
+#include <gtest/gtest.h>
+
+namespace {
+
+using platform::BundleMode;
+using platform::Dictionary;
+using platform::URL;
+using support::processLog;
+using zembra::ZBBundle;
+
+TEST(Bundle, ExecutablePathFallsBackToTheDirectory) {
+    support::FakeBundles bundles;
+    bundles.add("/App.app", {}, "/App.app/Run");
+    bundles.add("/Data.app", {});
+    bundles.mainExecutable = "/App.app/Run";
+    EXPECT_EQ(ZBBundle::initForMainBundle(bundles)->path(), "/App.app");
+    EXPECT_EQ(ZBBundle::initWithExecutablePath(bundles, "/App.app/Run")->path(), "/App.app");
+    const auto directory = ZBBundle::initWithExecutableURL(bundles, URL::file("/App.app/"));
+    EXPECT_EQ(directory->path(), "/App.app");
+    EXPECT_EQ(directory->executablePath(), "/App.app/Run");
+    EXPECT_EQ(directory->url(), URL::file("/App.app"));
+    EXPECT_EQ(ZBBundle::initWithURL(bundles, URL::file("/Data.app"))->executablePath(), "/Data.app");
+
+    const auto nowhere = ZBBundle::initWithQMXBundle(bundles.fromPath("/none", BundleMode::executable));
+    EXPECT_EQ(nowhere->path(), std::nullopt);
+    EXPECT_EQ(nowhere->url(), std::nullopt);
+    EXPECT_EQ(nowhere->executablePath(), std::nullopt);
+}
+
+TEST(Bundle, SupportPathIsKeptOnceKnown) {
+    support::FakeBundles bundles;
+    auto& content = bundles.add("/App.app", {});
+    content.hasSupportPath = false;
+    const auto bundle = ZBBundle::initWithPath(bundles, "/App.app");
+    EXPECT_EQ(bundle->plugInsPath(), std::nullopt);
+    content.hasSupportPath = true;
+    EXPECT_EQ(bundle->plugInsPath(), "/App.app/PlugIns");
+    content.hasSupportPath = false;
+    EXPECT_EQ(bundle->bundleDirectory("Resources"), "/App.app/Resources");
+}
+
+TEST(Bundle, InfoDictionaryIsLoggedWhenThereIsNone) {
+    support::FakeBundles bundles;
+    auto& content = bundles.add("/App.app", {{"VBBundleIdentifier", "org.example.app"}});
+    const auto bundle = ZBBundle::initWithPath(bundles, "/App.app");
+    processLog.clear();
+    EXPECT_EQ(bundle->bundleIdentifier(), "org.example.app");
+    content.manifest = {{"VBBundleIdentifier", 5}};
+    EXPECT_EQ(bundle->bundleIdentifier(), std::nullopt);
+    EXPECT_TRUE(processLog.lines().empty());
+
+    content.hasReadableManifest = false;
+    EXPECT_EQ(bundle->bundleIdentifier(), std::nullopt);
+    EXPECT_EQ(processLog.messages("ops"),
+              (std::vector<std::string>{"failed to retrieve Info.vlist for /App.app through <bundle /App.app>",
+                                        "failed to convert Info.vlist to dictionary: /App.app source=(null)"}));
+    for (const auto& line : processLog.lines()) EXPECT_EQ(line.level, platform::LogLevel::info);
+}
+
+} // namespace
