@@ -1,0 +1,97 @@
+#pragma once
+
+#include "bench/Socket.h"
+
+#include <functional>
+#include <list>
+#include <sys/epoll.h>
+#include <vector>
+
+/// Clients of either server: the same code asks the daemon and the echo.
+namespace bench {
+
+/// Where to ask, with what. The requests are whole frames, asked in turn.
+struct Target {
+    std::string path;
+    Process& server;
+    const std::vector<std::string>& requests;
+    std::size_t replySize; // of every reply; another size means that something else was measured
+};
+
+/// Mean microseconds from request to reply, one client that waits for each. `use` gets each reply's body.
+inline double roundTrip(const Target& target, double seconds, const std::function<void(std::string_view)>& use) {
+    const Descriptor socket = connectTo(target.path, target.server);
+    FrameReader reader;
+    std::size_t count = 0;
+    const auto ask = [&] {
+        sendAll(socket.get(), target.requests[count++ % target.requests.size()]);
+        const qmx::Frame reply = reader.next(socket.get());
+        if (reader.frameSize() != target.replySize) fail("a reply of another size");
+        if (use) use(reply.body);
+    };
+    for (int i = 0; i < 100; ++i) ask();
+    count = 0;
+    const double start = secondsNow();
+    double end = start;
+    do {
+        for (int i = 0; i < 50; ++i) ask();
+        end = secondsNow();
+    } while (end - start < seconds);
+    return (end - start) / static_cast<double>(count) * 1e6;
+}
+
+/// Replies per second to `clients` connections that each keep `depth` requests waiting.
+inline double throughput(const Target& target, std::size_t clients, std::size_t depth, double seconds) {
+    struct Client {
+        Descriptor socket;
+        std::string buffer;
+    };
+    const Descriptor epoll(epoll_create1(EPOLL_CLOEXEC));
+    std::list<Client> all;
+    std::size_t next = 0;
+    const auto ask = [&](Client& client, std::size_t count) {
+        // A send for each, as from a program that asks when it needs to know.
+        for (std::size_t i = 0; i < count; ++i)
+            sendAll(client.socket.get(), target.requests[next++ % target.requests.size()]);
+    };
+    for (std::size_t i = 0; i < clients; ++i) {
+        Client& client = all.emplace_back();
+        client.socket = connectTo(target.path, target.server);
+        epoll_event event{};
+        event.events = EPOLLIN;
+        event.data.ptr = &client;
+        if (epoll_ctl(epoll.get(), EPOLL_CTL_ADD, client.socket.get(), &event) != 0) failSystem("epoll_ctl");
+    }
+    for (Client& client : all) ask(client, depth);
+
+    std::array<epoll_event, 64> events{};
+    const double start = secondsNow();
+    double end = start;
+    std::size_t answered = 0;
+    std::size_t waiting = clients * depth;
+    bool isOver = false;
+    while (waiting > 0) {
+        const int count = epoll_wait(epoll.get(), events.data(), static_cast<int>(events.size()), -1);
+        for (int i = 0; i < count; ++i) {
+            Client& client = *static_cast<Client*>(events[static_cast<std::size_t>(i)].data.ptr);
+            receiveSome(client.socket.get(), client.buffer);
+            const std::size_t replies = client.buffer.size() / target.replySize;
+            for (std::size_t reply = 0; reply < replies; ++reply) {
+                const auto scan = qmx::scanFrame(std::string_view(client.buffer).substr(reply * target.replySize));
+                if (scan.size != target.replySize) fail("a reply of another size");
+            }
+            client.buffer.erase(0, replies * target.replySize);
+            waiting -= replies;
+            if (isOver) continue;
+            answered += replies;
+            ask(client, replies);
+            waiting += replies;
+        }
+        if (isOver) continue; // the rest is only taken in, so that nothing is under way when the sockets close
+        end = secondsNow();
+        isOver = end - start >= seconds;
+    }
+    return static_cast<double>(answered) / (end - start);
+}
+
+} // namespace bench

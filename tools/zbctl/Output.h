@@ -1,0 +1,24 @@
+#pragma once
+
+#include "platform/PropertyList.h"
+
+#include <iosfwd>
+#include <string>
+#include <string_view>
+
+/// What people see.
+namespace zbctl {
+
+/// One line of text: control characters, which a manifest may hold and a terminal would obey, become escapes.
+std::string printable(std::string_view text);
+
+/// The value as an indented tree; a dictionary's plain values come first, in one column.
+void printTree(std::ostream& out, const platform::Value& value);
+
+/// A plug-in form: a line that names the plug-in, then the tree.
+void printForm(std::ostream& out, const platform::Dictionary& form);
+
+/// "zbctl: " and the text, on standard error.
+void complain(std::string_view text);
+
+} // namespace zbctl

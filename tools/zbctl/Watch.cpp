@@ -1,0 +1,46 @@
+#include "platform/linux/Notifications.h"
+#include "tools/zbctl/Output.h"
+#include "tools/zbctl/Verbs.h"
+
+#include <condition_variable>
+#include <iostream>
+#include <memory>
+#include <mutex>
+
+namespace zbctl {
+
+namespace {
+
+/// Outlives the observation: a notification may be under way when the last one that counts has come.
+struct Arrivals {
+    std::mutex mutex;
+    std::condition_variable changed;
+    std::uint64_t count = 0;
+};
+
+} // namespace
+
+ExitStatus watch(const std::string& name, std::uint64_t count) {
+    platform::linux_::WorkQueues queues;
+    platform::linux_::Notifications notifications(platform::linux_::Root::ofProcess());
+    const auto arrivals = std::make_shared<Arrivals>();
+    const auto observation =
+        notifications.observe(name, queues.makeSerial("watch", platform::QualityOfService::standard), [arrivals] {
+            const std::lock_guard lock(arrivals->mutex);
+            ++arrivals->count;
+            arrivals->changed.notify_one();
+        });
+    // Whoever started this may now cause what is to be seen.
+    std::cerr << "watching " << printable(name) << std::endl;
+
+    std::unique_lock lock(arrivals->mutex);
+    for (std::uint64_t seen = 0; count == 0 || seen < count;) {
+        arrivals->changed.wait(lock, [&] { return arrivals->count > seen; });
+        ++seen;
+        std::cout << printable(name) << std::endl;
+        if (!std::cout) return ExitStatus::failure;
+    }
+    return ExitStatus::success;
+}
+
+} // namespace zbctl
