@@ -26,8 +26,8 @@ public:
     virtual ~CodeSigning() = default;
     /// None when the token names no process that can be identified.
     virtual std::shared_ptr<SecTask> taskFromAuditToken(const AuditToken& token) = 0;
-    /// Entitlements are those of the program that the process ran when it connected; they are read when first asked
-    /// for. An error when the process is gone or runs another program by now.
+    /// Entitlements are those of the program that the process ran when it connected. They are read when first asked
+    /// for, an error if by then the process is gone or runs another program, and kept for the task's life.
     virtual EntitlementValue copyEntitlement(const std::shared_ptr<SecTask>& task, const std::string& name) = 0;
 };
 

@@ -32,8 +32,10 @@ public:
     virtual Result<std::string> read(const std::string& path, std::size_t limit) = 0;
 
     /// Replaces the file as a whole: readers, and whoever looks after a crash at any moment, find the old bytes or the
-    /// new ones. On failure the old file is untouched and nothing is left beside it. Keeps the mode of an existing
-    /// file, else 0600. A symbolic link at `path` is followed.
+    /// new ones. On failure the old file is untouched and nothing is left beside it, with one exception: when syncing
+    /// the directory fails at the very end, the new file stands, but may not outlast a power failure. Keeps the mode
+    /// of an existing file, else 0600; but rights of a group that cannot be kept are dropped. A symbolic link at
+    /// `path` is followed. What exists and is no regular file is not replaced.
     virtual Failure writeAtomically(const std::string& path, std::string_view bytes) = 0;
 
     /// The canonical path, as realpath(3) gives it; an error for what does not exist and for results of `limit` bytes

@@ -14,7 +14,8 @@ class Processes {
 public:
     virtual ~Processes() = default;
     /// The executable's path of the process now running under `pid`. The error carries errno: ESRCH when the process
-    /// is gone, ENAMETOOLONG when the path does not fit `bufferSize` bytes with its NUL.
+    /// is gone, ENOENT when its program was deleted or replaced since it started, ENAMETOOLONG when the path does not
+    /// fit `bufferSize` bytes with its NUL.
     virtual Result<std::string> executablePath(std::int32_t pid, std::size_t bufferSize) = 0;
     /// The same for a connected peer: ESRCH also when the pid belongs to another process by now, or the peer runs
     /// another program than when it connected.

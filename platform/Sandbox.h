@@ -17,7 +17,7 @@ class Sandbox {
 public:
     virtual ~Sandbox() = default;
 
-    /// A token for reading `path` (a file, or a directory and what is below it). With `canonical` the path is resolved
+    /// A token for reading `path` (a file, or a directory and what is below it): for what lies there now. With `canonical` the path is resolved
     /// first, and the token is for the result. `within`, when not empty, must hold the resolved path, or the service
     /// refuses (EPERM). The error carries errno.
     virtual Result<std::string> issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
@@ -32,8 +32,10 @@ public:
     /// 0 on success; any other value with `errorNumber` set.
     virtual int release(std::int64_t handle, int& errorNumber) = 0;
 
-    /// True when the process runs confined: under a seccomp filter, in a foreign mount namespace, or as another user
-    /// than this process's own (root's own confinement aside). A process that cannot be examined counts as confined.
+    /// True when the process runs confined: under a seccomp filter, in a foreign user or mount namespace, or with
+    /// another root directory. Foreign is what is neither this process's own nor that of the machine's first process.
+    /// Running as another user is no confinement in itself: a daemon of the whole machine serves many. A process that
+    /// cannot be examined counts as confined; for one user's daemon those are other users' processes too.
     virtual bool isSandboxed(std::int32_t pid) = 0;
 };
 

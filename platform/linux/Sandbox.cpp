@@ -1,0 +1,180 @@
+#include "platform/linux/Sandbox.h"
+
+#include "platform/linux/Confinement.h"
+#include "platform/linux/SandboxBroker.h"
+#include "platform/linux/SandboxToken.h"
+
+#include <cerrno>
+#include <climits>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+
+namespace platform::linux_ {
+
+namespace {
+
+constexpr std::size_t maximumNameLength = 255; // of classes and services, as long as a file name
+
+/// Resolutions kept: a form asks for a handful of resources again and again; thousands of plug-ins fit.
+constexpr std::size_t maximumResolutions = 8192;
+
+/// A directory above may move without a sign at the file itself. A token made from an outdated resolution opens
+/// nothing, so this bounds how long one is handed out in vain.
+constexpr std::chrono::seconds resolutionLifetime{5};
+
+bool isName(const std::string& text) {
+    return !text.empty() && text.size() <= maximumNameLength && text.find('\0') == std::string::npos;
+}
+
+int canonicalise(const std::string& path, std::string& canonical) {
+    std::unique_ptr<char, decltype(&std::free)> resolved(realpath(path.c_str(), nullptr), &std::free);
+    if (!resolved) return errno;
+    canonical = resolved.get();
+    return 0;
+}
+
+/// Both canonical.
+bool isWithin(const std::string& path, const std::string& directory) {
+    if (!path.starts_with(directory)) return false;
+    return path.size() == directory.size() || directory == "/" || path[directory.size()] == '/';
+}
+
+/// Receives the broker's answer. Zero, or an errno value.
+int receiveAnswer(int connection, OwnedDescriptor& opened) {
+    std::int32_t number = 0;
+    iovec part{&number, sizeof number};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    msghdr message{};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    ssize_t size = 0;
+    do size = recvmsg(connection, &message, MSG_CMSG_CLOEXEC);
+    while (size < 0 && errno == EINTR);
+    if (size < 0) return errno == EAGAIN ? ETIMEDOUT : errno;
+    const cmsghdr* header = CMSG_FIRSTHDR(&message);
+    if (header != nullptr && header->cmsg_level == SOL_SOCKET && header->cmsg_type == SCM_RIGHTS) {
+        int descriptor = -1;
+        std::memcpy(&descriptor, CMSG_DATA(header), sizeof descriptor);
+        opened = OwnedDescriptor(descriptor);
+    }
+    // An answer whose descriptor did not fit into this process any more is no success.
+    if (size != static_cast<ssize_t>(sizeof number)) return ECONNRESET;
+    return (message.msg_flags & MSG_CTRUNC) != 0 ? EMFILE : number;
+}
+
+} // namespace
+
+Sandbox::Sandbox(Root root, SandboxRole role) : _root(std::move(root)) {
+    if (role == SandboxRole::issuer) _signer = std::make_unique<TokenSigner>();
+}
+
+Sandbox::~Sandbox() = default;
+
+Failure Sandbox::startBroker() {
+    if (!_signer) return systemError(EPERM, "sandbox broker");
+    auto broker = SandboxBroker::start(_root, *_signer);
+    if (!broker) return broker.error();
+    _broker = *std::move(broker);
+    return std::nullopt;
+}
+
+int Sandbox::resolve(const std::string& path, const std::string& within, Resolution& resolution) {
+    FileStatus status;
+    if (int number = readFileStatus(AT_FDCWD, path.c_str(), status)) return number;
+    const auto now = std::chrono::steady_clock::now();
+    std::string key = path;
+    if (!within.empty()) key.append(1, '\0').append(within);
+    {
+        std::lock_guard lock(_mutex);
+        auto known = _resolutions.find(key);
+        if (known != _resolutions.end() && known->second.status == status &&
+            now - known->second.checked < resolutionLifetime) {
+            resolution = known->second;
+            return 0;
+        }
+    }
+    if (int number = canonicalise(path, resolution.canonicalPath)) return number;
+    if (!within.empty()) {
+        std::string directory;
+        if (int number = canonicalise(within, directory)) return number;
+        if (!isWithin(resolution.canonicalPath, directory)) return EPERM;
+    }
+    // Read anew by the canonical path: the given one may lead elsewhere by now.
+    if (int number = readFileStatus(AT_FDCWD, resolution.canonicalPath.c_str(), resolution.status)) return number;
+    if (!S_ISREG(resolution.status.mode) && !S_ISDIR(resolution.status.mode)) return EINVAL;
+    resolution.checked = now;
+    std::lock_guard lock(_mutex);
+    if (_resolutions.size() >= maximumResolutions) _resolutions.clear();
+    _resolutions.insert_or_assign(std::move(key), resolution);
+    return 0;
+}
+
+Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
+                                       const std::string& within) {
+    if (!_signer) return systemError(EPERM, path);
+    if (!isName(extensionClass) || !path.starts_with('/') || path.find('\0') != std::string::npos ||
+        within.find('\0') != std::string::npos)
+        return systemError(EINVAL, path);
+    Resolution resolution;
+    if (int number = resolve(path, within, resolution)) return systemError(number, path);
+    const bool canonical = flag == SandboxFlag::canonical;
+    auto token = _signer->sign({SandboxGrant::Kind::file, extensionClass, canonical ? resolution.canonicalPath : path,
+                                canonical, resolution.status.identity});
+    if (!token) return systemError(ENOMEM, path);
+    return *std::move(token);
+}
+
+Result<std::string> Sandbox::issueService(const std::string& extensionClass, const std::string& name) {
+    if (!_signer) return systemError(EPERM, name);
+    if (!isName(extensionClass) || !isName(name)) return systemError(EINVAL, name);
+    auto token = _signer->sign({SandboxGrant::Kind::service, extensionClass, name, false, {}});
+    if (!token) return systemError(ENOMEM, name);
+    return *std::move(token);
+}
+
+std::int64_t Sandbox::consume(const std::string& token, int& errorNumber) {
+    // An empty packet would read as a hang-up.
+    if (token.empty() || token.size() > maximumTokenSize) {
+        errorNumber = EINVAL;
+        return -1;
+    }
+    auto connection = SandboxBroker::connect(_root);
+    if (!connection) {
+        errorNumber = static_cast<int>(connection.error().code);
+        return -1;
+    }
+    OwnedDescriptor opened;
+    // A failed send leaves its mark in what is received: nothing, or the answer that came first.
+    ssize_t sent = 0;
+    do sent = send(connection->get(), token.data(), token.size(), MSG_NOSIGNAL);
+    while (sent < 0 && errno == EINTR);
+    if (int number = receiveAnswer(connection->get(), opened)) {
+        errorNumber = number;
+        return -1;
+    }
+    std::lock_guard lock(_mutex);
+    _handles.emplace(_nextHandle, std::move(opened));
+    return _nextHandle++;
+}
+
+int Sandbox::release(std::int64_t handle, int& errorNumber) {
+    std::lock_guard lock(_mutex);
+    if (_handles.erase(handle) == 1) return 0;
+    errorNumber = EINVAL;
+    return -1;
+}
+
+bool Sandbox::isSandboxed(std::int32_t pid) { return isConfined(pid); }
+
+int Sandbox::descriptor(std::int64_t handle) const {
+    std::lock_guard lock(_mutex);
+    auto entry = _handles.find(handle);
+    return entry == _handles.end() ? -1 : entry->second.get();
+}
+
+} // namespace platform::linux_

@@ -1,0 +1,71 @@
+#pragma once
+
+#include "platform/Sandbox.h"
+#include "platform/linux/FileStatus.h"
+#include "platform/linux/OwnedDescriptor.h"
+#include "platform/linux/Root.h"
+
+#include <chrono>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <unordered_map>
+
+namespace platform::linux_ {
+
+class SandboxBroker;
+class TokenSigner;
+
+enum class SandboxRole {
+    issuer,  // the daemon: has a signing key of its own, made now; its tokens end with it
+    consumer // a host: consumes through the daemon's broker; issues nothing (EPERM)
+};
+
+/// Extension tokens. The daemon's object signs them, and its broker turns them into descriptors; a host's object
+/// consumes them through the broker. Callable from any thread.
+class Sandbox final : public platform::Sandbox {
+public:
+    Sandbox(Root root, SandboxRole role);
+    ~Sandbox() override;
+    Sandbox(const Sandbox&) = delete;
+    Sandbox& operator=(const Sandbox&) = delete;
+
+    /// Listens under the root's runtime directory from now on, on a thread of its own, until destruction. Issuers only.
+    Failure startBroker();
+
+    /// Regular files and directories only (else EINVAL). The token is for what lies at the path now: once that is
+    /// replaced, the token yields nothing.
+    Result<std::string> issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
+                                  const std::string& within) override;
+    Result<std::string> issueService(const std::string& extensionClass, const std::string& name) override;
+    /// Asks the broker and waits for it, at most some seconds. errno: EPERM for a token that this daemon did not sign,
+    /// ESTALE when what it was for has been replaced, EINVAL for text that cannot be a token, EACCES when file
+    /// permissions bar this process, and those of connect(2) when there is no broker.
+    std::int64_t consume(const std::string& token, int& errorNumber) override;
+    int release(std::int64_t handle, int& errorNumber) override;
+    bool isSandboxed(std::int32_t pid) override;
+
+    /// What a consumed file token opened: a file open for reading, or a directory to be used with openat(2). -1 for
+    /// service tokens and unknown handles. Belongs to this object and is good until `release`.
+    int descriptor(std::int64_t handle) const;
+
+private:
+    /// Where a path led at `checked`, and whether that was within the directory asked for.
+    struct Resolution {
+        std::string canonicalPath;
+        FileStatus status;
+        std::chrono::steady_clock::time_point checked;
+    };
+    /// Zero, or an errno value.
+    int resolve(const std::string& path, const std::string& within, Resolution& resolution);
+
+    const Root _root;
+    std::unique_ptr<TokenSigner> _signer; // issuers only
+    std::unique_ptr<SandboxBroker> _broker;
+    mutable std::mutex _mutex;
+    std::unordered_map<std::string, Resolution> _resolutions; // guarded by _mutex; by path, NUL, directory
+    std::map<std::int64_t, OwnedDescriptor> _handles;         // guarded by _mutex; none for services
+    std::int64_t _nextHandle = 1;                             // guarded by _mutex
+};
+
+} // namespace platform::linux_

@@ -1,0 +1,35 @@
+#pragma once
+
+#include "platform/Processes.h"
+
+#include <cerrno>
+#include <map>
+#include <string>
+
+namespace support {
+
+/// A process table in memory. It is empty, so every process is gone, until told otherwise; peers go by their pid.
+class FakeProcesses final : public platform::Processes {
+public:
+    std::map<std::int32_t, std::string> paths;
+    std::map<std::string, std::string> environment;
+    std::uint32_t user = 1000;
+
+    platform::Result<std::string> executablePath(std::int32_t pid, std::size_t bufferSize) override {
+        auto path = paths.find(pid);
+        if (path == paths.end()) return platform::Error{platform::posixErrorDomain, ESRCH, "No such process"};
+        if (path->second.size() >= bufferSize)
+            return platform::Error{platform::posixErrorDomain, ENAMETOOLONG, "File name too long"};
+        return path->second;
+    }
+    platform::Result<std::string> executablePath(const platform::AuditToken& peer, std::size_t bufferSize) override {
+        return executablePath(peer.pid, bufferSize);
+    }
+    std::optional<std::string> environmentVariable(const std::string& name) override {
+        auto variable = environment.find(name);
+        return variable == environment.end() ? std::nullopt : std::optional(variable->second);
+    }
+    std::uint32_t currentUser() override { return user; }
+};
+
+} // namespace support
