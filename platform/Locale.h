@@ -19,7 +19,7 @@ public:
 class Locale {
 public:
     virtual ~Locale() = default;
-    /// Most preferred first, as in "de", "pt-BR". Never empty: "en" stands last.
+    /// Most preferred first, as in "de", "pt-BR". Never empty: "en" stands last, unless it is preferred to others.
     virtual std::vector<std::string> languages() = 0;
     /// Calls `handler` on `queue` after each change.
     virtual std::unique_ptr<LocaleObservation> observeChanges(std::shared_ptr<WorkQueue> queue,

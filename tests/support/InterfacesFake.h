@@ -1,0 +1,39 @@
+#pragma once
+
+#include "platform/linux/Interfaces.h"
+
+#include <memory>
+#include <set>
+#include <string>
+#include <vector>
+
+namespace support {
+
+/// The table of interfaces, which is memory in the real service too, with failures on demand. It starts empty, so every
+/// name is refused until it is registered.
+class FakeInterfaces final : public platform::linux_::Interfaces {
+public:
+    /// Names that are never found, registered or not.
+    std::set<std::string> unfindable;
+    /// Names that cannot be created, as if another thread had been faster.
+    std::set<std::string> taken;
+    /// Every name looked up.
+    std::vector<std::string> looked;
+
+    /// Registers a new interface and returns it.
+    std::shared_ptr<platform::Interface> add(const std::string& name) {
+        auto interface = platform::linux_::Interfaces::create(name);
+        registerInterface(interface);
+        return interface;
+    }
+
+    std::shared_ptr<platform::Interface> find(const std::string& name) override {
+        looked.push_back(name);
+        return unfindable.contains(name) ? nullptr : platform::linux_::Interfaces::find(name);
+    }
+    std::shared_ptr<platform::Interface> create(const std::string& name) override {
+        return taken.contains(name) ? nullptr : platform::linux_::Interfaces::create(name);
+    }
+};
+
+} // namespace support

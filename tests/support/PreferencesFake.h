@@ -1,0 +1,44 @@
+#pragma once
+
+#include "platform/Preferences.h"
+
+#include <map>
+#include <string>
+#include <vector>
+
+namespace support {
+
+/// Preferences in memory. A domain is refused until it is added, and what is stored shows after `synchronize`.
+class FakePreferences final : public platform::Preferences {
+public:
+    /// While true, `synchronize` fails.
+    bool isUnreadable = false;
+    /// Every domain synchronized.
+    std::vector<std::string> synchronized;
+
+    /// As another process would; an absent value removes.
+    void store(const std::string& domain, const std::string& key, platform::Value value) {
+        _stored[domain][key] = std::move(value);
+    }
+
+    void addDomain(const std::string& domain) override { _read.try_emplace(domain); }
+    bool synchronize(const std::string& domain) override {
+        synchronized.push_back(domain);
+        const auto found = _read.find(domain);
+        if (found == _read.end() || isUnreadable) return false;
+        found->second = _stored[domain];
+        return true;
+    }
+    platform::Value value(const std::string& domain, const std::string& key) override {
+        const auto found = _read.find(domain);
+        if (found == _read.end() || !found->second.contains(key)) return {};
+        return found->second.at(key);
+    }
+
+private:
+    using Domains = std::map<std::string, std::map<std::string, platform::Value>>;
+    Domains _stored;
+    Domains _read;
+};
+
+} // namespace support

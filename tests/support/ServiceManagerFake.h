@@ -1,0 +1,101 @@
+#pragma once
+
+#include "platform/ServiceManager.h"
+
+#include <cerrno>
+#include <deque>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace support {
+
+/// A service manager whose services are entries in a table. Refuses every removal with EPERM until removals are
+/// allowed. Callable from any thread.
+class FakeServiceManager final : public platform::ServiceManager {
+public:
+    using Service = std::pair<std::string, std::string>; // bundle identifier and version
+
+    /// From now on removals are done: they end the instances of `addInstance`.
+    void allow() {
+        const std::lock_guard lock(_mutex);
+        _isAllowed = true;
+    }
+    void addInstance(const std::string& bundleIdentifier, const std::string& version) {
+        const std::lock_guard lock(_mutex);
+        ++_instances[{bundleIdentifier, version}];
+    }
+    /// Answers removals of this service with `result`, and nothing is ended.
+    void fail(const std::string& bundleIdentifier, const std::string& version, int result) {
+        const std::lock_guard lock(_mutex);
+        _failures[{bundleIdentifier, version}] = result;
+    }
+    /// From now on answers wait for `answer`.
+    void holdAnswers() {
+        const std::lock_guard lock(_mutex);
+        _isHolding = true;
+    }
+    /// Gives the oldest answer that waits. False when none does.
+    bool answer() {
+        const std::lock_guard lock(_mutex);
+        if (_held.empty()) return false;
+        const Answer oldest = std::move(_held.front());
+        _held.pop_front();
+        oldest.send(oldest.result);
+        return true;
+    }
+    /// Every removal asked for.
+    std::vector<Service> removals() const {
+        const std::lock_guard lock(_mutex);
+        return _removals;
+    }
+
+    ~FakeServiceManager() override {
+        for (const auto& answer : _held) answer.send(ECANCELED);
+    }
+
+    void removeExternalService(const std::string& bundleIdentifier, const std::string& version,
+                               std::shared_ptr<platform::WorkQueue> queue,
+                               std::function<void(int)> completion) override {
+        const std::lock_guard lock(_mutex);
+        const Service service{bundleIdentifier, version};
+        _removals.push_back(service);
+        const Answer answer{std::move(queue), std::move(completion), resultFor(service)};
+        if (_isHolding) {
+            _held.push_back(answer);
+        } else {
+            answer.send(answer.result);
+        }
+    }
+
+private:
+    struct Answer {
+        std::shared_ptr<platform::WorkQueue> queue;
+        std::function<void(int)> completion;
+        int result;
+
+        void send(int number) const {
+            queue->async([call = completion, number] { call(number); });
+        }
+    };
+
+    int resultFor(const Service& service) {
+        if (const auto failure = _failures.find(service); failure != _failures.end()) return failure->second;
+        if (!_isAllowed) return EPERM;
+        return _instances.erase(service) > 0 ? platform::serviceInstancesTerminated : platform::serviceHasNoInstances;
+    }
+
+    mutable std::recursive_mutex _mutex; // a queue may run answers in place, and they may ask again
+    bool _isAllowed = false;
+    bool _isHolding = false;
+    std::map<Service, int> _instances;
+    std::map<Service, int> _failures;
+    std::vector<Service> _removals;
+    std::deque<Answer> _held;
+};
+
+} // namespace support
