@@ -51,6 +51,8 @@ public:
     Value(T value) noexcept : Value(Unsigned{static_cast<std::uint64_t>(value)}) {} // NOLINT
     Value(double value) noexcept;                   // NOLINT(google-explicit-constructor)
     Value(Date value) noexcept;                     // NOLINT(google-explicit-constructor)
+    /// Bytes that are NUL or no well-formed UTF-8 (file names may hold such) become U+FFFD, so that every string that
+    /// exists can travel.
     Value(std::string_view value);                  // NOLINT(google-explicit-constructor)
     Value(const std::string& value) : Value(std::string_view(value)) {} // NOLINT(google-explicit-constructor)
     Value(const char* value) : Value(std::string_view(value)) {}        // NOLINT(google-explicit-constructor)

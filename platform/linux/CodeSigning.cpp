@@ -1,7 +1,7 @@
 #include "platform/linux/CodeSigning.h"
 
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/Entitlements.h"
-#include "platform/linux/OwnedDescriptor.h"
 #include "platform/linux/PeerProcess.h"
 
 #include <cerrno>
@@ -30,7 +30,7 @@ public:
 private:
     Result<Dictionary> readOfProcess() const {
         const std::string path = "/proc/" + std::to_string(_process->pid()) + "/exe";
-        OwnedDescriptor program(open(path.c_str(), O_PATH | O_CLOEXEC));
+        Descriptor program(open(path.c_str(), O_PATH | O_CLOEXEC));
         if (!program) return systemError(errno == ENOENT ? ESRCH : errno, path);
         struct stat status{};
         if (fstat(program.get(), &status) != 0) return systemError(errno, path);

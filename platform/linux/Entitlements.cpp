@@ -1,6 +1,6 @@
 #include "platform/linux/Entitlements.h"
 
-#include "platform/linux/OwnedDescriptor.h"
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/ProcPath.h"
 
 #include <cerrno>
@@ -78,13 +78,13 @@ Result<std::optional<Dictionary>> readEntitlements(int descriptor) {
 }
 
 Result<std::optional<Dictionary>> readEntitlements(const std::string& path) {
-    OwnedDescriptor file(open(path.c_str(), O_PATH | O_CLOEXEC));
+    Descriptor file(open(path.c_str(), O_PATH | O_CLOEXEC));
     if (!file) return systemError(errno, path);
     return readEntitlements(file.get());
 }
 
 Failure writeEntitlements(const std::string& path, const Dictionary& entitlements) {
-    OwnedDescriptor file(open(path.c_str(), O_PATH | O_CLOEXEC));
+    Descriptor file(open(path.c_str(), O_PATH | O_CLOEXEC));
     if (!file) return systemError(errno, path);
     struct stat status{};
     if (fstat(file.get(), &status) != 0) return systemError(errno, path);
@@ -104,7 +104,7 @@ Failure writeEntitlements(const std::string& path, const Dictionary& entitlement
 }
 
 Failure removeEntitlements(const std::string& path) {
-    OwnedDescriptor file(open(path.c_str(), O_PATH | O_CLOEXEC));
+    Descriptor file(open(path.c_str(), O_PATH | O_CLOEXEC));
     if (!file) return systemError(errno, path);
     const std::string attributed = procPath(file.get());
     const auto isGone = [&](const char* name) {

@@ -1,6 +1,6 @@
 #include "platform/linux/Files.h"
 
-#include "platform/linux/OwnedDescriptor.h"
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/ProcPath.h"
 
 #include <algorithm>
@@ -42,7 +42,7 @@ Error writeError(int number, const std::string& path) {
 
 /// Where a path ends after its symbolic links, the last name of which need not exist.
 struct Target {
-    OwnedDescriptor directory;
+    Descriptor directory;
     std::string name;
 };
 
@@ -54,7 +54,7 @@ int openTarget(std::string path, Target& target) {
         std::string directory = slash == std::string::npos ? "." : path.substr(0, slash + 1);
         target.name = path.substr(slash == std::string::npos ? 0 : slash + 1);
         if (target.name.empty() || target.name == "." || target.name == "..") return EISDIR;
-        target.directory = OwnedDescriptor(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        target.directory = Descriptor(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (!target.directory) return errno;
         char link[PATH_MAX];
         ssize_t size = readlinkat(target.directory.get(), target.name.c_str(), link, sizeof link);
@@ -74,29 +74,29 @@ std::string temporaryName(const std::string& name) {
 }
 
 /// The temporary file, locked and empty, or none with errno set.
-OwnedDescriptor lockTemporary(int directory, const char* name) {
+Descriptor lockTemporary(int directory, const char* name) {
     while (true) {
         // O_NONBLOCK: should somebody have put a pipe there, opening it must not hang.
-        OwnedDescriptor file(openat(directory, name, O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0600));
-        if (!file && errno != ELOOP && errno != ENXIO) return OwnedDescriptor();
+        Descriptor file(openat(directory, name, O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0600));
+        if (!file && errno != ELOOP && errno != ENXIO) return Descriptor();
         struct stat status{};
-        if (file && fstat(file.get(), &status) != 0) return OwnedDescriptor();
+        if (file && fstat(file.get(), &status) != 0) return Descriptor();
         // In a directory where others may write, a prepared file would stay theirs after the rename, and a second
         // name for it would go on changing it.
         if (!file || !S_ISREG(status.st_mode) || status.st_uid != geteuid() || status.st_nlink > 1) {
-            if (unlinkat(directory, name, 0) != 0 && errno != ENOENT) return OwnedDescriptor();
+            if (unlinkat(directory, name, 0) != 0 && errno != ENOENT) return Descriptor();
             continue;
         }
         while (flock(file.get(), LOCK_EX) != 0)
-            if (errno != EINTR) return OwnedDescriptor();
+            if (errno != EINTR) return Descriptor();
         struct stat named{};
         if (fstatat(directory, name, &named, AT_SYMLINK_NOFOLLOW) != 0) {
-            if (errno != ENOENT) return OwnedDescriptor();
+            if (errno != ENOENT) return Descriptor();
             continue; // whoever had the lock has moved it into place or removed it
         }
-        if (fstat(file.get(), &status) != 0) return OwnedDescriptor();
+        if (fstat(file.get(), &status) != 0) return Descriptor();
         if (named.st_dev != status.st_dev || named.st_ino != status.st_ino) continue;
-        if (ftruncate(file.get(), 0) != 0 || fchmod(file.get(), 0600) != 0) return OwnedDescriptor();
+        if (ftruncate(file.get(), 0) != 0 || fchmod(file.get(), 0600) != 0) return Descriptor();
         return file;
     }
 }
@@ -130,7 +130,7 @@ std::string Files::locate(const std::string& wellKnownPath) { return _root.at(we
 
 Result<std::string> Files::read(const std::string& path, std::size_t limit) {
     // Looked at before it is opened: opening alone makes some devices act, and a watchdog would reset the machine.
-    OwnedDescriptor located(open(path.c_str(), O_PATH | O_CLOEXEC));
+    Descriptor located(open(path.c_str(), O_PATH | O_CLOEXEC));
     if (!located) return readError(errno, path);
     struct stat status{};
     if (fstat(located.get(), &status) != 0) return readError(errno, path);
@@ -139,7 +139,7 @@ Result<std::string> Files::read(const std::string& path, std::size_t limit) {
     Error tooLarge{fileErrorDomain, fileReadTooLargeCode, path + ": larger than " + std::to_string(limit) + " bytes"};
     if (static_cast<std::uint64_t>(status.st_size) > limit) return tooLarge;
 
-    OwnedDescriptor file(open(procPath(located.get()).c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    Descriptor file(open(procPath(located.get()).c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     if (!file) return readError(errno, path);
     // The size is a hint: the file may grow or shrink meanwhile, and files of /proc have none. One byte more than
     // expected shows the end without another round.
@@ -174,7 +174,7 @@ Failure Files::writeAtomically(const std::string& path, std::string_view bytes) 
         return Error{fileErrorDomain, fileWriteUnknownCode, path + ": not a regular file"};
 
     std::string temporary = temporaryName(target.name);
-    OwnedDescriptor file = lockTemporary(directory, temporary.c_str());
+    Descriptor file = lockTemporary(directory, temporary.c_str());
     if (!file) return writeError(errno, path);
     if (!writeFully(file.get(), bytes) || (exists && !keepOwnerAndMode(file.get(), old)) || fsync(file.get()) != 0 ||
         renameat(directory, temporary.c_str(), directory, name) != 0) {

@@ -37,7 +37,7 @@ struct LinuxPlatform::Services {
     Interfaces interfaces;
     Notifications notifications{root};
     Sandbox sandbox{root, SandboxRole::issuer};
-    ServiceManager serviceManager{root};
+    ServiceManager serviceManager{root, files};
     Registry registry{root, locale, containers};
     Transport transport{root};
     Platform platform{queues,  runLoop,    transport,   registry,   serviceManager, sandbox, codeSigning, bundles,

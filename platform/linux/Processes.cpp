@@ -1,6 +1,6 @@
 #include "platform/linux/Processes.h"
 
-#include "platform/linux/OwnedDescriptor.h"
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/PeerProcess.h"
 
 #include <cerrno>

@@ -25,6 +25,23 @@ constexpr std::string_view ellipsis = "…";
 /// How many bytes of data a description shows.
 constexpr std::size_t describedDataBytes = 16;
 
+/// `text` with a replacement character for each byte that is NUL or not part of well-formed UTF-8.
+std::string wellFormed(std::string_view text) {
+    constexpr std::string_view replacement = "\xEF\xBF\xBD";
+    std::string result;
+    for (std::size_t at = 0; at < text.size();) {
+        const std::size_t length = text[at] == '\0' ? 0 : linux_::utf8Length(text, at);
+        if (length == 0) {
+            result += replacement;
+            ++at;
+        } else {
+            result += text.substr(at, length);
+            at += length;
+        }
+    }
+    return result;
+}
+
 void require(bool condition, const char* text) noexcept {
     if (condition) return;
     std::fprintf(stderr, "%s\n", text);
@@ -318,7 +335,9 @@ Value::Value(Date value) noexcept
 
 Value::Value(Kind kind, detail::Node* node) noexcept : _bits(bitsOf(node)), _kind(kind), _unsigned(false) {}
 
-Value::Value(std::string_view value) : Value(Kind::string, detail::BytesNode::make(value)) {}
+Value::Value(std::string_view value)
+    : Value(Kind::string, linux_::firstBadByte(value) ? detail::BytesNode::make(wellFormed(value))
+                                                      : detail::BytesNode::make(value)) {}
 
 Value Value::data(std::string_view bytes) { return Value(Kind::data, detail::BytesNode::make(bytes)); }
 

@@ -43,7 +43,7 @@ bool isWithin(const std::string& path, const std::string& directory) {
 }
 
 /// Receives the broker's answer. Zero, or an errno value.
-int receiveAnswer(int connection, OwnedDescriptor& opened) {
+int receiveAnswer(int connection, Descriptor& opened) {
     std::int32_t number = 0;
     iovec part{&number, sizeof number};
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
@@ -60,7 +60,7 @@ int receiveAnswer(int connection, OwnedDescriptor& opened) {
     if (header != nullptr && header->cmsg_level == SOL_SOCKET && header->cmsg_type == SCM_RIGHTS) {
         int descriptor = -1;
         std::memcpy(&descriptor, CMSG_DATA(header), sizeof descriptor);
-        opened = OwnedDescriptor(descriptor);
+        opened = Descriptor(descriptor);
     }
     // An answer whose descriptor did not fit into this process any more is no success.
     if (size != static_cast<ssize_t>(sizeof number)) return ECONNRESET;
@@ -148,7 +148,7 @@ std::int64_t Sandbox::consume(const std::string& token, int& errorNumber) {
         errorNumber = static_cast<int>(connection.error().code);
         return -1;
     }
-    OwnedDescriptor opened;
+    Descriptor opened;
     // A failed send leaves its mark in what is received: nothing, or the answer that came first.
     ssize_t sent = 0;
     do sent = send(connection->get(), token.data(), token.size(), MSG_NOSIGNAL);

@@ -1,8 +1,8 @@
 #pragma once
 
 #include "platform/Sandbox.h"
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/FileStatus.h"
-#include "platform/linux/OwnedDescriptor.h"
 #include "platform/linux/Root.h"
 
 #include <chrono>
@@ -64,7 +64,7 @@ private:
     std::unique_ptr<SandboxBroker> _broker;
     mutable std::mutex _mutex;
     std::unordered_map<std::string, Resolution> _resolutions; // guarded by _mutex; by path, NUL, directory
-    std::map<std::int64_t, OwnedDescriptor> _handles;         // guarded by _mutex; none for services
+    std::map<std::int64_t, Descriptor> _handles;              // guarded by _mutex; none for services
     std::int64_t _nextHandle = 1;                             // guarded by _mutex
 };
 

@@ -100,8 +100,8 @@ private:
 /// A directory descriptor that leads nowhere but below the directory: a detached, read-only copy of its mount. A plain
 /// one would lead a process in another mount namespace through ".." to everything; it is only good for a peer that
 /// sees the tree anyway, where the daemon may not copy mounts.
-int confineDirectory(int connection, OwnedDescriptor& directory) {
-    OwnedDescriptor copy(open_tree(directory.get(), "", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC | AT_EMPTY_PATH));
+int confineDirectory(int connection, Descriptor& directory) {
+    Descriptor copy(open_tree(directory.get(), "", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC | AT_EMPTY_PATH));
     if (copy) {
         mount_attr attributes{};
         attributes.attr_set = MOUNT_ATTR_RDONLY | MOUNT_ATTR_NOSUID | MOUNT_ATTR_NODEV;
@@ -115,7 +115,7 @@ int confineDirectory(int connection, OwnedDescriptor& directory) {
     return seesCommonFileTree(peer.pid) ? 0 : EPERM;
 }
 
-void sendReply(int connection, std::int32_t number, const OwnedDescriptor& opened) {
+void sendReply(int connection, std::int32_t number, const Descriptor& opened) {
     iovec part{&number, sizeof number};
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
     msghdr message{};
@@ -151,12 +151,12 @@ Failure SandboxBroker::listen(const Root& root) {
     std::error_code error;
     std::filesystem::create_directories(root.runtime(), error);
     if (error) return systemError(error.value(), path);
-    _directory = OwnedDescriptor(::open(root.runtime().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    _directory = Descriptor(::open(root.runtime().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!_directory) return systemError(errno, path);
-    _stop = OwnedDescriptor(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
-    _reserve = OwnedDescriptor(::open("/dev/null", O_RDONLY | O_CLOEXEC));
-    _listener = OwnedDescriptor(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-    OwnedDescriptor probe(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    _stop = Descriptor(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    _reserve = Descriptor(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+    _listener = Descriptor(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    Descriptor probe(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!_stop || !_listener || !probe) return systemError(errno, path);
 
     // Nobody listens at what a killed daemon left behind.
@@ -186,11 +186,11 @@ SandboxBroker::~SandboxBroker() {
         unlinkat(_directory.get(), socketName, 0);
 }
 
-Result<OwnedDescriptor> SandboxBroker::connect(const Root& root) {
+Result<Descriptor> SandboxBroker::connect(const Root& root) {
     const std::string path = root.runtime() + "/" + socketName;
-    OwnedDescriptor directory(::open(root.runtime().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    Descriptor directory(::open(root.runtime().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!directory) return systemError(errno, path);
-    OwnedDescriptor connection(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+    Descriptor connection(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
     if (!connection) return systemError(errno, path);
     const timeval patience{10, 0}; // the broker answers at once or is in trouble
     setsockopt(connection.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
@@ -217,13 +217,13 @@ void SandboxBroker::run() {
 void SandboxBroker::acceptWaiting() {
     // As many as may be silent, then a look at the stop event and at the others.
     for (std::size_t count = 0; count < maximumSilentConnections; ++count) {
-        OwnedDescriptor connection(accept4(_listener.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+        Descriptor connection(accept4(_listener.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
         if (!connection && (errno == EMFILE || errno == ENFILE)) {
             // Left waiting, the connection would wake this thread again and again.
-            _reserve = OwnedDescriptor();
-            OwnedDescriptor refused(accept4(_listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
-            refused = OwnedDescriptor();
-            _reserve = OwnedDescriptor(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+            _reserve = Descriptor();
+            Descriptor refused(accept4(_listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
+            refused = Descriptor();
+            _reserve = Descriptor(::open("/dev/null", O_RDONLY | O_CLOEXEC));
             return;
         }
         if (!connection) return;
@@ -238,7 +238,7 @@ bool SandboxBroker::serve(int connection) {
     // With MSG_TRUNC the packet's real size comes back, however much of it fits.
     ssize_t size = recv(connection, token.data(), token.size(), MSG_DONTWAIT | MSG_TRUNC);
     if (size < 0) return errno != EAGAIN && errno != EINTR;
-    OwnedDescriptor opened;
+    Descriptor opened;
     if (size == 0) return true; // hung up
     if (static_cast<std::size_t>(size) > maximumTokenSize) {
         sendReply(connection, EINVAL, opened);
@@ -247,12 +247,12 @@ bool SandboxBroker::serve(int connection) {
     auto grant = _signer.verify(std::string_view(token).substr(0, static_cast<std::size_t>(size)));
     int number = EPERM;
     if (grant) number = grant->kind == SandboxGrant::Kind::file ? open(*grant, connection, opened) : 0;
-    if (number != 0) opened = OwnedDescriptor();
+    if (number != 0) opened = Descriptor();
     sendReply(connection, number, opened);
     return true;
 }
 
-int SandboxBroker::open(const SandboxGrant& grant, int connection, OwnedDescriptor& opened) const {
+int SandboxBroker::open(const SandboxGrant& grant, int connection, Descriptor& opened) const {
     FileStatus status;
     {
         ActingAsPeer peer(connection);
@@ -260,14 +260,13 @@ int SandboxBroker::open(const SandboxGrant& grant, int connection, OwnedDescript
         open_how how{};
         how.flags = O_PATH | O_CLOEXEC;
         how.resolve = grant.canonical ? RESOLVE_NO_SYMLINKS : RESOLVE_NO_MAGICLINKS;
-        opened =
-            OwnedDescriptor(static_cast<int>(syscall(SYS_openat2, AT_FDCWD, grant.name.c_str(), &how, sizeof how)));
+        opened = Descriptor(static_cast<int>(syscall(SYS_openat2, AT_FDCWD, grant.name.c_str(), &how, sizeof how)));
         if (!opened) return errno;
         if (int number = readFileStatus(opened.get(), "", status)) return number;
         if (status.identity != grant.identity) return ESTALE; // another file has taken the path since
         const std::string path = procPath(opened.get());
         if (S_ISREG(status.mode)) {
-            opened = OwnedDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+            opened = Descriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
             return opened ? 0 : errno;
         }
         // A descriptor for openat alone asks no permission to read the directory itself.

@@ -1,7 +1,7 @@
 #pragma once
 
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/FileStatus.h"
-#include "platform/linux/OwnedDescriptor.h"
 #include "platform/linux/Root.h"
 #include "platform/linux/SandboxToken.h"
 
@@ -27,7 +27,7 @@ public:
     SandboxBroker& operator=(const SandboxBroker&) = delete;
 
     /// A connection to the broker of `root`. Waiting on it is bounded.
-    static Result<OwnedDescriptor> connect(const Root& root);
+    static Result<Descriptor> connect(const Root& root);
 
 private:
     explicit SandboxBroker(TokenSigner& signer) : _signer(signer) {}
@@ -36,15 +36,15 @@ private:
     void acceptWaiting();
     /// False while the peer has not sent its token.
     bool serve(int connection);
-    int open(const SandboxGrant& grant, int connection, OwnedDescriptor& opened) const;
+    int open(const SandboxGrant& grant, int connection, Descriptor& opened) const;
 
     TokenSigner& _signer;
-    OwnedDescriptor _directory;
-    OwnedDescriptor _listener;
-    OwnedDescriptor _stop;
-    OwnedDescriptor _reserve; // given up to accept and close a connection when the process has no descriptor left
+    Descriptor _directory;
+    Descriptor _listener;
+    Descriptor _stop;
+    Descriptor _reserve; // given up to accept and close a connection when the process has no descriptor left
     FileIdentity _socket;
-    std::deque<OwnedDescriptor> _silent; // oldest first; used on the thread only
+    std::deque<Descriptor> _silent; // oldest first; used on the thread only
     std::thread _thread;
 };
 

@@ -14,6 +14,7 @@
 #include <optional>
 #include <poll.h>
 #include <pthread.h>
+#include <sys/stat.h>
 #include <sys/uio.h>
 #include <unistd.h>
 
@@ -91,13 +92,30 @@ std::string timeStamp() {
     using namespace std::chrono;
     const auto now = system_clock::now().time_since_epoch();
     const std::time_t whole = duration_cast<seconds>(now).count();
-    const auto fraction = static_cast<int>(duration_cast<microseconds>(now).count() % 1'000'000);
-    std::tm parts{};
-    gmtime_r(&whole, &parts); // no local time: its rules are read from a file, under a lock
-    std::array<char, 64> text;
-    std::size_t length = std::strftime(text.data(), text.size(), "%Y-%m-%dT%H:%M:%S", &parts);
-    length += static_cast<std::size_t>(std::snprintf(&text[length], text.size() - length, ".%06dZ", fraction));
-    return std::string(text.data(), length);
+    auto fraction = static_cast<unsigned>(duration_cast<microseconds>(now).count() % 1'000'000);
+    // Lines come in thousands per second; only their fraction differs.
+    thread_local std::time_t writtenSecond = -1;
+    thread_local std::string text = "0000-00-00T00:00:00.000000Z";
+    constexpr std::size_t secondLength = 19;
+    if (whole != writtenSecond) {
+        std::tm parts{};
+        gmtime_r(&whole, &parts); // no local time: its rules are read from a file, under a lock
+        std::array<char, 64> second;
+        if (std::strftime(second.data(), second.size(), "%Y-%m-%dT%H:%M:%S", &parts) == secondLength)
+            text.replace(0, secondLength, second.data(), secondLength);
+        writtenSecond = whole;
+    }
+    for (std::size_t digit = secondLength + 6; digit > secondLength; --digit, fraction /= 10)
+        text[digit] = static_cast<char>('0' + fraction % 10);
+    return text;
+}
+
+/// Whether writing may wait for a reader, or find that there is none any more. Plain files and the null device have
+/// none, so their lines cost one system call.
+bool hasReader(int descriptor) {
+    struct stat status{};
+    if (::fstat(descriptor, &status) != 0) return true;
+    return !S_ISREG(status.st_mode) && !(S_ISCHR(status.st_mode) && ::isatty(descriptor) == 0);
 }
 
 /// Keeps SIGPIPE of one write from stopping the process: the reader of the log may be gone.
@@ -128,6 +146,8 @@ private:
 std::string printableLine(std::string_view message, std::size_t limit) {
     constexpr std::string_view ellipsis = "...";
     constexpr std::string_view hexadecimal = "0123456789abcdef";
+    const bool isPlain = std::all_of(message.begin(), message.end(), [](char c) { return c >= 0x20 && c < 0x7F; });
+    if (isPlain && message.size() <= limit) return std::string(message);
     std::string out;
     out.reserve(std::min(message.size(), limit));
     std::size_t cut = 0; // where whole pieces end with room for the ellipsis
@@ -166,7 +186,10 @@ std::string printableLine(std::string_view message, std::size_t limit) {
 }
 
 SystemLog::SystemLog(std::string identifier, std::string_view settings, int descriptor, Destination destination)
-    : _identifier(std::move(identifier)), _descriptor(descriptor), _default(*this, "", "") {
+    : _identifier(std::move(identifier)),
+      _descriptor(descriptor),
+      _hasReader(hasReader(descriptor)),
+      _default(*this, "", "") {
     if (destination == Destination::automatic)
         _usesJournal = ::access(journalSocket, W_OK) == 0 && ::isatty(descriptor) == 0;
     apply(settings);
@@ -268,6 +291,17 @@ void SystemLog::writeToDescriptor(const LogRecord& record) {
     line += printableLine(record.message, maximumLineLength - line.size() - 1);
     line += '\n';
 
+    const auto write = [&] {
+        // One write for one line, so that lines of several threads and processes stay whole.
+        ssize_t written = -1;
+        do written = ::write(_descriptor, line.data(), line.size());
+        while (written < 0 && errno == EINTR);
+        return written;
+    };
+    if (!_hasReader) {
+        static_cast<void>(write());
+        return;
+    }
     pollfd ready{_descriptor, POLLOUT, 0};
     if (::poll(&ready, 1, _isStalled.load(std::memory_order_relaxed) ? 0 : stallMilliseconds) == 0) {
         _isStalled.store(true, std::memory_order_relaxed);
@@ -275,11 +309,7 @@ void SystemLog::writeToDescriptor(const LogRecord& record) {
     }
     _isStalled.store(false, std::memory_order_relaxed);
     PipeSignalGuard guard;
-    // One write for one line, so that lines of several threads and processes stay whole.
-    ssize_t written = -1;
-    do written = ::write(_descriptor, line.data(), line.size());
-    while (written < 0 && errno == EINTR);
-    guard.brokenPipe = written < 0 && errno == EPIPE;
+    guard.brokenPipe = write() < 0 && errno == EPIPE;
 }
 
 } // namespace linux_

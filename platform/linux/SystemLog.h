@@ -54,6 +54,7 @@ private:
 
     const std::string _identifier;
     const int _descriptor;
+    const bool _hasReader;
     bool _usesJournal = false;                            // fixed once constructed
     PrivateArguments _privacy = PrivateArguments::hidden; // fixed once constructed
     std::atomic<bool> _isStalled = false;

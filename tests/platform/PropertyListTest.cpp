@@ -692,4 +692,15 @@ TEST(XMLDecoding, BoundsNesting) {
     EXPECT_TRUE(decodePropertyList(xml("<array>" + many + "</array>")));
 }
 
+TEST(ValueStrings, IllFormedBytesBecomeReplacementCharacters) {
+    for (const auto& [bytes, expected] : {std::pair<std::string, std::string>{"caf\xE9.app", "caf\xEF\xBF\xBD.app"},
+                                          {std::string("a\0b", 3), "a\xEF\xBF\xBD" "b"},
+                                          {"\xC3\xA9\xED\xA0\x80", "\xC3\xA9\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD"}}) {
+        EXPECT_EQ(Value(bytes).string(), expected);
+        std::string encoded;
+        appendCompact(encoded, Value(bytes));
+        EXPECT_TRUE(decodeCompact(encoded, UUIDs::refused));
+    }
+}
+
 } // namespace

@@ -189,17 +189,17 @@ TEST_F(LinuxSandbox, ConsumedDirectoryGivesWhatIsBelow) {
     std::int64_t handle = host.consume(*issue("Bundle"), number);
     ASSERT_GE(handle, 0) << number;
     int directory = subject.host.descriptor(handle);
-    linux_::OwnedDescriptor font(openat(directory, "Font", O_RDONLY | O_CLOEXEC));
+    linux_::Descriptor font(openat(directory, "Font", O_RDONLY | O_CLOEXEC));
     EXPECT_EQ(contentsOf(font.get()), "Bundle");
     if (geteuid() != 0) return;
     // From here on as root's daemon: nothing above is reached, nothing can be changed.
-    linux_::OwnedDescriptor above(openat(directory, "../Bundle2/Font", O_RDONLY | O_CLOEXEC));
+    linux_::Descriptor above(openat(directory, "../Bundle2/Font", O_RDONLY | O_CLOEXEC));
     if (above) {
-        linux_::OwnedDescriptor copy(open_tree(AT_FDCWD, "/", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC));
+        linux_::Descriptor copy(open_tree(AT_FDCWD, "/", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC));
         if (!copy) GTEST_SKIP() << "may not copy mounts";
     }
     EXPECT_FALSE(above);
-    linux_::OwnedDescriptor written(openat(directory, "Font", O_WRONLY | O_CLOEXEC));
+    linux_::Descriptor written(openat(directory, "Font", O_WRONLY | O_CLOEXEC));
     EXPECT_FALSE(written);
     EXPECT_EQ(errno, EROFS);
 }
@@ -283,7 +283,7 @@ TEST_F(LinuxSandbox, ConfinedHostReachesWhatItCannotSee) {
         // The host sees the runtime directory and, of the rest, nothing.
         const std::string runtime = at("run");
         if (unshare(CLONE_NEWNS) != 0 || mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return 9;
-        linux_::OwnedDescriptor kept(open(runtime.c_str(), O_PATH | O_DIRECTORY));
+        linux_::Descriptor kept(open(runtime.c_str(), O_PATH | O_DIRECTORY));
         if (mount("none", subject.directory.c_str(), "tmpfs", 0, nullptr) != 0 || mkdir(runtime.c_str(), 0755) != 0 ||
             mount(("/proc/self/fd/" + std::to_string(kept.get())).c_str(), runtime.c_str(), nullptr, MS_BIND,
                   nullptr) != 0)
@@ -293,9 +293,9 @@ TEST_F(LinuxSandbox, ConfinedHostReachesWhatItCannotSee) {
         std::int64_t handle = subject.host.consume(token, number);
         if (handle < 0) return number == EPERM ? 9 : 2; // may mount, but may not copy mounts
         int directory = subject.host.descriptor(handle);
-        linux_::OwnedDescriptor font(openat(directory, "Font", O_RDONLY));
+        linux_::Descriptor font(openat(directory, "Font", O_RDONLY));
         if (contentsOf(font.get()) != "Bundle") return 3;
-        linux_::OwnedDescriptor above(openat(directory, "../Bundle2/Font", O_RDONLY));
+        linux_::Descriptor above(openat(directory, "../Bundle2/Font", O_RDONLY));
         return above ? 4 : 0;
     });
     if (result == 9) GTEST_SKIP() << "may not mount";
@@ -304,7 +304,7 @@ TEST_F(LinuxSandbox, ConfinedHostReachesWhatItCannotSee) {
 
 TEST_F(LinuxSandbox, SilentAndUnmannerlyPeersDelayNobody) {
     const auto token = *issue("Bundle/Font");
-    std::vector<linux_::OwnedDescriptor> peers;
+    std::vector<linux_::Descriptor> peers;
     for (std::size_t count = 0; count < 3 * linux_::maximumSilentConnections; ++count) {
         auto peer = linux_::SandboxBroker::connect(linux_::Root(subject.directory));
         ASSERT_TRUE(peer) << peer.error().text();
@@ -321,7 +321,7 @@ TEST_F(LinuxSandbox, SilentAndUnmannerlyPeersDelayNobody) {
     EXPECT_EQ(recv(peers.back().get(), &number, sizeof number, 0), static_cast<ssize_t>(sizeof number));
     EXPECT_EQ(number, EINVAL);
     // One that leaves without reading.
-    peers[peers.size() - 2] = linux_::OwnedDescriptor();
+    peers[peers.size() - 2] = linux_::Descriptor();
     EXPECT_EQ(consumeError(token), 0);
 }
 
@@ -334,9 +334,9 @@ TEST_F(LinuxSandbox, BrokerSurvivesLackOfDescriptors) {
         ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
         // This process is host and daemon at once: with two numbers left, the host's socket takes what the daemon
         // needs to accept it.
-        linux_::OwnedDescriptor next(dup(0));
+        linux_::Descriptor next(dup(0));
         rlimit tight{static_cast<rlim_t>(next.get()) + 2, before.rlim_max};
-        next = linux_::OwnedDescriptor();
+        next = linux_::Descriptor();
         ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &tight), 0);
         EXPECT_NE(consumeError(token), 0);
         ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);

@@ -6,11 +6,11 @@
 
 namespace support {
 
-/// A directory of its own under /tmp, removed with everything in it.
+/// A directory of its own under /tmp or another place, removed with everything in it.
 class ScratchDirectory {
 public:
-    ScratchDirectory() {
-        std::string name = "/tmp/zbd-test-XXXXXX";
+    explicit ScratchDirectory(const std::string& place = "/tmp") {
+        std::string name = place + "/zbd-test-XXXXXX";
         _path = std::filesystem::canonical(mkdtemp(name.data())).string();
     }
     ~ScratchDirectory() {

@@ -268,8 +268,8 @@ TEST_F(Client, EntitlementsCountUnlessFalse) {
 }
 
 TEST_F(Client, DeathReleasesItsHoldsAndDropsWaitingRequests) {
-    const auto other = zbd::ZBDQmxClient::initWithConnection(
-        daemon.fake.transport.makePair(daemon.peer, daemon.fake.queues.makeSerial("other")).second, daemon.server);
+    const auto ends = daemon.fake.transport.makePair(daemon.peer, daemon.fake.queues.makeSerial("other"));
+    const auto other = zbd::ZBDQmxClient::initWithConnection(ends.second, daemon.server);
     const auto first = hold({plugIn("a")}, client);
     const auto kept = hold({}, other);
     const auto second = hold({}, client);
