@@ -21,7 +21,7 @@ struct ApplicationRecord;
 struct PlugInProxy {
     std::optional<UUID> uuid;
     std::optional<URL> bundleURL;
-    std::optional<std::string> plugInIdentifier;   // "VKExtensionIdentifier" of the plug-in dictionary, else the bundle's
+    std::optional<std::string> plugInIdentifier; // "VKExtensionIdentifier" of the plug-in dictionary, else the bundle's
     std::optional<std::string> originalIdentifier; // the identifier under which the plug-in was first registered
     std::optional<std::string> bundleIdentifier;
     std::optional<std::string> bundleVersion;
@@ -73,7 +73,8 @@ public:
 
     /// A subset of the installed plug-ins that holds every one that matches `query` in the match-pattern language and
     /// passes `filter`, which is called before this returns.
-    virtual std::optional<std::vector<PlugInProxyRef>> plugInsMatching(const Dictionary& query, const Filter& filter) = 0;
+    virtual std::optional<std::vector<PlugInProxyRef>> plugInsMatching(const Dictionary& query,
+                                                                       const Filter& filter) = 0;
 
     virtual PlugInProxyRef plugInForUUID(const UUID& uuid) = 0;
     /// File URLs only; the location is compared after symbolic links are resolved.
@@ -83,6 +84,7 @@ public:
     /// In the order of their paths.
     virtual std::vector<PlugInProxyRef> plugInsOfApplication(const ApplicationRecord& application) = 0;
 
+    // These two return after the notices of what they changed, and must not be called inside a notice.
     /// False when there is no usable plug-in bundle at the location.
     virtual bool registerPlugIn(const URL& url) = 0;
     /// False when nothing is registered there.
@@ -95,8 +97,8 @@ public:
     virtual std::uint64_t knowledgeSequenceNumber() = 0;
 
     /// For each key found in the bundle's string table in the user's language, the string.
-    virtual std::map<std::string, std::string> localizedStrings(const PlugInProxy& proxy, const std::set<std::string>& keys,
-                                                                const std::string& table) = 0;
+    virtual std::map<std::string, std::string>
+    localizedStrings(const PlugInProxy& proxy, const std::set<std::string>& keys, const std::string& table) = 0;
 
     virtual std::optional<Dictionary> sdkDictionary(const std::string& extensionPoint) = 0;
 };

@@ -1,0 +1,160 @@
+#include "platform/linux/BundleScanner.h"
+
+#include "platform/Hashing.h"
+#include "platform/linux/Descriptor.h"
+#include "platform/linux/DirectoryFiles.h"
+#include "platform/linux/Entitlements.h"
+
+#include <algorithm>
+#include <cstring>
+#include <ctime>
+#include <fcntl.h>
+#include <sys/stat.h>
+
+namespace platform::linux_ {
+
+namespace {
+
+constexpr std::int64_t nanoseconds = 1'000'000'000;
+
+std::int64_t inNanoseconds(const statx_timestamp& time) { return time.tv_sec * nanoseconds + time.tv_nsec; }
+
+template <class T> void append(std::string& bytes, const T& value) {
+    bytes.append(reinterpret_cast<const char*>(&value), sizeof value);
+}
+
+std::uint64_t digest(std::string_view bytes) {
+    const std::string hash = sha1(bytes);
+    std::uint64_t value = 0;
+    std::memcpy(&value, hash.data(), sizeof value);
+    return std::max<std::uint64_t>(value, 1); // 0 stands for "none"
+}
+
+/// Now, by the clock that files are stamped with.
+std::int64_t fileClock() {
+    timespec now{};
+    clock_gettime(CLOCK_REALTIME_COARSE, &now);
+    return now.tv_sec * nanoseconds + now.tv_nsec;
+}
+
+} // namespace
+
+/// The states of the files of one bundle. Made before anything is read, so that whatever changes meanwhile counts as
+/// recent and is read again another time.
+class BundleScanner::FileStates {
+public:
+    FileIdentity add(int directory, const std::string& name, int flags = 0) {
+        struct statx status{};
+        if (statx(directory, name.c_str(), flags | AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &status) !=
+            0) {
+            _states += "absent";
+            return {};
+        }
+        const FileIdentity identity{(std::uint64_t{status.stx_dev_major} << 32U) | status.stx_dev_minor, status.stx_ino,
+                                    (status.stx_mask & STATX_BTIME) != 0 ? inNanoseconds(status.stx_btime) : 0};
+        const std::int64_t changed = inNanoseconds(status.stx_ctime);
+        append(_states, identity.device);
+        append(_states, identity.inode);
+        append(_states, identity.birth);
+        append(_states, status.stx_size);
+        append(_states, inNanoseconds(status.stx_mtime));
+        append(_states, changed);
+        _states += name;
+        // A file that changes twice within one tick of its clock shows one time for both. Whole seconds are the ticks
+        // of old file systems.
+        const std::int64_t tick = changed % nanoseconds == 0 ? 2 * nanoseconds : nanoseconds / 10;
+        if (changed > _start - tick) _isRecent = true;
+        return identity;
+    }
+
+    /// As `BundleFacts::evidence`.
+    std::uint64_t evidence() const { return _isRecent ? 0 : digest(_states); }
+
+private:
+    const std::int64_t _start = fileClock();
+    std::string _states;
+    bool _isRecent = false;
+};
+
+bool BundleScanner::visitResources(int directory, const std::string& path, FileStates& states,
+                                   std::string* content) const {
+    const Descriptor resources = openDirectory(directory, resourcesName);
+    if (!resources) return false;
+    const std::string resourcesPath = path + "/" + resourcesName;
+    _watch(resources.get(), resourcesPath);
+    auto languages = listDirectory(resources.get()).value_or(DirectoryListing()).directories;
+    if (languages.size() > maximumResourceEntries) languages.resize(maximumResourceEntries);
+    for (const auto& language : languages) {
+        const Descriptor folder = openDirectory(resources.get(), language);
+        if (!folder) continue;
+        _watch(folder.get(), resourcesPath + "/" + language);
+        auto tables = listDirectory(folder.get()).value_or(DirectoryListing()).others;
+        std::erase_if(tables, [](const auto& name) { return !name.ends_with(tableSuffix); });
+        if (tables.size() > maximumResourceEntries) tables.resize(maximumResourceEntries);
+        for (const auto& table : tables) {
+            states.add(folder.get(), table);
+            if (content == nullptr) continue;
+            const auto bytes = readFile(folder.get(), table, maximumManifestSize);
+            *content += language + "/" + table + "=";
+            if (bytes && *bytes) *content += **bytes;
+        }
+    }
+    return true;
+}
+
+ScannedBundle BundleScanner::scan(int directory, const std::string& path, BundleKind kind,
+                                  const BundleFactsRef& known) const {
+    using State = ScannedBundle::State;
+    _watch(directory, path);
+    if (known && known->evidence != 0) {
+        FileStates states;
+        const bool isSameDirectory = states.add(directory, "", AT_EMPTY_PATH) == known->identity;
+        states.add(directory, manifestName);
+        if (!known->executable.empty()) states.add(directory, known->executable);
+        // Where none were, the directory's own state tells that there are none.
+        if (known->hasResources) visitResources(directory, path, states, nullptr);
+        if (isSameDirectory && states.evidence() == known->evidence)
+            return {State::unchanged, {}, known->identity, known};
+    }
+
+    FileStates states;
+    auto facts = std::make_shared<BundleFacts>();
+    facts->identity = states.add(directory, "", AT_EMPTY_PATH);
+    states.add(directory, manifestName);
+    const auto bytes = readFile(directory, manifestName, maximumManifestSize);
+    if (!bytes && isShortage(static_cast<int>(bytes.error().code)))
+        return {State::unknown, bytes.error().text(), facts->identity, nullptr};
+    const auto without = [&](State state, std::string reason) {
+        return ScannedBundle{state, std::move(reason), facts->identity, nullptr};
+    };
+    if (!bytes) return without(State::unusable, bytes.error().text());
+    if (!*bytes) return without(State::absent, {});
+    if ((*bytes)->empty()) return without(State::unfinished, {});
+    const auto value = decodePropertyList(**bytes);
+    if (!value) return without(State::unusable, std::string(manifestName) + ": " + value.error().text());
+    const auto info = value->dictionary();
+    if (!info) return without(State::unusable, std::string(manifestName) + ": not a dictionary");
+    facts->info = std::make_shared<const StoredDictionary>(*info, _keys);
+    std::string content;
+    appendCompact(content, *info);
+
+    const auto executable = info->string("VBBundleExecutable");
+    if (kind == BundleKind::plugIn && executable && isFileName(*executable)) {
+        facts->executable = *executable;
+        states.add(directory, facts->executable);
+        const Descriptor program(openat(directory, facts->executable.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+        const auto entitlements = program ? readEntitlements(program.get()) : Result(std::optional<Dictionary>());
+        // Entitlements that cannot be read entitle to nothing.
+        if (entitlements && *entitlements) {
+            content += "entitlements=";
+            appendCompact(content, **entitlements);
+            facts->entitlements = std::make_shared<const StoredDictionary>(**entitlements, _keys);
+        }
+    }
+    facts->hasResources = visitResources(directory, path, states, &content);
+    facts->evidence = states.evidence();
+    facts->fingerprint = digest(content);
+    return {State::read, {}, facts->identity, facts};
+}
+
+} // namespace platform::linux_

@@ -1,0 +1,60 @@
+#pragma once
+
+#include "platform/linux/BundleFacts.h"
+
+#include <cstddef>
+#include <functional>
+#include <string>
+
+namespace platform::linux_ {
+
+inline constexpr const char* manifestName = "Info.vlist";
+inline constexpr const char* resourcesName = "Resources";
+inline constexpr std::string_view tableSuffix = ".vlist";
+
+/// A manifest is a page of text; what is larger is a mistake or an attack.
+inline constexpr std::size_t maximumManifestSize = 1U << 20U;
+
+/// Languages of a bundle, and string tables of a language, that are looked at.
+inline constexpr std::size_t maximumResourceEntries = 256;
+
+enum class BundleKind { application, plugIn };
+
+struct ScannedBundle {
+    enum class State {
+        absent,     // no manifest: not a bundle
+        unfinished, // an empty manifest: its writer is about to fill it
+        unusable,   // with a reason
+        unknown,    // the system is short of something
+        unchanged,  // the facts that were known are still true
+        read,       // new facts
+    };
+    State state = State::absent;
+    std::string reason;
+    FileIdentity identity; // of the directory, in every state
+    BundleFactsRef facts;
+};
+
+/// Reads bundles from disk. Nothing that a bundle contains makes it block, follow links or take more memory than the
+/// bounds above.
+class BundleScanner {
+public:
+    /// Called with each directory of a bundle before anything in it is looked at, so that whoever watches it misses
+    /// no later change.
+    using Watch = std::function<void(int directory, const std::string& path)>;
+
+    BundleScanner(Watch watch, SharedKeys& keys) : _watch(std::move(watch)), _keys(keys) {}
+
+    /// `directory` is open, `path` its name for `watch`. `known` are the facts of an earlier scan, or null.
+    ScannedBundle scan(int directory, const std::string& path, BundleKind kind, const BundleFactsRef& known) const;
+
+private:
+    class FileStates;
+    /// Goes through the string tables, and with `content` appends what they contain to it. False without resources.
+    bool visitResources(int directory, const std::string& path, FileStates& states, std::string* content) const;
+
+    const Watch _watch;
+    SharedKeys& _keys;
+};
+
+} // namespace platform::linux_

@@ -1,0 +1,605 @@
+#include "platform/linux/InstalledBundles.h"
+
+#include "platform/SystemLog.h"
+#include "platform/linux/DirectoryFiles.h"
+
+#include <algorithm>
+#include <chrono>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+
+namespace platform::linux_ {
+
+namespace {
+
+constexpr std::string_view applicationSuffix = ".app";
+constexpr std::string_view plugInsName = "PlugIns";
+/// Folders below an applications directory in which applications are looked for.
+constexpr std::size_t maximumFolderDepth = 4;
+/// Each registration by path is looked at with every change on disk.
+constexpr std::size_t maximumRegistrations = 4096;
+constexpr const char* everything = ""; // every path is below it
+
+LogHandle& cx() {
+    // The log belongs to the process and is set before the first service is made.
+    LogHandle* handle = systemLog().createHandle("com.nordane.Zembra", "cx");
+    return handle != nullptr ? *handle : systemLog().defaultHandle();
+}
+
+Date now() { return Date{std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count()}; }
+
+bool isApplicationName(std::string_view path) {
+    const auto name = path.substr(path.rfind('/') + 1);
+    return name.size() > applicationSuffix.size() && name.ends_with(applicationSuffix);
+}
+
+/// The directories above `path`, the nearest first, without "/".
+std::vector<std::string> ancestors(std::string path) {
+    std::vector<std::string> directories;
+    while (true) {
+        path.resize(path.rfind('/'));
+        if (path.empty()) return directories;
+        directories.push_back(path);
+    }
+}
+
+/// The elements of a map by path that lie at or below `place`.
+template <class Map> std::vector<std::string> pathsBelow(const Map& map, const std::string& place) {
+    std::vector<std::string> paths;
+    for (auto next = map.lower_bound(place); next != map.end() && next->first.starts_with(place); ++next) {
+        if (isAtOrBelow(next->first, place)) paths.push_back(next->first);
+    }
+    return paths;
+}
+
+template <class Map> auto lookUp(const Map& map, const std::string& path) {
+    const auto found = map.find(path);
+    return found == map.end() ? typename Map::mapped_type() : found->second;
+}
+
+std::optional<std::string> text(const Dictionary& dictionary, std::string_view key) {
+    const auto view = dictionary.string(key);
+    return view ? std::optional<std::string>(*view) : std::nullopt;
+}
+
+} // namespace
+
+InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limits)
+    : _top(root.directory()),
+      _folders{{root.applications(), FolderKind::applications},
+               {root.system() + "/Applications", FolderKind::applications},
+               {root.system() + "/Library/PlugIns", FolderKind::plugIns}},
+      _limits(limits),
+      _store(root.database() + "/Catalix.sqlite", _keys),
+      _watcher(limits.watches),
+      _scanner([this](int directory,
+                      const std::string& path) { _watcher.watch(directory, path, RegistryWatcher::Role::content); },
+               _keys) {
+    std::optional<std::string> problem;
+    auto contents = _store.open(problem);
+    if (problem) cx().error("the registry's database was not usable: %{public}s", *problem);
+    _applications = std::move(contents.applications);
+    _plugIns = std::move(contents.plugIns);
+    _registrations = std::move(contents.registrations);
+    _exclusions = std::move(contents.exclusions);
+    _isKnowledgeUnsaved = !contents.knowledge;
+    _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
+    rescan({everything}, Manifests::settled);
+}
+
+/// The application, the plug-in outside applications or the subfolder at or around `path`. None for what is no
+/// bundle's business.
+std::optional<std::string> InstalledBundles::placeInFolder(const Folder& folder, const std::string& path) const {
+    if (!isAtOrBelow(path, folder.path) || path == folder.path) return std::nullopt;
+    std::size_t end = folder.path.size();
+    for (std::size_t depth = 0; depth <= maximumFolderDepth; ++depth) {
+        if (path[end + 1] == '.') return std::nullopt; // hidden, as the unfinished copies of installers are
+        end = std::min(path.find('/', end + 1), path.size());
+        std::string place = path.substr(0, end);
+        if (folder.kind == FolderKind::plugIns || isApplicationName(place) || end == path.size()) return place;
+    }
+    return std::nullopt;
+}
+
+bool InstalledBundles::isDiscovered(const std::string& path) const {
+    const std::size_t slash = path.rfind('/');
+    if (path.compare(slash + 1, 1, ".") == 0) return false;
+    return std::ranges::any_of(_folders, [&](const Folder& folder) {
+        const auto place = placeInFolder(folder, path);
+        if (!place) return false;
+        if (folder.kind == FolderKind::plugIns) return *place == path;
+        return path.substr(0, slash) == *place + "/" + std::string(plugInsName);
+    });
+}
+
+void InstalledBundles::touch(const std::string& path, Places& places) const {
+    for (const auto& folder : _folders) {
+        if (isAtOrBelow(folder.path, path)) places.insert(folder.path);
+        if (auto place = placeInFolder(folder, path)) places.insert(*std::move(place));
+    }
+    for (const auto& registration : _registrations) {
+        if (isAtOrBelow(registration, path) || isAtOrBelow(path, registration)) places.insert(registration);
+        for (auto& directory : ancestors(registration)) {
+            if (isApplicationName(directory) && isAtOrBelow(path, directory)) places.insert(std::move(directory));
+        }
+    }
+}
+
+InstalledBundles::Change InstalledBundles::catchUp() {
+    std::vector<RegistryWatcher::Event> events;
+    if (!_watcher.read(events)) {
+        cx().info("too many changes at once; looking at all bundles");
+        return rescan({everything}, Manifests::settled);
+    }
+    Places places;
+    for (const auto& event : events) {
+        const std::string path = event.name.empty() ? event.directory : event.directory + "/" + event.name;
+        // A file made just now is told again when its writer closes it. (One that was linked here is not, and is
+        // not empty either.)
+        struct stat status{};
+        if ((event.mask & (IN_CREATE | IN_ISDIR)) == IN_CREATE && lstat(path.c_str(), &status) == 0 &&
+            S_ISREG(status.st_mode) && status.st_size == 0)
+            continue;
+        if (event.name == manifestName) _settledManifests.insert(event.directory);
+        touch(path, places);
+    }
+    auto change = rescan(std::move(places), Manifests::maybeBeingWritten);
+    _settledManifests.clear();
+    return change;
+}
+
+InstalledBundles::Change InstalledBundles::verify() {
+    Places places = _incomplete;
+    for (const auto& directory : _watcher.unwatched()) touch(directory, places);
+    return rescan(std::move(places), Manifests::settled);
+}
+
+bool InstalledBundles::registerPlugIn(const std::string& path, const Tell& tell) {
+    if (_exclusions.erase(path) > 0) _unsavedExclusions.insert(path);
+    Places places;
+    touch(path, places);
+    tell(rescan(std::move(places), Manifests::maybeBeingWritten));
+    // One that lies where plug-ins are looked for comes and goes with its bundle and needs no registration.
+    if (_plugIns.contains(path)) return true;
+    if (_registrations.size() >= maximumRegistrations) {
+        cx().error("too many plug-ins are registered by path");
+        return false;
+    }
+    if (!_registrations.insert(path).second) return false; // awaited, and still not there
+    _unsavedRegistrations.insert(path);
+    tell(rescan({path}, Manifests::maybeBeingWritten));
+    if (_plugIns.contains(path)) return true;
+    _registrations.erase(path);
+    _unsavedRegistrations.insert(path);
+    save();
+    return false;
+}
+
+bool InstalledBundles::unregisterPlugIn(const std::string& path, const Tell& tell) {
+    const auto plugIn = lookUp(_plugIns, path);
+    const bool wasRegistered = _registrations.erase(path) > 0;
+    if (wasRegistered) _unsavedRegistrations.insert(path);
+    if (plugIn && isDiscovered(path)) {
+        _exclusions[path] = plugIn->facts->identity;
+        _unsavedExclusions.insert(path);
+    }
+    if (!plugIn && !wasRegistered) return false;
+    tell(rescan({path}, Manifests::maybeBeingWritten));
+    return true;
+}
+
+InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manifests) {
+    // A place within another one is seen to with that one.
+    const Places all = places;
+    std::erase_if(places, [&](const auto& place) {
+        if (place == everything) return false;
+        return all.contains(everything) ||
+               std::ranges::any_of(ancestors(place), [&](const auto& directory) { return all.contains(directory); });
+    });
+    _manifests = manifests;
+    _isShort = false;
+    Found found;
+    _watcher.beginRound(places);
+    for (const auto& place : places) scanPlace(place, found);
+    if (_isShort) {
+        // Nothing may go for the reason that it could not be looked at.
+        cx().error("short of descriptors or memory; bundles are looked at again later");
+        _incomplete.insert(places.begin(), places.end());
+        places.clear();
+    } else {
+        _watcher.endRound(places);
+        for (const auto& place : places) _incomplete.erase(place);
+    }
+    const bool isUnwatched = !_watcher.unwatched().empty();
+    if (isUnwatched && !_hasToldOfUnwatched)
+        cx().error("cannot watch %lu directories; raise fs.inotify.max_user_watches", _watcher.unwatched().size());
+    _hasToldOfUnwatched = isUnwatched;
+    auto change = takeIn(places, found);
+    save();
+    return change;
+}
+
+void InstalledBundles::scanPlace(const std::string& place, Found& found) {
+    for (const auto& folder : _folders) {
+        if (isAtOrBelow(folder.path, place)) {
+            watchPassage(folder.path, _top);
+            if (const Descriptor directory = open(folder.path))
+                scanFolder(directory.get(), folder.path, folder.kind, 0, found);
+        } else if (const auto inFolder = placeInFolder(folder, place)) {
+            const Descriptor directory = open(*inFolder);
+            if (!directory) continue;
+            const auto depth =
+                std::count(inFolder->begin() + static_cast<std::ptrdiff_t>(folder.path.size()), inFolder->end(), '/');
+            if (folder.kind == FolderKind::plugIns)
+                scanPlugIn(directory.get(), *inFolder, {}, found);
+            else if (isApplicationName(*inFolder))
+                scanApplication(directory.get(), *inFolder, found);
+            else
+                scanFolder(directory.get(), *inFolder, folder.kind, static_cast<std::size_t>(depth), found);
+        }
+    }
+    for (auto next = _registrations.lower_bound(place); next != _registrations.end() && next->starts_with(place);
+         ++next) {
+        if (isAtOrBelow(*next, place) && !found.plugIns.contains(*next)) scanRegistration(*next, found);
+    }
+}
+
+void InstalledBundles::scanFolder(int directory, const std::string& path, FolderKind kind, std::size_t depth,
+                                  Found& found) {
+    _watcher.watch(directory, path, RegistryWatcher::Role::content);
+    for (const auto& name : directoriesIn(directory)) {
+        const Descriptor entry = open(directory, name);
+        if (!entry) continue;
+        const std::string entryPath = path + "/" + name;
+        if (kind == FolderKind::plugIns)
+            scanPlugIn(entry.get(), entryPath, {}, found);
+        else if (isApplicationName(entryPath))
+            scanApplication(entry.get(), entryPath, found);
+        else if (depth < maximumFolderDepth)
+            scanFolder(entry.get(), entryPath, kind, depth + 1, found);
+    }
+}
+
+void InstalledBundles::scanApplication(int directory, const std::string& path, Found& found) {
+    const auto known = lookUp(_applications, path);
+    const auto knownFacts = known ? known->facts : nullptr;
+    const auto scanned = _scanner.scan(directory, path, BundleKind::application, knownFacts);
+    const auto facts = accept(path, scanned, knownFacts);
+    if (!facts) return;
+    _refusals.erase(path);
+    found.applications[path] = facts;
+    const Descriptor plugIns = open(directory, std::string(plugInsName));
+    if (!plugIns) return;
+    const std::string plugInsPath = path + "/" + std::string(plugInsName);
+    _watcher.watch(plugIns.get(), plugInsPath, RegistryWatcher::Role::content);
+    for (const auto& name : directoriesIn(plugIns.get())) {
+        const std::string plugInPath = plugInsPath + "/" + name;
+        if (const Descriptor plugIn = open(plugIns.get(), name)) scanPlugIn(plugIn.get(), plugInPath, path, found);
+    }
+}
+
+void InstalledBundles::scanPlugIn(int directory, const std::string& path, const std::string& application,
+                                  Found& found) {
+    const auto known = lookUp(_plugIns, path);
+    const auto knownFacts = known ? known->facts : nullptr;
+    const auto scanned = _scanner.scan(directory, path, BundleKind::plugIn, knownFacts);
+    if (const auto exclusion = _exclusions.find(path); exclusion != _exclusions.end()) {
+        if (exclusion->second == scanned.identity) return;
+        _exclusions.erase(exclusion); // another bundle took the place of the one that was not wanted
+        _unsavedExclusions.insert(path);
+    }
+    const auto facts = accept(path, scanned, knownFacts);
+    if (!facts) return;
+    if (facts == knownFacts) {
+        found.plugIns[path] = {facts, known->identifier, application};
+        return;
+    }
+    const Dictionary& info = facts->info->dictionary();
+    const auto dictionary = plugInDictionary(info);
+    if (!dictionary) return; // a bundle of another kind
+    auto identifier = text(*dictionary, "VKExtensionIdentifier");
+    if (!identifier) identifier = text(info, "VBBundleIdentifier");
+    // It names directories, and stands in logs. (A plug-in without any is left to the daemon, which says so.)
+    if (identifier && !isFileName(*identifier)) return refuse(path, "unusable identifier");
+    _refusals.erase(path);
+    found.plugIns[path] = {facts, std::move(identifier), application};
+}
+
+void InstalledBundles::scanRegistration(const std::string& path, Found& found) {
+    watchPassage(path, {});
+    const Descriptor directory = open(path);
+    if (!directory) return; // awaited
+    std::string application;
+    for (const auto& candidate : ancestors(path)) {
+        if (!isApplicationName(candidate)) continue;
+        const Descriptor around = open(candidate);
+        if (!around) continue;
+        const auto known = lookUp(_applications, candidate);
+        const auto knownFacts = known ? known->facts : nullptr;
+        const auto scanned = _scanner.scan(around.get(), candidate, BundleKind::application, knownFacts);
+        const auto facts = accept(candidate, scanned, knownFacts);
+        if (!facts) continue;
+        found.applications[candidate] = facts;
+        application = candidate;
+        break;
+    }
+    scanPlugIn(directory.get(), path, application, found);
+}
+
+/// Watches the directories above `path` that exist, up to `top`, for entries that come and go.
+void InstalledBundles::watchPassage(const std::string& path, const std::string& top) {
+    for (const auto& ancestor : ancestors(path)) {
+        if (!isAtOrBelow(ancestor, top)) return;
+        if (const Descriptor directory = open(ancestor))
+            _watcher.watch(directory.get(), ancestor, RegistryWatcher::Role::passage);
+    }
+    if (!top.empty()) return;
+    if (const Descriptor directory = open("/")) _watcher.watch(directory.get(), "", RegistryWatcher::Role::passage);
+}
+
+Descriptor InstalledBundles::open(int parent, const std::string& name) {
+    Descriptor directory = openDirectory(parent, name);
+    if (!directory && isShortage(errno)) _isShort = true;
+    return directory;
+}
+
+Descriptor InstalledBundles::open(const std::string& path) {
+    Descriptor directory = openDirectory(path);
+    if (!directory && isShortage(errno)) _isShort = true;
+    return directory;
+}
+
+std::vector<std::string> InstalledBundles::directoriesIn(int directory) {
+    auto listing = listDirectory(directory);
+    if (!listing && isShortage(errno)) _isShort = true;
+    return std::move(listing).value_or(DirectoryListing()).directories;
+}
+
+/// The facts that hold from now on; null when there is no usable bundle.
+BundleFactsRef InstalledBundles::accept(const std::string& path, const ScannedBundle& scanned,
+                                        const BundleFactsRef& known) {
+    using State = ScannedBundle::State;
+    if (scanned.state == State::unusable || scanned.state == State::unfinished) {
+        // The manifest of a known bundle may be half written; its writer's close will be told.
+        const bool isSettled = _manifests == Manifests::settled || _settledManifests.contains(path);
+        if (!isSettled && known && known->identity == scanned.identity) return known;
+        if (scanned.state == State::unusable) refuse(path, scanned.reason);
+        return nullptr;
+    }
+    if (scanned.state == State::unknown) {
+        _isShort = true;
+        return known;
+    }
+    return scanned.facts;
+}
+
+void InstalledBundles::refuse(const std::string& path, const std::string& reason) {
+    auto& last = _refusals[path];
+    if (last == reason) return;
+    last = reason;
+    cx().error("ignoring bundle at %{public}s: %{public}s", path, reason);
+}
+
+InstalledBundles::Change InstalledBundles::takeIn(const Places& places, const Found& found) {
+    for (const auto& place : places) {
+        // A reason is worth a line again when another bundle comes to the place of one that went.
+        for (const auto& path : pathsBelow(_refusals, place)) {
+            struct stat status{};
+            if (lstat(path.c_str(), &status) != 0) _refusals.erase(path);
+        }
+        for (const auto& path : pathsBelow(_exclusions, place)) {
+            struct stat status{};
+            if (lstat(path.c_str(), &status) == 0 || errno != ENOENT) continue;
+            _exclusions.erase(path);
+            _unsavedExclusions.insert(path);
+        }
+    }
+    Change change;
+    change.isChanged = takeInApplications(places, found);
+    takeInPlugIns(places, found, change);
+    if (repointPlugIns()) change.isChanged = true;
+    if (change.isChanged) {
+        // A change with both is told in two steps, and so is a state of its own in between.
+        const bool isTwoSteps = !change.removed.empty() && !change.installed.empty();
+        _knowledge = {UUID::random(), _knowledge.sequence + (isTwoSteps ? 2 : 1)};
+        _isKnowledgeUnsaved = true;
+    }
+    return change;
+}
+
+bool InstalledBundles::takeInApplications(const Places& places, const Found& found) {
+    bool isChanged = false;
+    for (const auto& place : places) {
+        for (const auto& path : pathsBelow(_applications, place)) {
+            if (found.applications.contains(path)) continue;
+            _applications.erase(path);
+            _unsavedApplications.insert(path);
+            isChanged = true;
+        }
+    }
+    for (const auto& [path, facts] : found.applications) {
+        auto& application = _applications[path];
+        if (application && application->facts->identity == facts->identity &&
+            application->facts->fingerprint == facts->fingerprint) {
+            if (application->facts->evidence != facts->evidence) _unsavedApplications.insert(path);
+            application->facts->evidence = facts->evidence;
+            continue;
+        }
+        application = std::make_shared<const InstalledApplication>(InstalledApplication{path, facts, {}});
+        _unsavedApplications.insert(path);
+        isChanged = true;
+    }
+    return isChanged;
+}
+
+void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, Change& change) {
+    for (const auto& place : places) {
+        for (const auto& path : pathsBelow(_plugIns, place)) {
+            if (!found.plugIns.contains(path)) change.removed.emplace(path, _plugIns[path]);
+        }
+    }
+    std::vector<std::shared_ptr<InstalledPlugIn>> added;
+    for (const auto& [path, seen] : found.plugIns) {
+        const auto known = lookUp(_plugIns, path);
+        const auto application = lookUp(_applications, seen.application);
+        const bool isSame =
+            known && known->facts->identity == seen.facts->identity && known->identifier == seen.identifier;
+        if (isSame && known->facts->fingerprint == seen.facts->fingerprint && known->application == application) {
+            if (known->facts->evidence != seen.facts->evidence) _unsavedPlugIns.insert(path);
+            known->facts->evidence = seen.facts->evidence;
+            continue;
+        }
+        auto plugIn = std::make_shared<InstalledPlugIn>();
+        plugIn->path = path;
+        plugIn->identifier = seen.identifier;
+        plugIn->application = application;
+        plugIn->facts = seen.facts;
+        if (isSame) {
+            plugIn->uuid = known->uuid;
+            plugIn->originalIdentifier = known->originalIdentifier;
+            plugIn->registered = known->registered;
+            _plugIns[path] = std::move(plugIn);
+            _unsavedPlugIns.insert(path);
+            change.isChanged = true;
+            continue;
+        }
+        if (known) change.removed.emplace(path, known);
+        added.push_back(std::move(plugIn));
+    }
+    for (const auto& [path, plugIn] : change.removed) {
+        _plugIns.erase(path);
+        _unsavedPlugIns.insert(path);
+    }
+    identify(added, change.removed);
+    for (const auto& plugIn : added) {
+        _plugIns[plugIn->path] = plugIn;
+        _unsavedPlugIns.insert(plugIn->path);
+        change.installed.emplace(plugIn->path, plugIn);
+    }
+    if (!change.removed.empty() || !change.installed.empty()) change.isChanged = true;
+
+    // An application that is known for a plug-in registered by path goes with the last of them.
+    for (const auto& [path, plugIn] : change.removed) {
+        if (!plugIn->application || !_applications.contains(plugIn->application->path)) continue;
+        const std::string& application = plugIn->application->path;
+        const bool isInFolder = std::ranges::any_of(
+            _folders, [&](const Folder& folder) { return placeInFolder(folder, application) == application; });
+        if (isInFolder || !pathsBelow(_plugIns, application).empty()) continue;
+        _applications.erase(application);
+        _unsavedApplications.insert(application);
+    }
+}
+
+/// Gives every plug-in the application that is known now. True when one had another one.
+bool InstalledBundles::repointPlugIns() {
+    bool isChanged = false;
+    for (const auto& path : _unsavedApplications) {
+        const auto application = lookUp(_applications, path);
+        for (const auto& plugInPath : pathsBelow(_plugIns, path)) {
+            auto& plugIn = _plugIns[plugInPath];
+            if (!plugIn->application || plugIn->application->path != path || plugIn->application == application)
+                continue;
+            auto renewed = std::make_shared<InstalledPlugIn>(*plugIn);
+            renewed->application = application;
+            renewed->proxy = {};
+            plugIn = std::move(renewed);
+            _unsavedPlugIns.insert(plugInPath);
+            isChanged = true;
+        }
+    }
+    return isChanged;
+}
+
+/// Finds for each added plug-in who it was before: the same directory, wherever it was, or else the same identifier
+/// at the same place.
+void InstalledBundles::identify(std::vector<std::shared_ptr<InstalledPlugIn>> added, const PlugIns& removed) {
+    std::vector<RemovedPlugIn> gone;
+    for (const auto& [path, plugIn] : removed) {
+        gone.push_back({path, plugIn->uuid, plugIn->identifier, plugIn->originalIdentifier, plugIn->facts->identity});
+    }
+    const auto isSameDirectory = [](const InstalledPlugIn& plugIn, const RemovedPlugIn& before) {
+        const bool isSame = before.identity == plugIn.facts->identity;
+        return isSame && (before.identifier == plugIn.identifier || before.path == plugIn.path);
+    };
+    const auto isSamePlace = [](const InstalledPlugIn& plugIn, const RemovedPlugIn& before) {
+        return before.path == plugIn.path && before.identifier == plugIn.identifier;
+    };
+    const auto become = [](InstalledPlugIn& plugIn, const RemovedPlugIn& before) {
+        plugIn.uuid = before.uuid;
+        plugIn.originalIdentifier = before.originalIdentifier;
+    };
+    const auto takeFrom = [&](std::vector<RemovedPlugIn>& candidates, const auto& isSame) {
+        std::erase_if(added, [&](const auto& plugIn) {
+            const auto before = std::ranges::find_if(candidates, [&](const auto& one) { return isSame(*plugIn, one); });
+            if (before == candidates.end()) return false;
+            become(*plugIn, *before);
+            candidates.erase(before);
+            return true;
+        });
+    };
+    const Date date = now();
+    for (const auto& plugIn : added) {
+        plugIn->uuid = UUID::random();
+        plugIn->originalIdentifier = plugIn->identifier;
+        plugIn->registered = date;
+    }
+    takeFrom(gone, isSameDirectory);
+    takeFrom(gone, isSamePlace);
+    for (const auto& plugIn : added) {
+        const auto candidates = _store.removedPlugIns(plugIn->facts->identity, plugIn->path);
+        auto before = std::ranges::find_if(candidates, [&](const auto& one) { return isSameDirectory(*plugIn, one); });
+        if (before == candidates.end())
+            before = std::ranges::find_if(candidates, [&](const auto& one) { return isSamePlace(*plugIn, one); });
+        if (before == candidates.end() || isInUse(before->uuid)) continue;
+        become(*plugIn, *before);
+        _unsavedReturned.push_back(before->uuid);
+    }
+    std::ranges::move(gone, std::back_inserter(_unsavedRemoved));
+}
+
+bool InstalledBundles::isInUse(const UUID& uuid) const {
+    return std::ranges::any_of(_plugIns, [&](const auto& entry) { return entry.second->uuid == uuid; });
+}
+
+void InstalledBundles::save() {
+    if (_unsavedApplications.empty() && _unsavedPlugIns.empty() && _unsavedRegistrations.empty() &&
+        _unsavedExclusions.empty() && !_isKnowledgeUnsaved)
+        return;
+    const auto failure = _store.change([&] {
+        for (const auto& path : _unsavedApplications) {
+            if (const auto application = lookUp(_applications, path))
+                _store.put(*application);
+            else
+                _store.removeApplication(path);
+        }
+        // First the rows that go, for another path may have taken over their UUIDs.
+        for (const auto& path : _unsavedPlugIns) _store.removePlugIn(path);
+        for (const auto& path : _unsavedPlugIns) {
+            if (const auto plugIn = lookUp(_plugIns, path)) _store.put(*plugIn);
+        }
+        for (const auto& path : _unsavedRegistrations) _store.setRegistered(path, _registrations.contains(path));
+        for (const auto& path : _unsavedExclusions) {
+            const auto exclusion = _exclusions.find(path);
+            _store.setExcluded(path, exclusion == _exclusions.end() ? std::nullopt : std::optional(exclusion->second));
+        }
+        for (const auto& removed : _unsavedRemoved) _store.remember(removed);
+        for (const auto& uuid : _unsavedReturned) _store.forget(uuid);
+        if (!_unsavedRemoved.empty()) _store.keepRemoved(_limits.removedPlugIns);
+        if (_isKnowledgeUnsaved) _store.setKnowledge(_knowledge);
+    });
+    if (failure) {
+        cx().error("the registry's changes could not be stored: %{public}@", *failure);
+        const std::size_t excess = _unsavedRemoved.size() - std::min(_unsavedRemoved.size(), _limits.removedPlugIns);
+        _unsavedRemoved.erase(_unsavedRemoved.begin(), _unsavedRemoved.begin() + static_cast<std::ptrdiff_t>(excess));
+        return;
+    }
+    _unsavedApplications.clear();
+    _unsavedPlugIns.clear();
+    _unsavedRegistrations.clear();
+    _unsavedExclusions.clear();
+    _unsavedRemoved.clear();
+    _unsavedReturned.clear();
+    _isKnowledgeUnsaved = false;
+}
+
+} // namespace platform::linux_

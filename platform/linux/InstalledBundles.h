@@ -1,0 +1,128 @@
+#pragma once
+
+#include "platform/linux/BundleScanner.h"
+#include "platform/linux/Registry.h"
+#include "platform/linux/RegistryRecord.h"
+#include "platform/linux/RegistryStore.h"
+#include "platform/linux/RegistryWatcher.h"
+
+#include <cstddef>
+#include <functional>
+#include <map>
+#include <optional>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace platform::linux_ {
+
+/// Which applications and plug-ins are installed: kept in line with the disk, and in the database. For one thread.
+class InstalledBundles {
+public:
+    /// What became different. A plug-in that was replaced is in both maps.
+    struct Change {
+        PlugIns removed;
+        PlugIns installed;
+        bool isChanged = false; // anything that the registry tells about anything
+    };
+
+    /// Reads the database and then the disk. `root` has no symbolic links in it.
+    InstalledBundles(const Root& root, const RegistryLimits& limits);
+
+    /// Readable when `catchUp` has something to do; negative when there is no such descriptor.
+    int descriptor() const { return _watcher.descriptor(); }
+    /// Takes in everything that happened on disk until now.
+    Change catchUp();
+    /// Something may have changed that `catchUp` does not hear of; `verify` finds it.
+    bool needsVerifying() const { return !_watcher.unwatched().empty() || !_incomplete.empty(); }
+    Change verify();
+
+    using Tell = std::function<void(const Change&)>;
+    /// `path` is canonical. False when no plug-in is registered there afterwards. Calls `tell` with each change.
+    bool registerPlugIn(const std::string& path, const Tell& tell);
+    /// False when none was registered there.
+    bool unregisterPlugIn(const std::string& path, const Tell& tell);
+
+    const PlugIns& plugIns() const { return _plugIns; }
+    const Applications& applications() const { return _applications; }
+    const Knowledge& knowledge() const { return _knowledge; }
+
+private:
+    using Places = std::set<std::string>;
+    enum class FolderKind { applications, plugIns };
+    struct Folder {
+        std::string path;
+        FolderKind kind;
+    };
+    struct FoundPlugIn {
+        BundleFactsRef facts;
+        std::optional<std::string> identifier;
+        std::string application; // its path; empty outside applications
+    };
+    struct Found {
+        std::map<std::string, BundleFactsRef> applications;
+        std::map<std::string, FoundPlugIn> plugIns;
+    };
+    enum class Manifests { settled, maybeBeingWritten };
+
+    // Where things lie.
+    std::optional<std::string> placeInFolder(const Folder& folder, const std::string& path) const;
+    bool isDiscovered(const std::string& path) const;
+    void touch(const std::string& path, Places& places) const;
+
+    // Reading the disk.
+    Change rescan(Places places, Manifests manifests);
+    void scanPlace(const std::string& place, Found& found);
+    void scanFolder(int directory, const std::string& path, FolderKind kind, std::size_t depth, Found& found);
+    void scanApplication(int directory, const std::string& path, Found& found);
+    void scanPlugIn(int directory, const std::string& path, const std::string& application, Found& found);
+    void scanRegistration(const std::string& path, Found& found);
+    void watchPassage(const std::string& path, const std::string& top);
+    Descriptor open(int parent, const std::string& name);
+    Descriptor open(const std::string& path);
+    std::vector<std::string> directoriesIn(int directory);
+    BundleFactsRef accept(const std::string& path, const ScannedBundle& scanned, const BundleFactsRef& known);
+    void refuse(const std::string& path, const std::string& reason);
+
+    // Taking in what was found.
+    Change takeIn(const Places& places, const Found& found);
+    bool takeInApplications(const Places& places, const Found& found);
+    void takeInPlugIns(const Places& places, const Found& found, Change& change);
+    bool repointPlugIns();
+    void identify(std::vector<std::shared_ptr<InstalledPlugIn>> added, const PlugIns& removed);
+    bool isInUse(const UUID& uuid) const;
+    void save();
+
+    const std::string _top;
+    const std::vector<Folder> _folders;
+    const RegistryLimits _limits;
+    SharedKeys _keys;
+    RegistryStore _store;
+    RegistryWatcher _watcher;
+    BundleScanner _scanner;
+
+    Applications _applications;
+    PlugIns _plugIns;
+    std::set<std::string> _registrations; // registered by path; installed or awaited
+    Exclusions _exclusions;               // unregistered although they lie where plug-ins are looked for
+    Knowledge _knowledge;
+
+    Manifests _manifests = Manifests::settled;    // during a scan
+    bool _isShort = false;                        // during a scan: something could not be looked at
+    Places _incomplete;                           // places of scans that ran short
+    std::set<std::string> _settledManifests;      // bundles whose manifest's writer is done
+    std::map<std::string, std::string> _refusals; // by path; each reason is logged once
+    bool _hasToldOfUnwatched = false;
+
+    // What the database does not have yet. Kept when it cannot be written, and tried again with the next change.
+    std::set<std::string> _unsavedApplications;
+    std::set<std::string> _unsavedPlugIns;
+    std::set<std::string> _unsavedRegistrations;
+    std::set<std::string> _unsavedExclusions;
+    std::vector<RemovedPlugIn> _unsavedRemoved;
+    std::vector<UUID> _unsavedReturned; // removed plug-ins that came back
+    bool _isKnowledgeUnsaved = false;
+};
+
+} // namespace platform::linux_

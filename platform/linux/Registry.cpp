@@ -1,0 +1,447 @@
+#include "platform/linux/Registry.h"
+
+#include "platform/SystemLog.h"
+#include "platform/linux/Descriptor.h"
+#include "platform/linux/DirectoryFiles.h"
+#include "platform/linux/InstalledBundles.h"
+#include "platform/linux/RegistryQuery.h"
+#include "platform/linux/RegistrySnapshot.h"
+#include "platform/linux/ServiceThread.h"
+#include "platform/linux/StringTables.h"
+
+#include <atomic>
+#include <cstdlib>
+#include <filesystem>
+#include <functional>
+#include <future>
+#include <mutex>
+#include <poll.h>
+#include <sys/eventfd.h>
+#include <thread>
+#include <unistd.h>
+
+namespace platform::linux_ {
+
+namespace {
+
+constexpr const char* sdkFolder = "/Library/SDKs";
+constexpr const char* placeholderKey = "VBBundleIsPlaceholder";
+
+/// The path with its symbolic links resolved; none for what does not exist.
+std::optional<std::string> canonical(const std::string& path) {
+    std::error_code error;
+    auto resolved = std::filesystem::canonical(path, error);
+    return error ? std::nullopt : std::optional(resolved.string());
+}
+
+Root withoutLinks(const Root& root) { return Root(canonical(root.at("/")).value_or(root.directory())); }
+
+std::optional<std::string> text(const Dictionary& dictionary, std::string_view key) {
+    const auto view = dictionary.string(key);
+    return view ? std::optional<std::string>(*view) : std::nullopt;
+}
+
+/// The languages in which names are looked for, best first; the generation counts their changes.
+struct Languages {
+    std::vector<std::string> preferred;
+    std::vector<std::string> order;
+    std::uint64_t generation = 0;
+};
+
+/// The names of a bundle in the user's languages.
+class LocalizedNames {
+public:
+    LocalizedNames(const std::string& path, const BundleFacts& facts, const Languages& languages)
+        : _info(facts.info->dictionary()),
+          _tables(path, infoTable, facts.hasResources ? languages.order : std::vector<std::string>()) {}
+
+    std::optional<std::string> shortName() const { return string("VBBundleName"); }
+    std::optional<std::string> name() const {
+        auto displayName = string("VBBundleDisplayName");
+        return displayName ? displayName : shortName();
+    }
+
+private:
+    std::optional<std::string> string(std::string_view key) const {
+        auto localized = _tables.string(key);
+        return localized ? localized : text(_info, key);
+    }
+
+    const Dictionary _info;
+    const StringTables _tables;
+};
+
+} // namespace
+
+class Registry::Implementation {
+public:
+    Implementation(const Root& root, platform::Locale& locale, platform::Containers& containers,
+                   const RegistryLimits& limits)
+        : _root(withoutLinks(root)),
+          _locale(locale),
+          _containers(containers),
+          _bundles(_root, limits),
+          _wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
+        show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
+        _thread = startServiceThread("registry", [this] { run(); });
+    }
+
+    ~Implementation() {
+        {
+            const std::lock_guard lock(_mutex);
+            _isStopping = true;
+        }
+        wake();
+        if (_thread) _thread->join();
+    }
+
+    void addObserver(std::weak_ptr<RegistryObserver> observer) {
+        const std::lock_guard lock(_mutex);
+        std::erase_if(_observers, [](const auto& known) { return known.expired(); });
+        _observers.push_back(std::move(observer));
+    }
+
+    std::shared_ptr<const RegistrySnapshot> snapshot() const {
+        const std::lock_guard lock(_mutex);
+        return _snapshot;
+    }
+
+    /// The snapshot for an answer. What is not watched is verified soon after somebody asked.
+    std::shared_ptr<const RegistrySnapshot> snapshotForAnswer() {
+        if (_needsVerifying.load(std::memory_order_relaxed) && !_isVerifyWanted.exchange(true)) wake();
+        return snapshot();
+    }
+
+    std::shared_ptr<const Languages> languages() {
+        auto preferred = _locale.languages();
+        const std::lock_guard lock(_madeMutex);
+        if (!_languages || _languages->preferred != preferred) {
+            auto order = searchOrder(preferred);
+            _languages = std::make_shared<const Languages>(
+                Languages{std::move(preferred), std::move(order), _languages ? _languages->generation + 1 : 1});
+        }
+        return _languages;
+    }
+
+    void clearSchemaCaches() {
+        const std::lock_guard lock(_madeMutex);
+        if (!_languages) return;
+        auto renewed = std::make_shared<Languages>(*_languages);
+        ++renewed->generation;
+        _languages = std::move(renewed);
+    }
+
+    PlugInProxyRef proxy(const InstalledPlugInRef& plugIn, const Languages& languages, bool isInstalled = true) {
+        if (!plugIn) return nullptr;
+        if (auto made = madeOf(plugIn->proxy, languages)) return made;
+        auto proxy = describe(*plugIn, languages);
+        if (isInstalled && !isDataOnly(*proxy->infoDictionary) && proxy->plugInIdentifier) {
+            auto container = _containers.userContainer(*proxy->plugInIdentifier);
+            // Not kept without its container: what prevents that may pass.
+            if (!container) return proxy;
+            proxy->dataContainerURL = URL::file(*container);
+        }
+        return keep(plugIn->proxy, std::move(proxy), languages);
+    }
+
+    std::vector<PlugInProxyRef> proxies(const std::vector<InstalledPlugInRef>& plugIns) {
+        const auto current = languages();
+        std::vector<PlugInProxyRef> answer;
+        answer.reserve(plugIns.size());
+        for (const auto& plugIn : plugIns) answer.push_back(proxy(plugIn, *current));
+        return answer;
+    }
+
+    std::shared_ptr<const ApplicationRecord> record(const InstalledApplicationRef& application,
+                                                    const Languages& languages) {
+        if (!application) return nullptr;
+        if (auto made = madeOf(application->record, languages)) return made;
+        const Dictionary& info = application->facts->info->dictionary();
+        auto record = std::make_shared<ApplicationRecord>(ApplicationRecord{
+            .bundleURL = URL::file(application->path),
+            .bundleIdentifier = text(info, "VBBundleIdentifier"),
+            .localizedName = LocalizedNames(application->path, *application->facts, languages).name(),
+            .isApplication = true,
+            .isPlaceholder = info[placeholderKey].booleanValue().value_or(false),
+        });
+        return keep(application->record, std::move(record), languages);
+    }
+
+    /// Runs `action` on the registry's thread, after everything that happened on disk until now, and its notices.
+    void perform(const std::function<void()>& action) {
+        if (!_thread) {
+            const std::lock_guard lock(_threadlessMutex);
+            publish(_bundles.catchUp());
+            action();
+            return;
+        }
+        if (std::this_thread::get_id() == _thread->get_id()) {
+            systemLog().defaultHandle().error("the registry was told to wait for a notice inside that notice");
+            std::abort();
+        }
+        std::promise<void> done;
+        {
+            const std::lock_guard lock(_mutex);
+            _actions.push_back([&] {
+                action();
+                done.set_value();
+            });
+        }
+        wake();
+        done.get_future().wait();
+    }
+
+    bool registerPlugIn(const std::string& path) {
+        return change([&](const auto& tell) { return _bundles.registerPlugIn(path, tell); });
+    }
+    bool unregisterPlugIn(const std::string& path) {
+        return change([&](const auto& tell) { return _bundles.unregisterPlugIn(path, tell); });
+    }
+    void settle() {
+        perform([&] {
+            if (_bundles.needsVerifying()) publish(_bundles.verify());
+        });
+    }
+
+    const Root& root() const { return _root; }
+
+private:
+    template <class F> bool change(F&& action) {
+        bool answer = false;
+        perform([&] { answer = action([&](const auto& change) { publish(change); }); });
+        return answer;
+    }
+
+    void wake() const {
+        const std::uint64_t one = 1;
+        // Fails only when the counter is full, and then the thread is awake.
+        (void)!write(_wake.get(), &one, sizeof one);
+    }
+
+    void run() {
+        while (true) {
+            pollfd waiting[] = {{_bundles.descriptor(), POLLIN, 0}, {_wake.get(), POLLIN, 0}};
+            (void)poll(waiting, 2, -1);
+            std::uint64_t count = 0;
+            (void)!read(_wake.get(), &count, sizeof count);
+            std::vector<std::function<void()>> actions;
+            bool isStopping = false;
+            {
+                const std::lock_guard lock(_mutex);
+                actions.swap(_actions);
+                isStopping = _isStopping;
+            }
+            publish(_bundles.catchUp());
+            if (_isVerifyWanted.exchange(false)) publish(_bundles.verify());
+            for (const auto& action : actions) action();
+            if (isStopping) return;
+        }
+    }
+
+    using Observers = std::vector<std::shared_ptr<RegistryObserver>>;
+
+    /// From now on answers come from `snapshot`. Answers the observers that hear of it: those who came before.
+    Observers show(std::shared_ptr<const RegistrySnapshot> snapshot) {
+        _needsVerifying.store(_bundles.needsVerifying(), std::memory_order_relaxed);
+        Observers observers;
+        const std::lock_guard lock(_mutex);
+        _snapshot.swap(snapshot);
+        for (const auto& weak : _observers) {
+            if (auto observer = weak.lock()) observers.push_back(std::move(observer));
+        }
+        return observers;
+    }
+
+    void publish(const InstalledBundles::Change& change) {
+        _needsVerifying.store(_bundles.needsVerifying(), std::memory_order_relaxed);
+        if (!change.isChanged) return;
+        const auto& [uuid, sequence] = _bundles.knowledge();
+        if (!change.removed.empty() && !change.installed.empty()) {
+            // What takes the place of another one is seen only after that one's end was told: the two may share a UUID.
+            const auto observers =
+                show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(),
+                                                        Knowledge{UUID::random(), sequence - 1}, change.installed));
+            tellRemoved(observers, change.removed);
+        }
+        const auto observers =
+            show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
+        if (change.installed.empty())
+            tellRemoved(observers, change.removed);
+        else
+            tellInstalled(observers, change.installed);
+    }
+
+    void tellRemoved(const Observers& observers, const PlugIns& plugIns) {
+        if (observers.empty() || plugIns.empty()) return;
+        const auto notice = noticeOf(plugIns, false);
+        for (const auto& observer : observers) observer->pluginsWillUninstall(notice);
+    }
+
+    void tellInstalled(const Observers& observers, const PlugIns& plugIns) {
+        if (observers.empty() || plugIns.empty()) return;
+        const auto notice = noticeOf(plugIns, true);
+        for (const auto& observer : observers) observer->pluginsDidInstall(notice);
+    }
+
+    std::vector<PlugInProxyRef> noticeOf(const PlugIns& plugIns, bool areInstalled) {
+        const auto current = languages();
+        std::vector<PlugInProxyRef> notice;
+        for (const auto& [path, plugIn] : plugIns) notice.push_back(proxy(plugIn, *current, areInstalled));
+        return notice;
+    }
+
+    template <class T> std::shared_ptr<const T> madeOf(const Made<T>& made, const Languages& languages) const {
+        const std::lock_guard lock(_madeMutex);
+        return made.generation == languages.generation ? made.object : nullptr;
+    }
+
+    /// Files are read without the lock, so another thread may have been first: all get the same object.
+    template <class T>
+    std::shared_ptr<const T> keep(Made<T>& made, std::shared_ptr<T> object, const Languages& languages) const {
+        const std::lock_guard lock(_madeMutex);
+        if (!made.object || made.generation < languages.generation) made = {std::move(object), languages.generation};
+        return made.object;
+    }
+
+    static bool isDataOnly(const Dictionary& info) {
+        const auto extension = info.dictionary("VKExtension");
+        return extension && extension->string("VKExtensionProtocol") == "#Data";
+    }
+
+    std::shared_ptr<PlugInProxy> describe(const InstalledPlugIn& plugIn, const Languages& languages) {
+        const BundleFacts& facts = *plugIn.facts;
+        const Dictionary& info = facts.info->dictionary();
+        const LocalizedNames names(plugIn.path, facts, languages);
+        auto proxy = std::make_shared<PlugInProxy>();
+        proxy->uuid = plugIn.uuid;
+        proxy->bundleURL = URL::file(plugIn.path);
+        proxy->plugInIdentifier = plugIn.identifier;
+        proxy->originalIdentifier = plugIn.originalIdentifier;
+        proxy->bundleIdentifier = text(info, "VBBundleIdentifier");
+        proxy->bundleVersion = text(info, "VBBundleVersion");
+        proxy->plugInDictionary = plugInDictionary(info);
+        proxy->infoDictionary = info;
+        if (facts.entitlements) proxy->entitlements = facts.entitlements->dictionary();
+        proxy->registrationDate = plugIn.registered;
+        proxy->onSystemPartition = isAtOrBelow(plugIn.path, _root.system());
+        proxy->localizedName = names.name();
+        proxy->localizedShortName = names.shortName();
+        proxy->containingBundle = record(plugIn.application, languages);
+        return proxy;
+    }
+
+    const Root _root;
+    platform::Locale& _locale;
+    platform::Containers& _containers;
+    InstalledBundles _bundles; // the thread's own, once that runs
+
+    mutable std::mutex _mutex; // nothing else is locked and nobody called while it is held
+    std::shared_ptr<const RegistrySnapshot> _snapshot;
+    std::vector<std::weak_ptr<RegistryObserver>> _observers;
+    std::vector<std::function<void()>> _actions;
+    bool _isStopping = false;
+
+    mutable std::mutex _madeMutex; // for everything that was made of records; innermost, too
+    std::shared_ptr<const Languages> _languages;
+
+    std::atomic<bool> _needsVerifying = false;
+    std::atomic<bool> _isVerifyWanted = false;
+    const Descriptor _wake;
+    std::mutex _threadlessMutex;
+    std::optional<std::thread> _thread; // none when the system had no thread left: then nothing is noticed by itself
+};
+
+Registry::Registry(const Root& root, platform::Locale& locale, platform::Containers& containers, RegistryLimits limits)
+    : _implementation(std::make_unique<Implementation>(root, locale, containers, limits)) {}
+
+Registry::~Registry() = default;
+
+void Registry::addObserver(std::weak_ptr<RegistryObserver> observer) {
+    _implementation->addObserver(std::move(observer));
+}
+
+std::optional<std::vector<PlugInProxyRef>> Registry::installedPlugIns() {
+    return _implementation->proxies(_implementation->snapshotForAnswer()->plugIns());
+}
+
+std::optional<std::vector<PlugInProxyRef>> Registry::plugInsMatching(const Dictionary& query, const Filter& filter) {
+    auto plugIns = _implementation->snapshotForAnswer()->matching(equalityTests(query));
+    std::erase_if(plugIns, [&](const auto& plugIn) {
+        const auto& stored = plugIn->facts->entitlements;
+        const auto entitlements = stored ? std::optional(stored->dictionary()) : std::nullopt;
+        return !filter(plugIn->identifier.value_or(std::string()), entitlements);
+    });
+    return _implementation->proxies(plugIns);
+}
+
+PlugInProxyRef Registry::plugInForUUID(const UUID& uuid) {
+    const auto plugIn = _implementation->snapshotForAnswer()->plugIn(uuid);
+    return plugIn ? _implementation->proxy(plugIn, *_implementation->languages()) : nullptr;
+}
+
+PlugInProxyRef Registry::plugInForURL(const URL& url) {
+    if (!url.isFile()) return nullptr;
+    const auto snapshot = _implementation->snapshotForAnswer();
+    auto plugIn = snapshot->plugInAt(url.path());
+    if (!plugIn) {
+        if (const auto path = canonical(url.path())) plugIn = snapshot->plugInAt(*path);
+    }
+    return plugIn ? _implementation->proxy(plugIn, *_implementation->languages()) : nullptr;
+}
+
+std::shared_ptr<const ApplicationRecord> Registry::applicationForURL(const URL& url) {
+    if (!url.isFile()) return nullptr;
+    const auto snapshot = _implementation->snapshotForAnswer();
+    auto application = snapshot->applicationAt(url.path());
+    if (!application) {
+        if (const auto path = canonical(url.path())) application = snapshot->applicationAt(*path);
+    }
+    return application ? _implementation->record(application, *_implementation->languages()) : nullptr;
+}
+
+std::vector<PlugInProxyRef> Registry::plugInsOfApplication(const ApplicationRecord& application) {
+    return _implementation->proxies(_implementation->snapshotForAnswer()->plugInsOf(application.bundleURL.path()));
+}
+
+bool Registry::registerPlugIn(const URL& url) {
+    const auto path = url.isFile() ? canonical(url.path()) : std::nullopt;
+    return path && _implementation->registerPlugIn(*path);
+}
+
+bool Registry::unregisterPlugIn(const URL& url) {
+    if (!url.isFile()) return false;
+    // A registration may outlive its bundle, and then only the path that was registered is left to name it.
+    return _implementation->unregisterPlugIn(canonical(url.path()).value_or(url.path()));
+}
+
+void Registry::clearSchemaCaches() { _implementation->clearSchemaCaches(); }
+
+std::optional<UUID> Registry::knowledgeUUID() { return _implementation->snapshot()->knowledge().uuid; }
+
+std::uint64_t Registry::knowledgeSequenceNumber() { return _implementation->snapshot()->knowledge().sequence; }
+
+std::map<std::string, std::string>
+Registry::localizedStrings(const PlugInProxy& proxy, const std::set<std::string>& keys, const std::string& table) {
+    std::map<std::string, std::string> answer;
+    if (!proxy.bundleURL || !proxy.bundleURL->isFile() || keys.empty()) return answer;
+    const StringTables tables(proxy.bundleURL->path(), table, _implementation->languages()->order);
+    for (const auto& key : keys) {
+        if (auto string = tables.string(key)) answer.emplace(key, *std::move(string));
+    }
+    return answer;
+}
+
+std::optional<Dictionary> Registry::sdkDictionary(const std::string& extensionPoint) {
+    const std::string name = extensionPoint + std::string(tableSuffix);
+    if (!isFileName(name)) return std::nullopt;
+    const Descriptor folder = openDirectory(_implementation->root().system() + sdkFolder);
+    if (!folder) return std::nullopt;
+    const auto bytes = readFile(folder.get(), name, maximumManifestSize);
+    if (!bytes || !*bytes) return std::nullopt;
+    const auto value = decodePropertyList(**bytes);
+    return value ? value->dictionary() : std::nullopt;
+}
+
+void Registry::settle() { _implementation->settle(); }
+
+} // namespace platform::linux_

@@ -1,0 +1,90 @@
+#include "platform/linux/RegistryQuery.h"
+
+#include <algorithm>
+#include <optional>
+
+namespace platform::linux_ {
+
+namespace {
+
+constexpr std::string_view identifierKey = "VKExtensionIdentifier";
+constexpr std::string_view uuidKey = "com.nordane.uuid";
+
+/// Keys whose values the registry does not have, or that no host asks for often enough to keep an index.
+bool isLeftToFullMatch(std::string_view key) {
+    return key == "VKUserElection" || key == "VKExtensionContainingApp" || key.starts_with("ENTITLEMENT:");
+}
+
+/// Entries of one query that are tested. More would make a host's query dear without making its answer much smaller.
+constexpr std::size_t maximumTests = 8;
+
+bool isDigit(char byte) { return byte >= '0' && byte <= '9'; }
+
+/// The operand of a plain equality pattern.
+std::optional<std::string_view> equalityOperand(const Value& pattern) {
+    auto text = pattern.string();
+    if (!text) return std::nullopt;
+    if (text->starts_with('=')) return text->substr(1);
+    if (text->starts_with('?') || text->starts_with('<') || text->starts_with('>')) return std::nullopt;
+    return text;
+}
+
+} // namespace
+
+std::string normalizedForEquality(std::string_view text) {
+    std::string normalized;
+    normalized.reserve(text.size());
+    for (std::size_t i = 0; i < text.size(); ++i) {
+        const bool isInRun = !normalized.empty() && i > 0 && isDigit(text[i - 1]);
+        const bool isFollowed = i + 1 < text.size() && isDigit(text[i + 1]);
+        // A zero is leading when nothing of its run was kept so far; the last digit of a run always stays.
+        const bool isKeptRun = isInRun && isDigit(normalized.back());
+        if (text[i] == '0' && !isKeptRun && isFollowed) continue;
+        normalized.push_back(text[i]);
+    }
+    return normalized;
+}
+
+std::vector<EqualityTest> equalityTests(const Dictionary& query) {
+    std::vector<EqualityTest> tests;
+    for (const auto& [key, pattern] : query) {
+        if (tests.size() == maximumTests) break;
+        if (isLeftToFullMatch(*key.string())) continue;
+        EqualityTest test{std::string(*key.string()), {}};
+        const auto alternatives = pattern.array().value_or(Array{pattern});
+        const bool isPlain = std::ranges::all_of(alternatives, [&](const Value& alternative) {
+            const auto operand = equalityOperand(alternative);
+            if (operand) test.values.push_back(normalizedForEquality(*operand));
+            return operand.has_value();
+        });
+        if (!isPlain) continue;
+        std::ranges::sort(test.values);
+        const auto doubles = std::ranges::unique(test.values);
+        test.values.erase(doubles.begin(), doubles.end());
+        tests.push_back(std::move(test));
+    }
+    return tests;
+}
+
+std::vector<std::string> valuesForEquality(const InstalledPlugIn& plugIn, const std::string& key) {
+    if (key == identifierKey && plugIn.identifier) return {normalizedForEquality(*plugIn.identifier)};
+    if (key == uuidKey) return {normalizedForEquality(plugIn.uuid.text())};
+
+    const Dictionary& info = plugIn.facts->info->dictionary();
+    const auto extension = info.dictionary("VKExtension");
+    const auto attributes = extension ? extension->dictionary("VKExtensionAttributes") : std::nullopt;
+    Value value = attributes ? (*attributes)[key] : Value();
+    if (!value) value = info[key];
+
+    std::vector<std::string> values;
+    if (const auto text = value.string()) values.push_back(normalizedForEquality(*text));
+    for (const Value& element : value.array().value_or(Array())) {
+        const auto text = element.string();
+        if (!text) continue;
+        auto normalized = normalizedForEquality(*text);
+        if (std::ranges::find(values, normalized) == values.end()) values.push_back(std::move(normalized));
+    }
+    return values;
+}
+
+} // namespace platform::linux_

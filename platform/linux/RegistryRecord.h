@@ -1,0 +1,68 @@
+#pragma once
+
+#include "platform/Registry.h"
+#include "platform/linux/BundleFacts.h"
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+
+namespace platform::linux_ {
+
+/// What is made of a record once and then handed out again; whoever keeps it guards it. Made anew when the user's
+/// languages, which the generation counts, have changed.
+template <class T> struct Made {
+    std::shared_ptr<const T> object;
+    std::uint64_t generation = 0;
+};
+
+/// One known application.
+struct InstalledApplication {
+    std::string path;
+    BundleFactsRef facts;
+    mutable Made<ApplicationRecord> record;
+};
+using InstalledApplicationRef = std::shared_ptr<const InstalledApplication>;
+
+/// One registered plug-in, immutable but for what was made of it: a change makes another record.
+struct InstalledPlugIn {
+    std::string path;
+    UUID uuid;
+    std::optional<std::string> identifier;
+    std::optional<std::string> originalIdentifier;
+    Date registered;
+    InstalledApplicationRef application; // null outside applications
+    BundleFactsRef facts;
+    mutable Made<PlugInProxy> proxy;
+};
+using InstalledPlugInRef = std::shared_ptr<const InstalledPlugIn>;
+
+/// A plug-in that went, remembered so that it gets its UUID again when it comes back.
+struct RemovedPlugIn {
+    std::string path;
+    UUID uuid;
+    std::optional<std::string> identifier;
+    std::optional<std::string> originalIdentifier;
+    FileIdentity identity;
+};
+
+/// Counts the states of the registry's data.
+struct Knowledge {
+    UUID uuid;
+    std::uint64_t sequence = 0;
+};
+
+// Each ordered by path.
+using Applications = std::map<std::string, InstalledApplicationRef>;
+using PlugIns = std::map<std::string, InstalledPlugInRef>;
+using Exclusions = std::map<std::string, FileIdentity>;
+
+/// The manifest's plug-in dictionary: "VKExtension", else the older "Zembra".
+inline std::optional<Dictionary> plugInDictionary(const Dictionary& info) {
+    if (auto dictionary = info.dictionary("VKExtension")) return dictionary;
+    return info.dictionary("Zembra");
+}
+
+} // namespace platform::linux_

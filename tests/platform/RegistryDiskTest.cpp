@@ -1,0 +1,529 @@
+#include "platform/linux/Containers.h"
+#include "platform/linux/Entitlements.h"
+#include "platform/linux/Registry.h"
+#include "tests/support/BundleTree.h"
+#include "tests/support/LocaleFake.h"
+#include "tests/support/ScratchDirectory.h"
+
+#include <condition_variable>
+#include <fcntl.h>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <map>
+#include <mutex>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <thread>
+#include <unistd.h>
+
+// What happens on disk, and what the registry makes of it.
+
+namespace {
+
+using namespace platform;
+using support::plugInInfo;
+using support::writeApplication;
+using support::writeFile;
+using support::writeManifest;
+namespace fs = std::filesystem;
+
+/// Keeps the notices, each as a sign and an identifier; can hold the registry's thread in one.
+class Observer final : public RegistryObserver {
+public:
+    void pluginsDidInstall(const std::vector<PlugInProxyRef>& proxies) override { add("+", proxies); }
+    void pluginsWillUninstall(const std::vector<PlugInProxyRef>& proxies) override {
+        for (const auto& proxy : proxies) {
+            if (registry != nullptr && registry->plugInForUUID(*proxy->uuid) != nullptr) add("found", {proxy});
+        }
+        add("-", proxies);
+    }
+
+    std::vector<std::string> take() {
+        const std::lock_guard lock(_mutex);
+        return std::exchange(_notices, {});
+    }
+    std::map<std::string, int> counts() {
+        std::map<std::string, int> counts;
+        for (const auto& notice : take()) ++counts[notice];
+        return counts;
+    }
+    void hold() {
+        const std::lock_guard lock(_mutex);
+        _isHolding = true;
+        _isHeld = false;
+    }
+    void waitUntilHeld() {
+        std::unique_lock lock(_mutex);
+        ASSERT_TRUE(_changed.wait_for(lock, std::chrono::seconds(30), [&] { return _isHeld; }));
+    }
+    void release() {
+        const std::lock_guard lock(_mutex);
+        _isHolding = false;
+        _changed.notify_all();
+    }
+
+    Registry* registry = nullptr; // to be asked inside the notices
+
+private:
+    void add(const std::string& sign, const std::vector<PlugInProxyRef>& proxies) {
+        std::unique_lock lock(_mutex);
+        for (const auto& proxy : proxies) _notices.push_back(sign + proxy->plugInIdentifier.value_or("none"));
+        _isHeld = _isHolding;
+        _changed.notify_all();
+        _changed.wait_for(lock, std::chrono::seconds(30), [&] { return !_isHolding; });
+    }
+
+    std::mutex _mutex;
+    std::condition_variable _changed;
+    std::vector<std::string> _notices;
+    bool _isHolding = false;
+    bool _isHeld = false;
+};
+
+class RegistryOnDisk : public testing::Test {
+protected:
+    using Notices = std::vector<std::string>;
+
+    explicit RegistryOnDisk(const std::string& place = "/tmp") : scratch(place) {
+        fs::create_directories(applications);
+    }
+
+    void start(linux_::RegistryLimits limits = {}) {
+        _registry.reset();
+        _registry.emplace(linux_::Root(scratch.path()), locale, _containers, limits);
+        observer->registry = &*_registry;
+        _registry->addObserver(observer);
+    }
+    void stop() { _registry.reset(); }
+    linux_::Registry& registry() { return *_registry; }
+    Notices settle() {
+        _registry->settle();
+        return observer->take();
+    }
+    PlugInProxyRef at(const std::string& path) { return _registry->plugInForURL(URL::file(path)); }
+    UUID uuidAt(const std::string& path) {
+        const auto proxy = at(path);
+        return proxy ? *proxy->uuid : UUID{};
+    }
+    std::size_t count() { return _registry->installedPlugIns()->size(); }
+
+    support::ScratchDirectory scratch;
+    const std::string applications = scratch / "Applications";
+    const std::string app = applications + "/One.app";
+    const std::string plugIn = app + "/PlugIns/a.appex";
+    support::FakeLocale locale;
+    const std::shared_ptr<Observer> observer = std::make_shared<Observer>();
+
+private:
+    linux_::Containers _containers{linux_::Root(scratch.path())};
+    std::optional<linux_::Registry> _registry;
+};
+
+TEST_F(RegistryOnDisk, EachChangeGivesItsNoticesOnce) {
+    start();
+    EXPECT_EQ(settle(), Notices{});
+    writeApplication(app, {"a", "b"});
+    EXPECT_EQ(settle(), (Notices{"+a", "+b"}));
+    const UUID uuid = uuidAt(plugIn);
+
+    const std::string renamed = applications + "/Two.app";
+    fs::rename(app, renamed);
+    EXPECT_EQ(settle(), (Notices{"-a", "-b", "+a", "+b"}));
+    EXPECT_EQ(at(plugIn), nullptr);
+    EXPECT_EQ(uuidAt(renamed + "/PlugIns/a.appex"), uuid) << "the same bundle elsewhere";
+
+    fs::remove_all(renamed + "/PlugIns/b.appex");
+    EXPECT_EQ(settle(), Notices{"-b"});
+    fs::rename(renamed, scratch / "elsewhere.app");
+    EXPECT_EQ(settle(), Notices{"-a"});
+    fs::rename(scratch / "elsewhere.app", app);
+    EXPECT_EQ(settle(), Notices{"+a"});
+    EXPECT_EQ(uuidAt(plugIn), uuid);
+    fs::remove_all(applications);
+    EXPECT_EQ(settle(), Notices{"-a"});
+    writeApplication(applications + "/deep/deeper/New.app", {"n"});
+    EXPECT_EQ(settle(), Notices{"+n"});
+}
+
+TEST_F(RegistryOnDisk, ReplacedBundleKeepsItsUUIDIfItIsTheSamePlugIn) {
+    writeApplication(app, {"a"});
+    start();
+    const auto before = at(plugIn);
+    for (const char* identifier : {"a", "other"}) {
+        const std::string next = scratch / "next.app";
+        writeApplication(next, {"a"});
+        writeManifest(next + "/PlugIns/a.appex", plugInInfo(identifier));
+        fs::remove_all(app);
+        fs::rename(next, app);
+        const auto notices = settle();
+        const bool isSame = identifier == std::string("a");
+        EXPECT_EQ(notices, (Notices{"-a", "+" + std::string(identifier)}));
+        EXPECT_EQ(uuidAt(plugIn) == *before->uuid, isSame);
+        EXPECT_EQ(at(plugIn)->originalIdentifier, identifier);
+    }
+}
+
+TEST_F(RegistryOnDisk, ChangeInPlaceChangesKnowledgeWithoutNotice) {
+    writeApplication(app, {"a"});
+    writeFile(plugIn + "/program", "code");
+    writeManifest(plugIn, plugInInfo("a", {}, {{"VBBundleExecutable", "program"}}));
+    start();
+    const auto uuid = uuidAt(plugIn);
+    const auto date = at(plugIn)->registrationDate;
+    auto knowledge = registry().knowledgeUUID();
+    const auto expectChanged = [&](bool isChanged, const char* what) {
+        EXPECT_EQ(settle(), Notices{}) << what;
+        EXPECT_EQ(registry().knowledgeUUID() != knowledge, isChanged) << what;
+        knowledge = registry().knowledgeUUID();
+        EXPECT_EQ(uuidAt(plugIn), uuid) << what;
+        EXPECT_EQ(at(plugIn)->registrationDate, date) << what;
+    };
+    const auto info = plugInInfo("a", {}, {{"VBBundleExecutable", "program"}, {"VBBundleVersion", "2"}});
+    writeManifest(plugIn, info);
+    expectChanged(true, "manifest");
+    EXPECT_EQ(at(plugIn)->bundleVersion, "2");
+    writeManifest(plugIn, info);
+    expectChanged(false, "the same manifest again");
+    writeFile(plugIn + "/program", "other code");
+    expectChanged(false, "program");
+    writeFile(plugIn + "/notes", "text");
+    expectChanged(false, "another file");
+    writeFile(plugIn + "/Resources/en/InfoVlist.vlist", *encodeXML(Dictionary{{"VBBundleName", "Name"}}));
+    expectChanged(true, "names");
+    EXPECT_EQ(at(plugIn)->localizedShortName, "Name");
+    ASSERT_FALSE(linux_::writeEntitlements(plugIn + "/program", Dictionary{{"com.nordane.any", true}}));
+    expectChanged(true, "entitlements");
+    ASSERT_TRUE(at(plugIn)->entitlements);
+    EXPECT_TRUE(at(plugIn)->entitlements->contains("com.nordane.any"));
+    writeManifest(app, Dictionary{{"VBBundleIsPlaceholder", true}, {"VBBundleName", "One"}});
+    expectChanged(true, "application");
+    EXPECT_TRUE(at(plugIn)->containingBundle->isPlaceholder);
+    EXPECT_EQ(at(plugIn)->containingBundle->localizedName, "One");
+
+    writeManifest(plugIn, plugInInfo("renamed"));
+    EXPECT_EQ(settle(), (Notices{"-a", "+renamed"}));
+    EXPECT_EQ(uuidAt(plugIn), uuid);
+    EXPECT_EQ(at(plugIn)->originalIdentifier, "a");
+}
+
+TEST_F(RegistryOnDisk, StatePersists) {
+    writeApplication(app, {"a", "b"});
+    const std::string byPath = scratch / "work/tool.plugin";
+    writeManifest(byPath, plugInInfo("tool"));
+    start();
+    ASSERT_TRUE(registry().registerPlugIn(URL::file(byPath)));
+    ASSERT_TRUE(registry().unregisterPlugIn(URL::file(app + "/PlugIns/b.appex")));
+    const auto before = at(plugIn);
+    const auto tool = uuidAt(byPath);
+    const auto knowledge = registry().knowledgeUUID();
+    const auto sequence = registry().knowledgeSequenceNumber();
+    writeManifest(plugIn, plugInInfo("renamed"));
+    writeManifest(plugIn, plugInInfo("a"));
+    settle();
+
+    start();
+    start();
+    EXPECT_EQ(settle(), Notices{});
+    EXPECT_EQ(count(), 2U);
+    EXPECT_EQ(uuidAt(plugIn), *before->uuid);
+    EXPECT_EQ(at(plugIn)->originalIdentifier, "a");
+    EXPECT_EQ(uuidAt(byPath), tool);
+    const auto restarted = registry().knowledgeUUID();
+    start();
+    EXPECT_EQ(registry().knowledgeUUID(), restarted);
+    EXPECT_GE(registry().knowledgeSequenceNumber(), sequence);
+
+    stop();
+    fs::remove_all(byPath);
+    writeManifest(plugIn, plugInInfo("a", {{"key", "value"}}));
+    start();
+    EXPECT_EQ(count(), 1U);
+    EXPECT_NE(registry().knowledgeUUID(), restarted);
+    EXPECT_NE(registry().knowledgeUUID(), knowledge);
+    EXPECT_EQ(uuidAt(plugIn), *before->uuid);
+    EXPECT_TRUE(at(plugIn)->plugInDictionary->dictionary("VKExtensionAttributes")->contains("key"));
+    writeManifest(byPath, plugInInfo("tool"));
+    EXPECT_EQ(settle(), Notices{"+tool"}) << "a registration outlives its bundle";
+    EXPECT_EQ(uuidAt(byPath), tool);
+}
+
+TEST_F(RegistryOnDisk, RegistrationByPath) {
+    start();
+    const std::string outside = scratch / "work/Dev.app/deep/tool.plugin";
+    EXPECT_FALSE(registry().registerPlugIn(URL::file(outside)));
+    writeManifest(outside, Dictionary{{"VBBundleIdentifier", "no plug-in"}});
+    EXPECT_FALSE(registry().registerPlugIn(URL::file(outside)));
+    writeFile(outside + "/Info.vlist", "nonsense");
+    EXPECT_FALSE(registry().registerPlugIn(URL::file(outside)));
+    writeManifest(outside, plugInInfo("tool"));
+    EXPECT_EQ(settle(), Notices{}) << "nobody registered it";
+
+    fs::create_directory_symlink(scratch / "work", scratch / "link");
+    const auto linked = URL::file(scratch / "link/Dev.app/deep/tool.plugin");
+    EXPECT_TRUE(registry().registerPlugIn(linked));
+    EXPECT_EQ(observer->take(), Notices{"+tool"});
+    EXPECT_TRUE(registry().registerPlugIn(linked)) << "again";
+    EXPECT_EQ(observer->take(), Notices{});
+    ASSERT_NE(registry().plugInForURL(linked), nullptr);
+    EXPECT_EQ(registry().plugInForURL(linked)->bundleURL->path(), outside);
+    EXPECT_EQ(at(outside)->containingBundle, nullptr) << "no manifest, no application";
+    writeApplication(scratch / "work/Dev.app");
+    EXPECT_EQ(settle(), Notices{});
+    ASSERT_NE(at(outside)->containingBundle, nullptr);
+    EXPECT_EQ(at(outside)->containingBundle->bundleURL.path(), scratch / "work/Dev.app");
+    EXPECT_NE(registry().applicationForURL(URL::file(scratch / "work/Dev.app")), nullptr);
+
+    fs::rename(scratch / "work", scratch / "away");
+    EXPECT_EQ(settle(), Notices{"-tool"}) << "a directory far above went";
+    EXPECT_EQ(registry().applicationForURL(URL::file(scratch / "work/Dev.app")), nullptr);
+    fs::rename(scratch / "away", scratch / "work");
+    EXPECT_EQ(settle(), Notices{"+tool"});
+    EXPECT_TRUE(registry().unregisterPlugIn(linked));
+    EXPECT_EQ(observer->take(), Notices{"-tool"});
+    EXPECT_FALSE(registry().unregisterPlugIn(linked));
+}
+
+TEST_F(RegistryOnDisk, UnregisteredStaysAwayUntilRegisteredOrReplaced) {
+    writeApplication(app, {"a"});
+    start();
+    ASSERT_TRUE(registry().unregisterPlugIn(URL::file(plugIn)));
+    EXPECT_EQ(observer->take(), Notices{"-a"});
+    writeManifest(plugIn, plugInInfo("a", {{"key", "value"}}));
+    EXPECT_EQ(settle(), Notices{}) << "changed in place";
+    start();
+    EXPECT_EQ(at(plugIn), nullptr) << "restarted";
+    ASSERT_TRUE(registry().registerPlugIn(URL::file(plugIn)));
+    EXPECT_EQ(observer->take(), Notices{"+a"});
+    ASSERT_TRUE(registry().unregisterPlugIn(URL::file(plugIn)));
+    observer->take();
+    fs::rename(plugIn, scratch / "old");
+    writeManifest(plugIn, plugInInfo("a"));
+    EXPECT_EQ(settle(), Notices{"+a"}) << "replaced";
+}
+
+TEST_F(RegistryOnDisk, UnusableBundlesAreLeftOut) {
+    writeApplication(app, {"good"});
+    const auto bad = [&](const char* name) { return app + "/PlugIns/" + name + "/Info.vlist"; };
+    writeFile(bad("text"), "not a property list");
+    writeFile(bad("array"), *encodeXML(Array{"VKExtension"}));
+    writeFile(bad("empty"), "");
+    writeFile(bad("large"), *encodeXML(plugInInfo("large")));
+    fs::resize_file(bad("large"), 100U << 20U);
+    writeManifest(app + "/PlugIns/slash", plugInInfo("../../escape"));
+    writeManifest(app + "/PlugIns/other", Dictionary{{"VKExtension", "no dictionary"}});
+    fs::create_directories(app + "/PlugIns/pipe");
+    ASSERT_EQ(mkfifo(bad("pipe").c_str(), 0600), 0);
+    fs::create_directories(bad("directory"));
+    writeManifest(scratch / "outside", plugInInfo("outside"));
+    fs::create_directory_symlink(scratch / "outside", app + "/PlugIns/link");
+    fs::create_directories(app + "/PlugIns/linked");
+    fs::create_symlink(scratch / "outside/Info.vlist", bad("linked"));
+    writeApplication(scratch / "Outside.app", {"far"});
+    fs::create_directory_symlink(scratch / "Outside.app", applications + "/Link.app");
+    fs::create_directory_symlink(applications, applications + "/loop");
+    writeManifest(applications + "/NoManifest.app/PlugIns/x.appex", plugInInfo("x"));
+    writeApplication(applications + "/1/2/3/4/Deep.app", {"deep"});
+    writeApplication(applications + "/1/2/3/4/5/TooDeep.app", {"tooDeep"});
+    writeApplication(applications + "/.Copying.app", {"copying"});
+    start();
+    std::set<std::string> found;
+    const auto installed = registry().installedPlugIns();
+    for (const auto& proxy : *installed) found.insert(*proxy->plugInIdentifier);
+    EXPECT_EQ(found, (std::set<std::string>{"good", "deep"}));
+
+    // The same when they come one by one.
+    fs::rename(applications + "/.Copying.app", applications + "/Copied.app");
+    writeManifest(app + "/PlugIns/text", plugInInfo("text"));
+    fs::remove(bad("large"));
+    EXPECT_EQ(settle(), (Notices{"+copying", "+text"}));
+    writeFile(bad("text"), "broken again");
+    EXPECT_EQ(settle(), Notices{"-text"});
+}
+
+TEST_F(RegistryOnDisk, ManifestsLargerThanTheLimitAreRefused) {
+    // The bytes of padding decide; the limit itself is allowed.
+    const std::string text = *encodeXML(plugInInfo("a"));
+    writeApplication(app);
+    start();
+    for (const bool isTooLarge : {false, true}) {
+        writeFile(plugIn + "/Info.vlist", text + std::string((1U << 20U) - text.size() + isTooLarge, '\n'));
+        EXPECT_EQ(settle(), isTooLarge ? Notices{"-a"} : Notices{"+a"});
+    }
+}
+
+TEST_F(RegistryOnDisk, NamesFollowTheLanguages) {
+    writeApplication(app, {"a"}, {{"VBBundleName", "App"}});
+    writeManifest(plugIn, plugInInfo("a", {}, {{"VBBundleName", "Short"}, {"VBBundleDisplayName", "Long"}}));
+    const auto table = [&](const std::string& name, const Dictionary& strings) {
+        writeFile(plugIn + "/Resources/" + name + ".vlist", *encodeXML(strings));
+    };
+    table("pt/InfoVlist", {{"VBBundleDisplayName", "Comprido"}, {"VBBundleName", "Curto"}});
+    table("pt-BR/InfoVlist", {{"VBBundleName", "Curtinho"}, {"VBBundleDisplayName", 5}});
+    table("pt/Localizable", {{"open", "Abrir"}, {"close", "Fechar"}});
+    table("en/Localizable", {{"open", "Open"}, {"help", "Help"}});
+    writeFile(app + "/Resources/de/InfoVlist.vlist", *encodeXML(Dictionary{{"VBBundleName", "Anwendung"}}));
+    start();
+    struct Case {
+        std::vector<std::string> languages;
+        std::string name, shortName, containing, open;
+    };
+    for (const auto& [languages, name, shortName, containing, open] : std::vector<Case>{
+             {{"pt-BR", "en"}, "Comprido", "Curtinho", "App", "Abrir"},
+             {{"pt", "en"}, "Comprido", "Curto", "App", "Abrir"},
+             {{"de-AT", "en"}, "Long", "Short", "Anwendung", "Open"},
+             {{"en"}, "Long", "Short", "App", "Open"},
+             {{"../../pt", "en"}, "Long", "Short", "App", "Open"},
+         }) {
+        locale.setLanguages(languages);
+        const auto proxy = at(plugIn);
+        EXPECT_EQ(proxy->localizedName, name) << languages[0];
+        EXPECT_EQ(proxy->localizedShortName, shortName) << languages[0];
+        EXPECT_EQ(proxy->containingBundle->localizedName, containing) << languages[0];
+        EXPECT_EQ(registry().localizedStrings(*proxy, {"open"}, "Localizable")["open"], open) << languages[0];
+        EXPECT_TRUE(registry().localizedStrings(*proxy, {"open"}, "../pt/Localizable").empty());
+    }
+    EXPECT_EQ(at(plugIn), at(plugIn)) << "made once per language";
+}
+
+TEST_F(RegistryOnDisk, ContainersAreMadeForPlugInsWithCode) {
+    writeApplication(app, {"a"});
+    writeManifest(app + "/PlugIns/code.appex",
+                  Dictionary{{"VBBundleIdentifier", "code"}, {"VKExtension", Dictionary()}});
+    writeManifest(app + "/PlugIns/old", Dictionary{{"Zembra", Dictionary{{"VKExtensionIdentifier", "old"}}}});
+    start();
+    EXPECT_FALSE(at(plugIn)->dataContainerURL);
+    for (const char* name : {"code.appex", "old"}) {
+        const auto container = at(app + "/PlugIns/" + name)->dataContainerURL;
+        ASSERT_TRUE(container) << name;
+        EXPECT_TRUE(fs::is_directory(container->path())) << name;
+    }
+    EXPECT_EQ(at(app + "/PlugIns/old")->plugInIdentifier, "old");
+    EXPECT_TRUE(at(app + "/PlugIns/old")->plugInDictionary);
+}
+
+TEST_F(RegistryOnDisk, DamagedDatabaseIsMovedAside) {
+    const std::string file = scratch / "var/db/Catalix.sqlite";
+    writeApplication(app, {"a"});
+    std::string bytes(8192, 'x');
+    for (const bool isWhollyDamaged : {true, false}) {
+        start();
+        EXPECT_EQ(count(), 1U);
+        stop();
+        if (!isWhollyDamaged) {
+            std::ifstream stream(file, std::ios::binary);
+            bytes.assign(std::istreambuf_iterator<char>(stream), {});
+            for (std::size_t i = 4096; i < bytes.size(); ++i) bytes[i] = static_cast<char>(i * 7);
+        }
+        fs::remove(file + "-wal");
+        writeFile(file, bytes);
+        start();
+        EXPECT_EQ(count(), 1U);
+        EXPECT_TRUE(fs::exists(file + ".damaged"));
+        const UUID uuid = uuidAt(plugIn);
+        start();
+        EXPECT_EQ(uuidAt(plugIn), uuid) << "the new one keeps";
+    }
+    stop();
+    fs::remove(file);
+    fs::create_directories(file + "/in the way");
+    start();
+    EXPECT_EQ(count(), 1U) << "without any database";
+    writeApplication(applications + "/Two.app", {"b"});
+    EXPECT_EQ(settle(), Notices{"+b"});
+}
+
+/// Where making ten thousand files and directories takes no minute.
+class RegistryUnderLoad : public RegistryOnDisk {
+protected:
+    RegistryUnderLoad() : RegistryOnDisk(access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp") {}
+};
+
+TEST_F(RegistryUnderLoad, ThousandsAtOnceAreEachToldOnce) {
+    constexpr int many = 2000;
+    // More events than the kernel keeps, while nobody reads them.
+    int queue = 0;
+    std::ifstream("/proc/sys/fs/inotify/max_queued_events") >> queue;
+    if (queue > 100'000) GTEST_SKIP() << "the kernel's queue is too long to fill";
+    const auto path = [&](int i) { return applications + "/" + std::to_string(i) + ".app"; };
+    const auto overflow = [&] {
+        // Equal events in a row count as one, so they take turns.
+        const std::string files[] = {applications + "/noise", applications + "/more noise"};
+        for (const auto& file : files) writeFile(file, "noise");
+        for (int i = 0; i < queue + 100; ++i) ASSERT_EQ(chmod(files[i % 2].c_str(), 0600), 0);
+    };
+    const auto holdInNotice = [&](const std::string& name, bool isInstall) {
+        observer->hold();
+        if (isInstall)
+            writeApplication(applications + "/" + name, {"held"});
+        else
+            fs::remove_all(applications + "/" + name);
+        observer->waitUntilHeld();
+        overflow();
+    };
+    start();
+    holdInNotice("Held.app", true);
+    for (int i = 0; i < many; ++i) writeApplication(path(i), {std::to_string(i)});
+    observer->release();
+    registry().settle();
+    auto counts = observer->counts();
+    EXPECT_EQ(counts.size(), many + 1U);
+    for (const auto& [notice, times] : counts) EXPECT_EQ(times, 1) << notice;
+    EXPECT_EQ(count(), many + 1U);
+
+    holdInNotice("Held.app", false);
+    for (int i = 0; i < many; i += 2) fs::remove_all(path(i));
+    observer->release();
+    registry().settle();
+    counts = observer->counts();
+    EXPECT_EQ(counts.size(), many / 2 + 1U);
+    for (const auto& [notice, times] : counts) EXPECT_EQ(times, 1) << notice;
+    EXPECT_EQ(count(), many / 2U);
+
+    // And without overflow, while the registry keeps reading and others keep asking.
+    const std::jthread reader([&](const std::stop_token& stop) {
+        while (!stop.stop_requested()) {
+            const auto found = registry().plugInsMatching({{"VKExtensionIdentifier", "1"}},
+                                                          [](const auto&, const auto&) { return true; });
+            EXPECT_LE(found->size(), 1U);
+            EXPECT_LE(count(), many);
+        }
+    });
+    for (int i = 1; i < many; i += 2) fs::rename(path(i), path(i - 1));
+    registry().settle();
+    counts = observer->counts();
+    EXPECT_EQ(counts.size(), many);
+    for (const auto& [notice, times] : counts) EXPECT_EQ(times, 1) << notice;
+}
+
+TEST_F(RegistryOnDisk, UnwatchedBundlesAreVerifiedWhenSomebodyAsks) {
+    start({.watches = 2});
+    writeApplication(app, {"a"});
+    EXPECT_EQ(settle(), Notices{"+a"});
+    observer->hold();
+    writeManifest(app + "/PlugIns/b.appex", plugInInfo("b"));
+    (void)count();
+    observer->waitUntilHeld();
+    observer->release();
+    EXPECT_EQ(settle(), Notices{"+b"});
+    fs::remove_all(plugIn);
+    EXPECT_EQ(settle(), Notices{"-a"});
+}
+
+TEST_F(RegistryOnDisk, NothingGoesForWantOfDescriptors) {
+    writeApplication(app, {"a"});
+    start();
+    rlimit before{};
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+    const rlimit none{0, before.rlim_max};
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &none), 0);
+    ASSERT_EQ(utimensat(AT_FDCWD, (plugIn + "/Info.vlist").c_str(), nullptr, 0), 0); // an event
+    const auto notices = settle();
+    const auto installed = count();
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
+    EXPECT_EQ(notices, Notices{});
+    EXPECT_EQ(installed, 1U);
+    fs::remove_all(plugIn);
+    EXPECT_EQ(settle(), Notices{"-a"});
+}
+
+} // namespace
