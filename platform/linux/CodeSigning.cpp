@@ -1,6 +1,7 @@
 #include "platform/linux/CodeSigning.h"
 
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/SystemError.h"
 #include "platform/linux/Entitlements.h"
 #include "platform/linux/PeerProcess.h"
 

@@ -1,6 +1,7 @@
 #include "platform/linux/Entitlements.h"
 
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/SystemError.h"
 #include "platform/linux/ProcPath.h"
 
 #include <cerrno>

@@ -1,6 +1,7 @@
 #include "platform/linux/Processes.h"
 
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/SystemError.h"
 #include "platform/linux/PeerProcess.h"
 
 #include <cerrno>

@@ -4,6 +4,8 @@
 #include "platform/linux/SandboxBroker.h"
 #include "platform/linux/SandboxToken.h"
 
+#include "platform/linux/SystemError.h"
+
 #include <cerrno>
 #include <climits>
 #include <cstdlib>

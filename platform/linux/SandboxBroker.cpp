@@ -4,6 +4,8 @@
 #include "platform/linux/ProcPath.h"
 #include "platform/linux/ServiceThread.h"
 
+#include "platform/linux/SystemError.h"
+
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/Error.h"
 #include "platform/linux/Descriptor.h"
 #include "platform/linux/FileStatus.h"
 #include "platform/linux/Root.h"
