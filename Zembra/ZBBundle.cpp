@@ -4,6 +4,8 @@
 #include "Zembra/ZBManifest.h"
 #include "Zembra/ZBUtilities.h"
 
+#include <utility>
+
 namespace zembra {
 
 using platform::BundleMode;
@@ -80,7 +82,9 @@ std::optional<std::string> ZBBundle::bundleDirectory(std::string_view name) cons
     auto directory = supportPath();
     if (!directory) return std::nullopt;
     if (!directory->ends_with('/')) *directory += '/';
-    return directory->append(name);
+    directory->append(name);
+    while (directory->size() > 1 && directory->ends_with('/')) directory->pop_back();
+    return directory;
 }
 
 std::optional<std::string> ZBBundle::executablePath() const {

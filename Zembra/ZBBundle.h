@@ -32,7 +32,7 @@ public:
     std::optional<std::string> path() const;
     /// Where the bundle keeps its "PlugIns" and the like. Asked for until there is one, and kept from then on.
     std::optional<std::string> supportPath() const;
-    /// `name` below the support directory.
+    /// `name` below the support directory, without a separator at the end.
     std::optional<std::string> bundleDirectory(std::string_view name) const;
     /// The path itself for a bundle without an executable.
     std::optional<std::string> executablePath() const;

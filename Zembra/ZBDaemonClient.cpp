@@ -19,6 +19,9 @@ using platform::Value;
 
 namespace {
 
+/// A buffer beyond this is given back: an answer of thousands of forms is rare.
+constexpr std::size_t keptBufferSize = std::size_t{1} << 20U;
+
 bool hasPropertyListEncoding(std::uint64_t version) { return version == currentVersion; }
 
 std::string descriptionOf(const ConnectionEvent& event) {
@@ -40,19 +43,17 @@ std::shared_ptr<ZBDaemonClient> ZBDaemonClient::initWithServiceName(platform::Tr
 }
 
 ZBDaemonClient::ZBDaemonClient(platform::Transport& transport, platform::WorkQueues& queues, const std::string& name)
-    : _closing(std::make_shared<std::atomic<bool>>(false)),
-      _replyQueue(queues.makeSerial("zbd_client")),
+    : _replyQueue(queues.makeSerial("zbd_client")),
       _zbd(transport.connect(name, _replyQueue)),
       _protocolVersion(currentVersion) {
-    _zbd->setEventHandler([closing = _closing](const ConnectionEvent& event) {
-        if (*closing) return; // the end of the connection is no error when it is the client's own doing
+    _zbd->setEventHandler([](const ConnectionEvent& event) {
         log::ops().error("Communications error: %{public}@", descriptionOf(event));
     });
     _zbd->resume();
 }
 
 ZBDaemonClient::~ZBDaemonClient() {
-    *_closing = true;
+    _zbd->setEventHandler([](const ConnectionEvent&) {}); // the end is no error when it is the client's own doing
     _zbd->cancel();
 }
 
@@ -72,9 +73,13 @@ Failure ZBDaemonClient::errorInReply(const ReplyOrError& reply) {
 
 std::optional<Value> ZBDaemonClient::convertToQMX(const Value& value, std::uint64_t version) {
     if (!hasPropertyListEncoding(version)) return std::nullopt;
-    std::string bytes;
+    // One buffer for all replies of a thread: growing a new one costs more than the encoding.
+    thread_local std::string bytes;
+    bytes.clear();
     platform::appendCompact(bytes, value);
-    return Value::data(bytes);
+    Value data = Value::data(bytes);
+    if (bytes.capacity() > keptBufferSize) bytes = std::string();
+    return data;
 }
 
 Value ZBDaemonClient::convertFromQMX(const Value& value) const {

@@ -7,7 +7,6 @@
 #include "platform/Uuid.h"
 #include "platform/WorkQueue.h"
 
-#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -23,7 +22,8 @@ namespace zembra {
 ///
 /// Operations may be called from any thread. Each calls its callback exactly once, on the client's own serial queue,
 /// with the reply or the transport's error in its place; `errorInReply` tells what it means. Destroying the client ends
-/// the connection; callbacks still waiting get an error then.
+/// the connection; callbacks still waiting get an error then,
+/// unless the transport itself ends first.
 class ZBDaemonClient {
 public:
     using Callback = std::function<void(const platform::ReplyOrError& reply)>;
@@ -79,8 +79,6 @@ public:
 private:
     ZBDaemonClient(platform::Transport& transport, platform::WorkQueues& queues, const std::string& name);
 
-    // Shared with the event handler, which may outlive the client.
-    std::shared_ptr<std::atomic<bool>> _closing;
     std::shared_ptr<platform::WorkQueue> _replyQueue;
     std::shared_ptr<platform::Connection> _zbd;
     std::int64_t _protocolVersion;

@@ -3,9 +3,11 @@
 #include "Zembra/ZBLog.h"
 #include "Zembra/ZBUtilities.h"
 
+#include <algorithm>
 #include <charconv>
 #include <limits>
 #include <set>
+#include <utility>
 #include <vector>
 
 namespace zembra {
@@ -30,9 +32,12 @@ std::vector<std::string_view> split(std::string_view text, char separator) {
     }
 }
 
-/// The decimal number at the front of `text`: 0 when there is none, the nearest representable one when it is too large.
+/// The decimal number at the front of `text`, after any blanks and one sign: 0 when there is none, the nearest
+/// representable one when it is too large.
 std::int64_t leadingNumber(std::string_view text) {
     using Limits = std::numeric_limits<std::int64_t>;
+    text.remove_prefix(std::min(text.find_first_not_of(" \t\n\v\f\r"), text.size()));
+    if (text.starts_with('+') && !text.starts_with("+-")) text.remove_prefix(1);
     std::int64_t number = 0;
     const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
     if (error == std::errc::result_out_of_range) return text.starts_with('-') ? Limits::min() : Limits::max();
@@ -69,7 +74,7 @@ Failure applyEntry(Interfaces& interfaces, InterfaceDescription& description, co
     return std::nullopt;
 }
 
-/// How an element of a compound specification names an interface. An element that is no text names none.
+/// How an element of a compound specification names an interface. One that is no text goes by its printed form.
 std::string nameOf(const Value& element) {
     const auto text = element.string();
     return text ? std::string(*text) : element.description();
@@ -100,8 +105,7 @@ std::shared_ptr<Interface> compoundInterface(Interfaces& interfaces, const Value
             if (!included) return nullptr;
             compound->addIncluded(std::move(included));
         }
-        interfaces.registerInterface(compound);
-        return compound;
+        return interfaces.registerInterface(std::move(compound)); // another thread's when that was faster
     }
     if (auto existing = interfaces.find(compoundName)) return existing;
     if (error) *error = errorWithCode(code::configuration, "unable to create compound protocol");

@@ -16,8 +16,9 @@ namespace zembra {
 std::shared_ptr<platform::Interface> interfaceLookup(platform::Interfaces& interfaces, const std::string& name,
                                                      platform::Failure* error);
 
-/// One interface for a name, or for all names of an array. Null, with `error` (unless null) set, when one of them
-/// cannot be found; null without an error when `specification` is neither.
+/// One interface for a name, or for all names of an array, where the same names in the same order give every caller the
+/// same interface. Null, with `error` (unless null) set, when one of them cannot be found; null without an error when
+/// `specification` is neither.
 std::shared_ptr<platform::Interface> compoundInterface(platform::Interfaces& interfaces,
                                                        const platform::Value& specification, platform::Failure* error);
 

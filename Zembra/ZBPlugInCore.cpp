@@ -6,7 +6,6 @@
 
 namespace zembra {
 
-using platform::Array;
 using platform::Dictionary;
 using platform::Failure;
 using platform::MutableArray;
@@ -70,7 +69,7 @@ bool ZBPlugInCore::setupWithName(const Value& identifier, const std::optional<UR
                               bundleInfo);
             return false;
         }
-        log::cx().debug("%s %@", __func__, entry(bundleInfo.dictionary(), manifest::bundleDisplayName));
+        log::cx().debug("%s %@", __func__, entry(normalized.dictionary(), manifest::bundleDisplayName));
     }
     setIdentifier(identifier);
     setUrl(url);
@@ -229,11 +228,20 @@ void ZBPlugInCore::canonicalize() {
     MutableDictionary plugIn = MutableDictionary::copyOf(plugInDictionary().value_or(Dictionary()));
     plugIn.set(manifest::attributes, attributes);
     setPlugInDictionary(plugIn);
-    if (attribute(manifest::version)) return;
+    if (version()) return;
     const Value bundleVersion = infoKey(manifest::bundleShortVersionString);
     attributes.set(manifest::version, bundleVersion ? bundleVersion : Value("1"));
 }
 
-std::string ZBPlugInCore::description() const { return platform::format("%@ %@ %@", identifier(), uuidText(), path()); }
+std::string ZBPlugInCore::description() const {
+    // Every "find" logs it, so it is put together without the formatter.
+    const auto location = _url.get();
+    std::string text;
+    for (const Value& part : {identifier(), uuidText(), location ? location->path : Value()}) {
+        if (!text.empty()) text += ' ';
+        text += part.string().value_or("(null)");
+    }
+    return text;
+}
 
 } // namespace zembra

@@ -53,7 +53,7 @@ public:
     // Setting up. Each answers whether it succeeded; why it did not is logged. A record whose setup failed is to be
     // dropped.
 
-    /// `bundleInfo` may be absent. Without a UUID the record gets a random one. `info` is not used: subclasses may.
+    /// An identifier that is no string counts as missing. `bundleInfo` may be absent. Without a UUID the record gets a random one. `info` is not used: subclasses may.
     virtual bool setupWithName(const platform::Value& identifier, const std::optional<platform::URL>& url,
                                const platform::Value& bundleInfo, const platform::Value& info,
                                const std::optional<platform::UUID>& uuid);
@@ -128,6 +128,7 @@ public:
     std::string path() const;
     platform::Value containingPath() const;
     std::optional<platform::Dictionary> attributes() const;
+    /// Absent also when the manifest has no string there.
     platform::Value version() const;
     /// A string or an array of strings, as the manifest has it.
     platform::Value protocolSpec() const;

@@ -105,7 +105,8 @@ bool ZBPlugInCore::setupWithForm(const Dictionary& form) {
                        uuidText ? UUID::parse(*uuidText) : std::nullopt)) {
         return false;
     }
-    setHubProtocolVersion(static_cast<std::uint64_t>(form[formKey::hubProtocolVersion].integerValue().value_or(1)));
+    const Value hub = form[formKey::hubProtocolVersion];
+    setHubProtocolVersion(hub ? static_cast<std::uint64_t>(hub.integerValue().value_or(0)) : 1);
     setOriginalIdentifier(form[formKey::originalIdentifier]);
     setCdhash(form[formKey::hash]);
     setRequirement(form[formKey::requirement]);

@@ -105,7 +105,7 @@ inline constexpr std::int64_t interfaceDescription = 6; // never sent
 inline constexpr std::int64_t version = 7;
 inline constexpr std::int64_t badPath = 9;
 inline constexpr std::int64_t notPermitted = 11;
-inline constexpr std::int64_t configuration = 12; // never sent
+inline constexpr std::int64_t configuration = 12; // also an interface that cannot be found or made; never sent
 inline constexpr std::int64_t busy = 14;
 inline constexpr std::int64_t notFound = 15;
 inline constexpr std::int64_t bulkAnnotation = 18;
@@ -113,7 +113,7 @@ inline constexpr std::int64_t bulkAnnotation = 18;
 
 inline constexpr std::int64_t currentVersion = 3;
 
-/// Version 2 requesters are served too: they differ from version 3 in the lowest bit alone.
+/// Version 2 requesters are served too, but get no "matches": they cannot read its encoding.
 constexpr bool isSupportedVersion(std::uint64_t version) { return (version & ~std::uint64_t{1}) == 2; }
 
 /// Flags of "match".

@@ -19,6 +19,11 @@ platform::Result<std::string> issueServiceLookupToken(platform::Sandbox& sandbox
     return token;
 }
 
+std::shared_ptr<ZBSandboxExtension> ZBSandboxExtension::initWithExtension(platform::Sandbox& sandbox,
+                                                                          std::string token) {
+    return std::shared_ptr<ZBSandboxExtension>(new ZBSandboxExtension(sandbox, std::move(token)));
+}
+
 ZBSandboxExtension::ZBSandboxExtension(platform::Sandbox& sandbox, std::string token)
     : _sandbox(sandbox), _token(std::move(token)) {}
 

@@ -6,7 +6,9 @@
 #include "platform/Url.h"
 
 #include <cstdint>
+#include <memory>
 #include <string>
+#include <utility>
 
 namespace zembra {
 
@@ -20,10 +22,10 @@ platform::Result<std::string> issueServiceLookupToken(platform::Sandbox& sandbox
 
 /// One extension token on the side that uses it. The right ends with the object at the latest.
 /// Consumed and expelled from one thread at a time.
-class ZBSandboxExtension {
+class ZBSandboxExtension final {
 public:
     /// `sandbox` must outlive the object.
-    ZBSandboxExtension(platform::Sandbox& sandbox, std::string token);
+    static std::shared_ptr<ZBSandboxExtension> initWithExtension(platform::Sandbox& sandbox, std::string token);
     ~ZBSandboxExtension();
     ZBSandboxExtension(const ZBSandboxExtension&) = delete;
     ZBSandboxExtension& operator=(const ZBSandboxExtension&) = delete;
@@ -45,6 +47,8 @@ public:
     }
 
 private:
+    ZBSandboxExtension(platform::Sandbox& sandbox, std::string token);
+
     platform::Sandbox& _sandbox;
     AtomicField<std::string> _token;
     std::int64_t _handle = -1;

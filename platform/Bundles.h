@@ -10,12 +10,12 @@ namespace platform {
 
 enum class BundleProperty { path, executablePath, supportPath };
 
-/// One bundle directory as it was found. Immutable: ask again for a fresh view.
+/// One bundle directory. Its path stays; the manifest is read anew on each call.
 class BundleObject {
 public:
     virtual ~BundleObject() = default;
     virtual std::optional<std::string> property(BundleProperty property) const = 0;
-    /// Reads the manifest anew on each call; none when there is none or it is no dictionary.
+    /// None when there is no manifest, or it is no dictionary or nests beyond `maximumManifestNesting`.
     virtual std::optional<Dictionary> infoDictionary() const = 0;
     virtual std::string description() const = 0;
 };

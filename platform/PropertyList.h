@@ -31,9 +31,19 @@ struct Date {
 enum class Kind : std::uint8_t { none, boolean, integer, real, date, string, data, uuid, array, dictionary };
 
 namespace detail {
-struct Node; // reference-counted storage; defined in PropertyList.cpp
-void retain(Node* node) noexcept;
-void release(Kind kind, Node* node) noexcept;
+/// Reference-counted storage; what follows the count is known to PropertyList.cpp alone.
+struct Node {
+    std::atomic<std::uint32_t> references{1};
+
+    void addReference() noexcept { references.fetch_add(1, std::memory_order_relaxed); }
+    /// True when that was the last one.
+    bool dropReference() noexcept {
+        // The only holder needs no atomic subtraction: nobody else can take a reference meanwhile.
+        if (references.load(std::memory_order_acquire) == 1) return true;
+        return references.fetch_sub(1, std::memory_order_acq_rel) == 1;
+    }
+};
+void destroy(Kind kind, Node* node) noexcept;
 struct Contents; // reaches into values for PropertyList.cpp
 } // namespace detail
 
@@ -61,11 +71,28 @@ public:
     Value(const Dictionary& value);                 // NOLINT(google-explicit-constructor)
     static Value data(std::string_view bytes);
 
-    Value(const Value& other) noexcept;
-    Value(Value&& other) noexcept;
-    Value& operator=(const Value& other) noexcept;
-    Value& operator=(Value&& other) noexcept;
-    ~Value();
+    // Inline: forms and replies are copies and ends of values for the most part.
+    Value(const Value& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
+        if (hasNode()) node()->addReference();
+    }
+    Value(Value&& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
+        other._kind = Kind::none;
+        other._bits = 0;
+    }
+    Value& operator=(const Value& other) noexcept {
+        Value copy(other); // first, for `other` may live inside what this value lets go
+        return *this = std::move(copy);
+    }
+    Value& operator=(Value&& other) noexcept {
+        Value taken(std::move(other));
+        std::swap(_bits, taken._bits);
+        std::swap(_kind, taken._kind);
+        std::swap(_unsigned, taken._unsigned);
+        return *this;
+    }
+    ~Value() {
+        if (hasNode() && node()->dropReference()) detail::destroy(_kind, node());
+    }
 
     Kind kind() const noexcept { return _kind; }
     /// False only for "absent".
@@ -109,7 +136,7 @@ private:
     explicit Value(Unsigned value) noexcept;
     Value(Kind kind, detail::Node* node) noexcept;
     bool hasNode() const noexcept { return _kind >= Kind::string; }
-    detail::Node* node() const noexcept;
+    detail::Node* node() const noexcept { return reinterpret_cast<detail::Node*>(static_cast<std::uintptr_t>(_bits)); }
 
     friend class Array;
     friend class MutableArray;
@@ -196,6 +223,13 @@ public:
 
     /// True when both handles share one storage.
     bool sharesStorageWith(const Dictionary& other) const noexcept;
+
+    /// A new dictionary with the same entries that keeps its compact encoding, for one that is encoded again and again.
+    /// Neither it nor anything in it may change from now on.
+    Dictionary keepingEncoding() const;
+    /// The encoding that is kept; none for most dictionaries.
+    std::optional<std::string_view> keptEncoding() const noexcept;
+
     /// Same keys with equal values, in any order.
     friend bool operator==(const Dictionary& left, const Dictionary& right) noexcept;
 
@@ -224,6 +258,9 @@ public:
 
 /// Bounds of the decoders. Each protects the daemon from its input; none is reachable by a sensible value.
 inline constexpr std::size_t maximumNesting = 64; // recursion in decoders, encoders and comparison stays shallow
+/// For manifests and what is merged into them: messages carry these inside a form, which is inside a list of forms, and
+/// have to stay decodable.
+inline constexpr std::size_t maximumManifestNesting = maximumNesting - 8;
 
 /// Domain of decoding errors; the description says what was wrong and where.
 inline constexpr const char* propertyListErrorDomain = "PropertyList";
@@ -238,8 +275,9 @@ inline constexpr std::string_view compactMagic = "vlist16\n";
 /// NUL, a date outside the years 1 to 9999 and nesting beyond `maximumNesting` are encoded, but no decoder takes them.
 void appendCompact(std::string& out, const Value& value);
 /// Decodes exactly one value that fills `bytes`. Strict: UTF-8 checked, no NUL in strings and keys, no duplicate
-/// keys, every size checked against what is left before anything is allocated, nesting bounded.
-Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids);
+/// keys, every size checked against what is left before anything is allocated, containers nested in one another at most
+/// `nesting` deep. `nesting` is at most `maximumNesting`.
+Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids, std::size_t nesting = maximumNesting);
 
 /// The XML encoding of a whole file, ending in a newline. An error for what no XML file can hold: UUIDs, control
 /// characters other than tab, newline and carriage return, text that is no UTF-8, dates outside the years 1 to 9999,
@@ -247,8 +285,8 @@ Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids);
 /// (written as 2026-11-22T21:00:00Z, with as many decimals of a second as it takes).
 Result<std::string> encodeXML(const Value& value);
 
-/// Decodes a file in either encoding, told apart by its first bytes. Equally strict; XML with a document type or
-/// with entities beyond the five predefined ones is refused.
-Result<Value> decodePropertyList(std::string_view bytes);
+/// Decodes a file in either encoding, told apart by its first bytes. Equally strict, with the same `nesting`; XML with
+/// a document type or with entities beyond the five predefined ones is refused.
+Result<Value> decodePropertyList(std::string_view bytes, std::size_t nesting = maximumNesting);
 
 } // namespace platform

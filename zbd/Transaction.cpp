@@ -6,6 +6,7 @@
 #include "zbd/ZBDQmxClient.h"
 #include "zbd/ZBDServer.h"
 
+#include <algorithm>
 #include <array>
 #include <optional>
 #include <utility>
@@ -27,20 +28,27 @@ constexpr std::size_t maximumPath = 1024; // bytes of a resolved path with its N
 struct RequestType {
     std::string_view name;
     void (Transaction::*handler)();
+    bool isBrief = false;
 };
 
 constexpr std::array requestTypes{
     RequestType{requestType::add, &Transaction::addPlugIns},
     RequestType{requestType::remove, &Transaction::removePlugIns},
-    RequestType{requestType::bulk, &Transaction::bulkPlugIns},
+    RequestType{requestType::bulk, &Transaction::bulkPlugIns, true},
     RequestType{requestType::match, &Transaction::matchPlugIns},
     RequestType{requestType::ready, &Transaction::readyPlugIns},
     RequestType{requestType::access, &Transaction::accessPlugIns},
     RequestType{requestType::annotate, &Transaction::annotatePlugIns},
     RequestType{requestType::bulkAnnotate, &Transaction::bulkAnnotatePlugIns},
     RequestType{requestType::lock, &Transaction::lockDownPlugIns},
-    RequestType{requestType::find, &Transaction::findPlugIn},
+    RequestType{requestType::find, &Transaction::findPlugIn, true},
 };
+
+const RequestType* typeNamed(std::string_view name) {
+    const auto found = std::find_if(requestTypes.begin(), requestTypes.end(),
+                                    [&](const RequestType& type) { return type.name == name; });
+    return found == requestTypes.end() ? nullptr : &*found;
+}
 
 } // namespace
 
@@ -56,6 +64,12 @@ const std::shared_ptr<ZBDServer>& Transaction::server() const { return _client->
 
 std::shared_ptr<platform::Connection> Transaction::connection() const { return _client->connection(); }
 
+bool Transaction::isBrief() const {
+    const auto type = _request.string(key::request);
+    const RequestType* known = type ? typeNamed(*type) : nullptr;
+    return known == nullptr || known->isBrief;
+}
+
 void Transaction::dispatch() {
     const auto type = _request.string(key::request);
     _version = _request.uint64(key::version).value_or(0);
@@ -69,9 +83,7 @@ void Transaction::dispatch() {
     log::ops().debug("client %d requested %{public}s", _client->pid(), typeText);
     platform::trace::request(_client->pid(), typeText ? typeText->c_str() : nullptr);
     if (!type) return fail(code::malformed, "invalid request format (missing type)");
-    for (const RequestType& known : requestTypes) {
-        if (known.name == *type) return (this->*known.handler)();
-    }
+    if (const RequestType* known = typeNamed(*type)) return (this->*known->handler)();
     fail(code::malformed, "unrecognized request");
 }
 
@@ -82,15 +94,15 @@ void Transaction::done() {
     if (const auto peer = connection()) peer->send(_reply);
 }
 
-void Transaction::fail(std::int64_t errorCode, std::string_view message) {
-    reply().set(key::errorcode, static_cast<std::uint64_t>(errorCode));
+void Transaction::fail(std::uint64_t errorCode, std::string_view message) {
+    reply().set(key::errorcode, errorCode);
     reply().set(key::error, message);
     done();
 }
 
-void Transaction::fail(std::int64_t errorCode, const platform::Error& error) {
+void Transaction::fail(std::uint64_t errorCode, const platform::Error& error) {
     const bool own = error.domain == zembra::errorDomain;
-    fail(own ? error.code : errorCode, error.text());
+    fail(own ? static_cast<std::uint64_t>(error.code) : errorCode, error.text());
 }
 
 bool Transaction::marshalPaths(const PathCallback& callback) {

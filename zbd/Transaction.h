@@ -28,6 +28,9 @@ public:
     static std::shared_ptr<Transaction> initWithRequest(const platform::ReceivedMessage& message,
                                                         std::shared_ptr<ZBDQmxClient> client);
 
+    /// Whether serving it is, but for the first time that a plug-in is seen, a matter of microseconds.
+    bool isBrief() const;
+
     /// Checks version and liveness, then calls the handler of the request's type. A request of a dead client is
     /// dropped, unless its version already refused it.
     void dispatch();
@@ -40,9 +43,9 @@ public:
 
     /// Sends the reply as it stands. The reply is not touched afterwards.
     void done();
-    void fail(std::int64_t errorCode, std::string_view message);
+    void fail(std::uint64_t errorCode, std::string_view message);
     /// An error of the system's own domain travels with its own code and text.
-    void fail(std::int64_t errorCode, const platform::Error& error);
+    void fail(std::uint64_t errorCode, const platform::Error& error);
 
     // Handlers.
     void addPlugIns();          // TransactionRegistration.cpp

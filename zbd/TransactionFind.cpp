@@ -30,7 +30,7 @@ void Transaction::findPlugIn() {
     log::ops().notice("plugin found %{public}@", plugIn);
 
     platform::Failure error;
-    MutableDictionary form = plugIn->exportForm(&error); // a new dictionary, so it is ours to complete
+    MutableDictionary form = plugIn->currentForm(&error);
     if (error) {
         log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(), *error);
     }

@@ -13,12 +13,20 @@ using platform::Dictionary;
 using platform::Error;
 using platform::MutableDictionary;
 using platform::URL;
-using platform::Value;
 
 namespace {
 
 constexpr std::string_view versionKey = "version";
 constexpr std::string_view dataKey = "data";
+
+platform::Result<std::string> encodedDatabase(const Dictionary& annotations) {
+    auto bytes =
+        platform::encodeXML(Dictionary{{versionKey, ZBDAnnotationStore::databaseVersion}, {dataKey, annotations}});
+    if (bytes && bytes->size() > ZBDAnnotationStore::maximumFileSize) {
+        return Error{platform::fileErrorDomain, platform::fileWriteOutOfSpaceCode, "the annotations are too large"};
+    }
+    return bytes;
+}
 
 } // namespace
 
@@ -59,6 +67,10 @@ void ZBDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
         // A new dictionary each time: requests may still be reading the stored one.
         auto merged = MutableDictionary::copyOf(annotationForIdentifier(key).value_or(Dictionary()));
         merged.merge(*annotation);
+        if (const auto alone = encodedDatabase({{key, merged}}); !alone) {
+            log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, alone.error());
+            return;
+        }
         _annotations.set(key, merged);
     } else {
         _annotations.remove(key);
@@ -93,7 +105,7 @@ bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
 }
 
 bool ZBDAnnotationStore::saveDb(Error& error) const {
-    auto bytes = platform::encodeXML(Dictionary{{versionKey, databaseVersion}, {dataKey, _annotations}});
+    const auto bytes = encodedDatabase(_annotations);
     if (!bytes) {
         error = bytes.error();
         return false;

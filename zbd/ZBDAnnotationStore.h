@@ -4,6 +4,7 @@
 #include "platform/PropertyList.h"
 #include "platform/Url.h"
 
+#include <cstddef>
 #include <memory>
 #include <optional>
 #include <string>
@@ -19,8 +20,9 @@ class ZBDAnnotationStore {
 public:
     /// The one format that is read and written; older files start afresh.
     static constexpr int databaseVersion = 16;
-    /// More than any user's annotations can come to, and little enough to read into memory without thought.
-    static constexpr std::size_t maximumFileSize = 64U << 20U;
+    /// Neither read nor written beyond this: hosts choose what they store, and a file that cannot be read back would
+    /// lose everything.
+    static constexpr std::size_t maximumFileSize = std::size_t{64} << 20U;
 
     /// A store with its table loaded, migrated or empty. `path` is taken as written; none means the default location.
     /// Never writes unless it migrates. Ends the process when the container service fails.
@@ -31,7 +33,8 @@ public:
     std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn) const;
 
     /// Merges `annotation` into what is stored for the plug-in, or removes that when it is none; then saves. A failure
-    /// to save is logged; the change stays in memory and goes out with the next one.
+    /// to save is logged; the change stays in memory and goes out with the next one. What no file can hold (a UUID,
+    /// control characters, nesting without end) is logged and not taken, for no change could be saved after it.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
 
     /// False, with `error` set, when no table could be loaded; the present table then is as it was.

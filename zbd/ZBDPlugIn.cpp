@@ -6,6 +6,7 @@
 #include "Zembra/ZBUtilities.h"
 
 #include <cmath>
+#include <set>
 
 namespace zbd {
 
@@ -37,7 +38,7 @@ bool ZBDPlugIn::setupWithProxy(const PlugInProxyRef& proxy) {
     setLocalizedName(valueOrAbsent(proxy->localizedName));
     setLocalizedShortName(valueOrAbsent(proxy->localizedShortName));
     setLocalizedContainingName(container ? valueOrAbsent(container->localizedName) : Value());
-    setLocalizedFilevaneActionNames(localizedFilevaneActionNamesForZBDict(_platform.registry, *proxy, declared));
+    setLocalizedFilevaneActionNames(ZBDPluginAdditions::localizedFilevaneActionNamesForZBDict(_platform.registry, *proxy, declared));
     _originalIdentifier = valueOrAbsent(proxy->originalIdentifier);
     _entitlements = proxy->entitlements;
     _dataContainerURL = proxy->dataContainerURL;
@@ -118,7 +119,35 @@ std::optional<Dictionary> ZBDPlugIn::localizedFilevaneActionNames() const {
     return _localizedFilevaneActionNames.get().dictionary();
 }
 
-void ZBDPlugIn::setLocalizedFilevaneActionNames(Value value) { _localizedFilevaneActionNames.set(std::move(value)); }
+void ZBDPlugIn::setLocalizedFilevaneActionNames(Value value) {
+    setLocalized(_localizedFilevaneActionNames, std::move(value));
+}
+
+void ZBDPlugIn::setLocalized(zembra::AtomicField<Value>& field, Value value) {
+    field.set(std::move(value));
+    _keptForm.set(nullptr); // it shows the old name
+}
+
+MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error) const {
+    const auto manifest = bundleInfoDictionary();
+    // Whoever reads the debug lines of the export sees them for every form.
+    const bool mayKeep = manifest && !log::cx().isEnabled(platform::LogLevel::debug);
+    if (const auto kept = mayKeep ? _keptForm.get() : nullptr; kept && kept->manifest.sharesStorageWith(*manifest)) {
+        return MutableDictionary::copyOf(kept->form);
+    }
+    platform::Failure failure;
+    MutableDictionary form = exportForm(&failure);
+    if (failure) {
+        if (error) *error = std::move(failure);
+        return form;
+    }
+    if (!mayKeep) return form;
+    for (const auto key : {zembra::formKey::bundleInfo, zembra::formKey::info, zembra::formKey::entitlements}) {
+        if (const auto part = form.dictionary(key)) form.set(key, part->keepingEncoding());
+    }
+    _keptForm.set(std::make_shared<const KeptForm>(KeptForm{*manifest, MutableDictionary::copyOf(form)}));
+    return form;
+}
 
 Value ZBDPlugIn::valueForEntitlement(std::string_view key) const {
     return _entitlements ? (*_entitlements)[key] : Value();
@@ -134,8 +163,9 @@ std::string ZBDPlugIn::annotationKey() const {
     return std::string(replaced.string() ? *replaced.string() : *identifier().string());
 }
 
-Dictionary localizedFilevaneActionNamesForZBDict(platform::Registry& registry, const platform::PlugInProxy& proxy,
-                                                 const Dictionary& plugInDictionary) {
+Dictionary ZBDPluginAdditions::localizedFilevaneActionNamesForZBDict(platform::Registry& registry,
+                                                                     const platform::PlugInProxy& proxy,
+                                                                     const Dictionary& plugInDictionary) {
     std::set<std::string> names;
     const auto actions = plugInDictionary.array(manifest::filevaneActions).value_or(platform::Array());
     for (const Value& action : actions) {

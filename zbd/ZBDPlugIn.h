@@ -10,6 +10,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 
 namespace zbd {
 
@@ -40,12 +41,14 @@ public:
     std::optional<platform::Dictionary> entitlements() const override { return _entitlements; }
     std::optional<platform::URL> dataContainerURL() const override { return _dataContainerURL; }
     platform::Value localizedName() const override { return _localizedName.get(); }
-    void setLocalizedName(platform::Value value) override { _localizedName.set(std::move(value)); }
+    void setLocalizedName(platform::Value value) override { setLocalized(_localizedName, std::move(value)); }
     platform::Value localizedShortName() const override { return _localizedShortName.get(); }
-    void setLocalizedShortName(platform::Value value) override { _localizedShortName.set(std::move(value)); }
+    void setLocalizedShortName(platform::Value value) override { setLocalized(_localizedShortName, std::move(value)); }
     platform::Value localizedContainingName() const override { return _localizedContainingName.get(); }
-    void setLocalizedContainingName(platform::Value value) override { _localizedContainingName.set(std::move(value)); }
-    /// Always a dictionary, empty when the plug-in declares no actions.
+    void setLocalizedContainingName(platform::Value value) override {
+        setLocalized(_localizedContainingName, std::move(value));
+    }
+    /// A dictionary from creation on, empty when the plug-in declares no actions.
     std::optional<platform::Dictionary> localizedFilevaneActionNames() const override;
     void setLocalizedFilevaneActionNames(platform::Value value) override;
 
@@ -54,7 +57,7 @@ public:
     /// The registry's knowledge at the last refresh; none before the first look-up.
     std::optional<platform::UUID> cxKnowledgeUUID() const { return _cxKnowledgeUUID.get(); }
 
-    // Kept for hosts of other systems; the daemon never sets them.
+    // Facts that nothing here tells: never set.
     bool ageRestricted() const { return false; }
     platform::Value containerAgeRestriction() const { return {}; }
     platform::Value vNode() const { return {}; }
@@ -69,6 +72,10 @@ public:
 
     platform::Failure diagnose() const override;
 
+    /// A form of the caller's own, as `exportForm` makes it. What it is made of is kept, encoded, until the registry's
+    /// knowledge changes, so that a plug-in that is asked for again and again costs little.
+    platform::MutableDictionary currentForm(platform::Failure* error) const;
+
     // ZBDPlugInTokens.cpp
 
     /// Adds the sandbox tokens that a host needs to a form made by `exportForm`.
@@ -81,6 +88,7 @@ private:
     explicit ZBDPlugIn(platform::Platform& platform) : _platform(platform) {}
     bool setupWithProxy(const platform::PlugInProxyRef& proxy);
     platform::Value currentInfo() const;
+    void setLocalized(zembra::AtomicField<platform::Value>& field, platform::Value value);
 
     platform::Platform& _platform;
     zembra::AtomicField<platform::Value> _localizedName;
@@ -94,10 +102,22 @@ private:
     mutable std::recursive_mutex _refreshLock; // one refresh at a time: fetching and storing are one step
     mutable zembra::AtomicField<platform::Value> _infoVlist;
     mutable zembra::AtomicField<std::optional<platform::UUID>> _cxKnowledgeUUID;
+
+    struct KeptForm {
+        platform::Dictionary manifest; // the one it was made from
+        platform::MutableDictionary form;
+    };
+    mutable zembra::AtomicField<std::shared_ptr<const KeptForm>> _keptForm;
 };
 
+/// What the daemon adds to the registry's proxies.
+namespace ZBDPluginAdditions {
+
 /// Action name to localized title, for the actions that the plug-in dictionary declares.
-platform::Dictionary localizedFilevaneActionNamesForZBDict(platform::Registry& registry, const platform::PlugInProxy& proxy,
+platform::Dictionary localizedFilevaneActionNamesForZBDict(platform::Registry& registry,
+                                                           const platform::PlugInProxy& proxy,
                                                            const platform::Dictionary& plugInDictionary);
+
+} // namespace ZBDPluginAdditions
 
 } // namespace zbd

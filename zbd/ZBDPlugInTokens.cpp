@@ -26,7 +26,8 @@ std::string errnoText(const platform::Error& error) {
 } // namespace
 
 void ZBDPlugIn::augmentForm(MutableDictionary& form) const {
-    const Value resources = isAppExtension() ? Value(Array{Value(wholeBundle)}) : pluginKey(manifest::shared);
+    static const Value wholeBundleOnly = Array{Value(wholeBundle)};
+    const Value resources = isAppExtension() ? wholeBundleOnly : pluginKey(manifest::shared);
     if (resources) form.set(zembra::formKey::extensions, issueResourceExtensions(resources));
     if (isData()) return;
 

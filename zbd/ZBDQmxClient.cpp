@@ -33,6 +33,7 @@ std::shared_ptr<ZBDQmxClient> ZBDQmxClient::initWithConnection(const std::shared
     platform::Platform& platform = server->platform();
     const platform::AuditToken token = connection->peerAuditToken();
 
+    // By the token, not the pid: the pid may be another process's by now.
     if (auto path = platform.processes.executablePath(token, pathBufferSize)) {
         self->_bundle = zembra::ZBBundle::initWithExecutableURL(platform.bundles, platform::URL::file(*path));
         self->_path = *std::move(path);
@@ -72,12 +73,18 @@ void ZBDQmxClient::handleRequest(const ReceivedMessage& message) {
         platform::trace::requestInput(pid(), message.content.description().c_str());
     }
     auto transaction = Transaction::initWithRequest(message, shared_from_this());
-    _server->submitWork([self = shared_from_this(), transaction = std::move(transaction)] {
+    const bool isBrief = transaction->isBrief();
+    platform::WorkQueue::Item work = [self = shared_from_this(), transaction = std::move(transaction)] {
         if (++self->_requestCount % requestCountInterval == 0) {
             log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
         }
         transaction->dispatch();
-    });
+    };
+    if (isBrief) {
+        _server->submitBriefWork(std::move(work));
+    } else {
+        _server->submitWork(std::move(work));
+    }
 }
 
 void ZBDQmxClient::dying() { log::ops().debug("client %d termination imminent", pid()); }

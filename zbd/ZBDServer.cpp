@@ -62,7 +62,9 @@ void ZBDServer::run() {
     platform().runLoop.run();
 }
 
-void ZBDServer::submitWork(platform::WorkQueue::Item item) { _mainQueue->asyncOnCaller(std::move(item)); }
+void ZBDServer::submitWork(platform::WorkQueue::Item item) { _mainQueue->async(std::move(item)); }
+
+void ZBDServer::submitBriefWork(platform::WorkQueue::Item item) { _mainQueue->asyncOnCaller(std::move(item)); }
 
 void ZBDServer::stop() {
     _service->cancel();

@@ -32,9 +32,11 @@ public:
     /// Resumes the listener and serves the main run loop. Main thread; does not return while the process lives.
     void run();
 
-    /// Runs `item` on the service queue after everything submitted before it. Any thread that holds no lock; on an
-    /// idle queue the item may have run when this returns.
+    /// Runs `item` on the service queue after everything submitted before it. Any thread.
     void submitWork(platform::WorkQueue::Item item);
+    /// The same for work that is done in microseconds: on an idle queue the caller runs it itself, which saves a
+    /// hand-over that costs as much as the work. For a thread that holds no lock and is on no queue.
+    void submitBriefWork(platform::WorkQueue::Item item);
 
     /// Accepts no further connections and releases every hold. Existing connections are not touched. Not on the holds
     /// queue.
@@ -44,6 +46,9 @@ public:
     void removedPlugIns(const std::vector<platform::PlugInProxyRef>& proxies) override;
 
     // ZBDServerHolds.cpp. Not to be called on the holds queue.
+
+    /// The holds in force, in the order they were added.
+    Holds holds() const;
     bool holdOnPlugIn(const ZBDPlugInRef& plugIn);
     void addHold(const std::shared_ptr<ZBDPlugInHold>& hold);
     void unholdToken(const platform::UUID& token);
@@ -52,22 +57,20 @@ public:
     /// after it has answered for all of them; no thread waits meanwhile.
     void terminatePlugIns(const std::vector<platform::PlugInProxyRef>& proxies, std::function<void()> reply);
 
-    unsigned verbose() const { return _verbose; }
-    void setVerbose(unsigned verbose) { _verbose = verbose; }
+    std::uint32_t verbose() const { return _verbose; }
+    void setVerbose(std::uint32_t verbose) { _verbose = verbose; }
     const std::shared_ptr<platform::WorkQueue>& qmxQueue() const { return _qmxQueue; }
     const std::shared_ptr<platform::WorkQueue>& mainQueue() const { return _mainQueue; }
     const std::shared_ptr<platform::WorkQueue>& syncQueue() const { return _syncQueue; }
     const std::shared_ptr<platform::Listener>& service() const { return _service; }
     const ZBDUserPrefs& userPrefs() const { return *_userPrefs; }
-    /// The holds in force, in the order they were added.
-    Holds holds() const;
-
 private:
     explicit ZBDServer(platform::Platform& platform);
     void handleListenerEvent(const platform::Listener::Event& event);
     void releaseAllHolds();
 
-    unsigned _verbose = 0;
+    // Set during construction and only read afterwards, the holds aside.
+    std::uint32_t _verbose = 0;
     std::shared_ptr<platform::WorkQueue> _qmxQueue;
     std::shared_ptr<platform::WorkQueue> _mainQueue;
     std::shared_ptr<platform::Listener> _service;

@@ -40,12 +40,12 @@ void ZBDServer::unholdToken(const UUID& token) {
 void ZBDServer::unholdClient(const std::shared_ptr<ZBDQmxClient>& client) {
     // One pass, so that ten thousand holds of one client end in a moment; each has its line and its notification.
     _syncQueue->sync([&] {
-        std::erase_if(_holds, [&](const auto& hold) {
+        const std::size_t released = std::erase_if(_holds, [&](const auto& hold) {
             if (hold->client() != client) return false;
             log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(), client->pid());
-            notifyAnnotationChange();
             return true;
         });
+        for (std::size_t i = 0; i < released; ++i) notifyAnnotationChange();
     });
 }
 

@@ -21,7 +21,8 @@ std::optional<std::string> pathOf(const std::optional<URL>& url) {
     return url ? std::optional(url->path()) : std::nullopt;
 }
 
-/// The election that a pattern asks for, or none when the pattern is more than "equals".
+/// The election that a pattern asks for, or none when the pattern is more than "equals". Elections are decimal numbers,
+/// so a pattern that begins beyond ASCII needs no prefilter: the rules refuse it later.
 std::optional<std::string> electionOfPattern(const Value& pattern) {
     const auto text = pattern.string();
     if (!text || text->empty()) return std::nullopt;
@@ -62,7 +63,7 @@ ZBDPlugInRef ZBDatabase::cachedPlugIn(const UUID& uuid) {
 
 ZBDPlugInRef ZBDatabase::plugInForProxy(const PlugInProxyRef& proxy) {
     return _sync->sync([&]() -> ZBDPlugInRef {
-        // A proxy without a UUID gives a record with a random one: never found again, so made anew each time.
+        // A proxy without a UUID gives a record with a random one: never found again, so it is not kept.
         if (proxy->uuid) {
             if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
         }
@@ -77,7 +78,7 @@ ZBDPlugInRef ZBDatabase::createPlugInForProxy(const PlugInProxyRef& proxy) {
     if (!plugIn) return nullptr;
     if (plugIn->hasEntitlement(zembra::entitlement::autoElectPlugIn)) autoElect(*plugIn);
     purgeCachesToLimit(_cacheLimit);
-    _cache.insert_or_assign(*plugIn->uuid(), plugIn);
+    if (proxy->uuid) _cache.insert_or_assign(*plugIn->uuid(), plugIn);
     return plugIn;
 }
 
@@ -161,11 +162,12 @@ std::optional<ZBDPlugInSet> ZBDatabase::findPlugIns(const std::optional<Dictiona
         const auto elections = electionPrefilter(*query);
         proxies = _workspace.plugInsMatching(
             *query, [&](const std::string& identifier, const std::optional<Dictionary>& entitlements) {
+                if (!elections) return true;
                 // A replacing plug-in shares the annotation of the one it replaces.
                 const auto replaced = entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
                 const std::string key(replaced.value_or(identifier));
-                const bool accepted = !elections || acceptByElection(*elections, key, entitlements);
-                if (elections) log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);
+                const bool accepted = acceptByElection(*elections, key, entitlements);
+                log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);
                 return accepted;
             });
         log::cx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, *query, proxies);

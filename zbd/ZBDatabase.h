@@ -1,5 +1,6 @@
 #pragma once
 
+#include "Zembra/AtomicField.h"
 #include "platform/Platform.h"
 #include "zbd/ZBDAnnotationStore.h"
 #include "zbd/ZBDPlugIn.h"
@@ -32,7 +33,7 @@ public:
     static constexpr std::uint32_t defaultCacheLimit = 1'000'000;
 
     /// Reads the annotations and begins to follow the registry and the locale. The object must be held by a shared
-    /// pointer. False when it cannot work at all.
+    /// pointer. False when there is no annotation store.
     bool initWithDatabase(const std::optional<std::string>& annotationDatabasePath);
 
     ZBDPlugInRef plugInForProxy(const platform::PlugInProxyRef& proxy);
@@ -55,7 +56,7 @@ public:
     // ZBDatabaseAnnotations.cpp
     std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn);
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
-    /// Tells every host, on this machine, that annotations or holds changed. Any thread.
+    /// Tells every host that annotations or holds changed. Any thread.
     void notifyAnnotationChange();
     /// Elects a plug-in that asks for it, unless the user decided otherwise. On the database queue only.
     void autoElect(const ZBDPlugIn& plugIn);
@@ -67,9 +68,9 @@ public:
     std::uint32_t cacheLimit() const { return _cacheLimit; }
     /// Before the first request.
     void setCacheLimit(std::uint32_t limit) { _cacheLimit = limit; }
-    std::shared_ptr<ZBDatabaseDelegate> delegate() const { return _delegate.lock(); }
-    /// Before the first notice. Held weakly.
-    void setDelegate(std::weak_ptr<ZBDatabaseDelegate> delegate) { _delegate = std::move(delegate); }
+    std::shared_ptr<ZBDatabaseDelegate> delegate() const { return _delegate.get().lock(); }
+    /// Held weakly. Any thread; notices that come before are passed on to nobody.
+    void setDelegate(std::weak_ptr<ZBDatabaseDelegate> delegate) { _delegate.set(std::move(delegate)); }
 
     platform::Platform& platform() const { return _platform; }
 
@@ -86,9 +87,10 @@ private:
 
     platform::Platform& _platform;
     std::uint32_t _cacheLimit = defaultCacheLimit;
-    std::weak_ptr<ZBDatabaseDelegate> _delegate;
+    zembra::AtomicField<std::weak_ptr<ZBDatabaseDelegate>> _delegate;
     platform::Registry& _workspace;
-    std::unique_ptr<ZBDAnnotationStore> _annotations; // changed on _sync; read there and by the service queue
+    std::unique_ptr<ZBDAnnotationStore> _annotations; // changed on _sync, and only while a request waits
+                                                      // for it: so the service queue may read it too
     std::shared_ptr<platform::WorkQueue> _sync;
     std::unordered_map<platform::UUID, ZBDPlugInRef> _cache; // on _sync only
     std::unique_ptr<platform::LocaleObservation> _regionObserver;

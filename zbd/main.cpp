@@ -21,14 +21,15 @@ struct Options {
     std::uint32_t cacheLimit = zbd::ZBDatabase::defaultCacheLimit;
     std::optional<std::string> database;
     std::string service = zembra::serviceName;
-    unsigned verbose = 0;
+    std::uint32_t verbose = 0;
 };
 
 /// None after a wrong command line.
 std::optional<Options> parse(int argc, char** argv) {
     Options options;
     int letter = 0;
-    while ((letter = getopt(argc, argv, "c:d:S:v")) != -1) {
+    // The plus sign lets the first operand end the options, whatever the environment says.
+    while ((letter = getopt(argc, argv, "+c:d:S:v")) != -1) {
         switch (letter) {
         case 'c': options.cacheLimit = static_cast<std::uint32_t>(std::atoi(optarg)); break;
         case 'd': options.database = optarg; break;

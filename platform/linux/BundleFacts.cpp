@@ -38,7 +38,7 @@ StoredDictionary::StoredDictionary(const Dictionary& dictionary, SharedKeys& key
 
 const Dictionary& StoredDictionary::dictionary() const {
     std::call_once(_decoding, [&] {
-        if (auto value = decodeCompact(_encoded, UUIDs::refused)) {
+        if (auto value = decodeCompact(_encoded, UUIDs::refused, maximumManifestNesting)) {
             if (auto dictionary = value->dictionary()) _dictionary = _keys.share(*dictionary);
         }
         _encoded = std::string();

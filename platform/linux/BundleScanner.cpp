@@ -130,7 +130,7 @@ ScannedBundle BundleScanner::scan(int directory, const std::string& path, Bundle
     if (!bytes) return without(State::unusable, bytes.error().text());
     if (!*bytes) return without(State::absent, {});
     if ((*bytes)->empty()) return without(State::unfinished, {});
-    const auto value = decodePropertyList(**bytes);
+    const auto value = decodePropertyList(**bytes, maximumManifestNesting);
     if (!value) return without(State::unusable, std::string(manifestName) + ": " + value.error().text());
     const auto info = value->dictionary();
     if (!info) return without(State::unusable, std::string(manifestName) + ": not a dictionary");

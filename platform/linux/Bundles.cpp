@@ -28,7 +28,7 @@ std::string withoutTrailingSeparators(std::string path) {
 std::optional<Dictionary> readManifest(Files& files, const std::string& directory) {
     const auto bytes = files.read(directory + "/Info.vlist", maximumManifestSize);
     if (!bytes) return std::nullopt;
-    const auto manifest = decodePropertyList(*bytes);
+    const auto manifest = decodePropertyList(*bytes, maximumManifestNesting);
     return manifest ? manifest->dictionary() : std::nullopt;
 }
 

@@ -71,7 +71,7 @@ Result<std::optional<Dictionary>> readEntitlements(int descriptor) {
     }
     if (bytes.empty()) return std::optional<Dictionary>();
 
-    auto value = decodePropertyList(bytes);
+    auto value = decodePropertyList(bytes, maximumManifestNesting);
     if (!value) return value.error();
     auto dictionary = value->dictionary();
     if (!dictionary) return Error{propertyListErrorDomain, 0, std::string(name) + ": not a dictionary"};

@@ -154,7 +154,7 @@ Result<std::string> Files::read(const std::string& path, std::size_t limit) {
         if (count == 0) break;
         used += static_cast<std::size_t>(count);
         if (used > limit) return tooLarge;
-        if (used == bytes.size()) wanted = used + std::clamp<std::size_t>(used, 4096, limit - used + 1);
+        if (used == bytes.size()) wanted = used + std::min(std::max<std::size_t>(used, 4096), limit - used + 1);
     }
     bytes.resize(used);
     return bytes;

@@ -90,10 +90,10 @@ std::shared_ptr<Interface> Interfaces::create(const std::string& name) {
     return std::make_shared<NamedInterface>(name);
 }
 
-void Interfaces::registerInterface(std::shared_ptr<Interface> interface) {
+std::shared_ptr<Interface> Interfaces::registerInterface(std::shared_ptr<Interface> interface) {
     assert(interface);
     const std::lock_guard lock(_mutex);
-    _interfaces.try_emplace(interface->name(), interface);
+    return _interfaces.try_emplace(interface->name(), interface).first->second;
 }
 
 bool Interfaces::isKnownClass(const std::string& name) {

@@ -13,8 +13,7 @@ class Interfaces : public platform::Interfaces {
 public:
     std::shared_ptr<Interface> find(const std::string& name) override;
     std::shared_ptr<Interface> create(const std::string& name) override;
-    /// Of two interfaces of one name the first that is registered stays.
-    void registerInterface(std::shared_ptr<Interface> interface) override;
+    std::shared_ptr<Interface> registerInterface(std::shared_ptr<Interface> interface) override;
     bool isKnownClass(const std::string& name) override;
     void addClass(const std::string& name) override;
     std::shared_ptr<InterfaceDescription> describe(std::shared_ptr<Interface> interface) override;

@@ -19,7 +19,10 @@
 #include "platform/linux/WorkQueue.h"
 
 #include <csignal>
+#include <cstdlib>
+#include <fcntl.h>
 #include <pthread.h>
+#include <unistd.h>
 
 namespace platform::linux_ {
 
@@ -40,12 +43,31 @@ struct LinuxPlatform::Services {
     ServiceManager serviceManager{root, files};
     Registry registry{root, locale, containers};
     Transport transport{root};
-    Platform platform{queues,  runLoop,    transport,   registry,   serviceManager, sandbox, codeSigning, bundles,
-                      interfaces, preferences, containers, notifications, locale, processes, files};
+    Platform platform{queues,     runLoop,       transport, registry,   serviceManager,
+                      sandbox,    codeSigning,   bundles,   interfaces, preferences,
+                      containers, notifications, locale,    processes,  files};
 };
 
+namespace {
+
+/// A standard descriptor that the process was started without would go to the next file or socket that is opened, and
+/// log lines would be written into that. Left open across exec, for the same reason.
+void fillStandardDescriptors() {
+    for (const int number : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) {
+        if (fcntl(number, F_GETFD) != -1) continue;
+        // The lowest free number is this one.
+        if (open("/dev/null", O_RDWR | O_NOCTTY) != number) std::abort();
+    }
+}
+
+} // namespace
+
 LinuxPlatform::LinuxPlatform() {
+    fillStandardDescriptors();
     setSystemLog(SystemLog::ofProcess());
+    // No channel of ours, so it shows its arguments: there the refusal of a removal names the path for the
+    // administrator.
+    systemLog().defaultHandle().setPrivateArguments(PrivateArguments::shown);
     // Threads inherit the mask, so SIGTERM waits for its source and never ends the process by itself.
     sigset_t terminate;
     sigemptyset(&terminate);

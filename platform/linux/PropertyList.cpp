@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <new>
 
 namespace platform {
@@ -16,7 +17,8 @@ namespace platform {
 namespace {
 
 /// From this many keys on a dictionary keeps a sorted index; below it a walk is faster.
-constexpr std::size_t indexThreshold = 16;
+/// Forms, the dictionaries made most often, stay below.
+constexpr std::size_t indexThreshold = 32;
 
 /// A log line stays readable, and no peer fills the log with one message.
 constexpr std::size_t maximumDescriptionLength = 4096;
@@ -51,10 +53,6 @@ void require(bool condition, const char* text) noexcept {
 } // namespace
 
 namespace detail {
-
-struct Node {
-    std::atomic<std::uint32_t> references{1};
-};
 
 /// The bytes follow the node in the same allocation.
 struct BytesNode : Node {
@@ -97,6 +95,7 @@ struct DictionaryNode : ContainerNode {
     DictionaryNode() noexcept : ContainerNode(Kind::dictionary) {}
 
     std::vector<Dictionary::Entry> entries;
+    std::unique_ptr<const std::string> encoding; // kept for a dictionary that does not change any more
     std::vector<std::uint32_t> index; // positions in `entries` by `before`; empty up to `indexThreshold` keys
 
     /// Any total order will do: comparing lengths first settles most pairs without looking at the bytes.
@@ -205,13 +204,6 @@ bool DictionaryNode::rebuildIndex() {
 
 namespace {
 
-/// True when that was the last reference.
-bool drop(Node* node) noexcept {
-    // The only holder needs no atomic subtraction: nobody else can take a reference meanwhile.
-    if (node->references.load(std::memory_order_acquire) == 1) return true;
-    return node->references.fetch_sub(1, std::memory_order_acq_rel) == 1;
-}
-
 void destroyLeaf(Kind kind, Node* node) noexcept {
     if (kind == Kind::uuid)
         delete static_cast<UUIDNode*>(node);
@@ -221,10 +213,7 @@ void destroyLeaf(Kind kind, Node* node) noexcept {
 
 } // namespace
 
-void retain(Node* node) noexcept { node->references.fetch_add(1, std::memory_order_relaxed); }
-
-void release(Kind kind, Node* node) noexcept {
-    if (!drop(node)) return;
+void destroy(Kind kind, Node* node) noexcept {
     if (kind < Kind::array) return destroyLeaf(kind, node);
 
     // Containers are emptied one after another instead of one within another: however deep they nest, the stack
@@ -233,7 +222,7 @@ void release(Kind kind, Node* node) noexcept {
     const auto discard = [&pending](Value& value) {
         const Kind valueKind = value.kind();
         Node* taken = Contents::take(value);
-        if (taken == nullptr || !drop(taken)) return;
+        if (taken == nullptr || !taken->dropReference()) return;
         if (valueKind < Kind::array) return destroyLeaf(valueKind, taken);
         auto* container = static_cast<ContainerNode*>(taken);
         container->next = pending;
@@ -346,34 +335,6 @@ Value::Value(const UUID& value) : Value(Kind::uuid, new detail::UUIDNode(value))
 Value::Value(const Array& value) : Value(value._storage) {}
 
 Value::Value(const Dictionary& value) : Value(value._storage) {}
-
-Value::Value(const Value& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
-    if (hasNode()) detail::retain(node());
-}
-
-Value::Value(Value&& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
-    other._kind = Kind::none;
-    other._bits = 0;
-}
-
-Value& Value::operator=(const Value& other) noexcept {
-    Value copy(other); // first, for `other` may live inside what this value lets go
-    return *this = std::move(copy);
-}
-
-Value& Value::operator=(Value&& other) noexcept {
-    Value taken(std::move(other));
-    std::swap(_bits, taken._bits);
-    std::swap(_kind, taken._kind);
-    std::swap(_unsigned, taken._unsigned);
-    return *this;
-}
-
-Value::~Value() {
-    if (hasNode()) detail::release(_kind, node());
-}
-
-detail::Node* Value::node() const noexcept { return Contents::node(*this); }
 
 std::optional<bool> Value::boolean() const noexcept {
     if (_kind != Kind::boolean) return std::nullopt;
@@ -711,6 +672,20 @@ std::optional<Array> Dictionary::array(std::string_view key) const noexcept {
 std::optional<Dictionary> Dictionary::dictionary(std::string_view key) const noexcept {
     const Value* value = find(key);
     return value != nullptr ? value->dictionary() : std::nullopt;
+}
+
+Dictionary Dictionary::keepingEncoding() const {
+    MutableDictionary copy = MutableDictionary::copyOf(*this);
+    auto encoding = std::make_unique<std::string>();
+    appendCompact(*encoding, *this);
+    encoding->shrink_to_fit();
+    Contents::dictionary(copy._storage).encoding = std::move(encoding);
+    return copy;
+}
+
+std::optional<std::string_view> Dictionary::keptEncoding() const noexcept {
+    const auto& encoding = Contents::dictionary(_storage).encoding;
+    return encoding ? std::optional<std::string_view>(*encoding) : std::nullopt;
 }
 
 bool Dictionary::sharesStorageWith(const Dictionary& other) const noexcept {

@@ -22,7 +22,7 @@ inline bool isEncodableDate(Date date) {
     return date.seconds >= firstSecond && date.seconds < endOfLastSecond;
 }
 
-/// Decodes a file that begins with compactMagic.
-Result<Value> decodeCompactFile(std::string_view bytes);
+/// Decodes a file that begins with compactMagic. `nesting` as in `decodeCompact`.
+Result<Value> decodeCompactFile(std::string_view bytes, std::size_t nesting);
 
 } // namespace platform::linux_

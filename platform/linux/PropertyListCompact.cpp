@@ -87,6 +87,10 @@ public:
         }
         case Kind::dictionary: {
             const Dictionary dictionary = *value.dictionary();
+            if (const auto kept = dictionary.keptEncoding()) {
+                _out.append(*kept);
+                break;
+            }
             const std::size_t start = beginContainer(dictionaryTag, dictionary.size(), depth);
             for (const auto& entry : dictionary) {
                 appendSized(entry.name());
@@ -147,8 +151,8 @@ private:
 
 class Reader {
 public:
-    Reader(std::string_view bytes, std::size_t offset, UUIDs uuids)
-        : _bytes(bytes), _at(offset), _end(bytes.size()), _uuids(uuids) {}
+    Reader(std::string_view bytes, std::size_t offset, UUIDs uuids, std::size_t nesting)
+        : _bytes(bytes), _at(offset), _end(bytes.size()), _uuids(uuids), _nesting(nesting) {}
 
     Result<Value> read() {
         Value value;
@@ -261,7 +265,7 @@ private:
     /// Reads size and count, and holds `readContent` to exactly that size.
     template <class Content>
     bool readContainer(std::size_t smallestItem, std::size_t start, std::size_t depth, Content readContent) {
-        if (depth == maximumNesting) return fail("containers nest too deep", start);
+        if (depth == _nesting) return fail("containers nest too deep", start);
         std::uint32_t size = 0;
         std::uint32_t count = 0;
         if (!readNumber(size) || !readNumber(count)) return false;
@@ -301,6 +305,7 @@ private:
     std::size_t _at;
     std::size_t _end; // of the container being read
     const UUIDs _uuids;
+    const std::size_t _nesting; // containers in one another
     std::optional<std::string> _problem;
 };
 
@@ -308,12 +313,14 @@ private:
 
 void appendCompact(std::string& out, const Value& value) { Writer(out).append(value); }
 
-Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids) { return Reader(bytes, 0, uuids).read(); }
+Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids, std::size_t nesting) {
+    return Reader(bytes, 0, uuids, nesting).read();
+}
 
 namespace linux_ {
 
-Result<Value> decodeCompactFile(std::string_view bytes) {
-    return Reader(bytes, compactMagic.size(), UUIDs::refused).read();
+Result<Value> decodeCompactFile(std::string_view bytes, std::size_t nesting) {
+    return Reader(bytes, compactMagic.size(), UUIDs::refused, nesting).read();
 }
 
 } // namespace linux_

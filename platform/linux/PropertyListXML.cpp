@@ -220,7 +220,6 @@ private:
     static bool isNoncharacter(std::string_view character) { return character == "\uFFFE" || character == "\uFFFF"; }
 
     bool appendText(std::string_view element, std::string_view text) {
-        if (linux_::firstBadByte(text)) return fail("text that is not UTF-8 or holds NUL");
         _out.append("<").append(element).append(">");
         for (std::size_t at = 0; at < text.size(); ++at) {
             const char c = text[at];
@@ -305,7 +304,7 @@ std::string_view trimmed(std::string_view text) {
 
 class XMLReader {
 public:
-    XMLReader() : _parser(XML_ParserCreate("UTF-8")) {}
+    explicit XMLReader(std::size_t maximum) : _parser(XML_ParserCreate("UTF-8")), _maximumNesting(maximum) {}
     ~XMLReader() { XML_ParserFree(_parser); }
     XMLReader(const XMLReader&) = delete;
     XMLReader& operator=(const XMLReader&) = delete;
@@ -380,7 +379,7 @@ private:
         } else if (!accept(element)) {
             return;
         }
-        if (isContainer(element) && _nesting++ == maximumNesting) return fail("containers nested too deep");
+        if (isContainer(element) && _nesting++ == _maximumNesting) return fail("containers nested too deep");
         _frames.push_back({element, {}, {}, {}});
     }
 
@@ -514,6 +513,7 @@ private:
     }
 
     const XML_Parser _parser;
+    const std::size_t _maximumNesting;
     std::vector<Frame> _frames;
     std::size_t _nesting = 0;
     std::optional<std::string> _problem;
@@ -523,9 +523,9 @@ private:
 
 Result<std::string> encodeXML(const Value& value) { return XMLWriter().write(value); }
 
-Result<Value> decodePropertyList(std::string_view bytes) {
-    if (bytes.starts_with(compactMagic)) return linux_::decodeCompactFile(bytes);
-    return XMLReader().read(bytes);
+Result<Value> decodePropertyList(std::string_view bytes, std::size_t nesting) {
+    if (bytes.starts_with(compactMagic)) return linux_::decodeCompactFile(bytes, nesting);
+    return XMLReader(nesting).read(bytes);
 }
 
 } // namespace platform

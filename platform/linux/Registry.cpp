@@ -438,7 +438,7 @@ std::optional<Dictionary> Registry::sdkDictionary(const std::string& extensionPo
     if (!folder) return std::nullopt;
     const auto bytes = readFile(folder.get(), name, maximumManifestSize);
     if (!bytes || !*bytes) return std::nullopt;
-    const auto value = decodePropertyList(**bytes);
+    const auto value = decodePropertyList(**bytes, maximumManifestNesting);
     return value ? value->dictionary() : std::nullopt;
 }
 

@@ -3,7 +3,6 @@
 #include "platform/linux/Confinement.h"
 #include "platform/linux/SandboxBroker.h"
 #include "platform/linux/SandboxToken.h"
-
 #include "platform/linux/SystemError.h"
 
 #include <cerrno>
@@ -26,6 +25,10 @@ constexpr std::size_t maximumResolutions = 8192;
 /// A directory above may move without a sign at the file itself. A token made from an outdated resolution opens
 /// nothing, so this bounds how long one is handed out in vain.
 constexpr std::chrono::seconds resolutionLifetime{5};
+
+/// How long a look at the file itself serves. Requests for one bundle come in bursts; a bundle that was replaced in
+/// between gives a token that opens nothing.
+constexpr std::chrono::milliseconds verificationLifetime{10};
 
 bool isName(const std::string& text) {
     return !text.empty() && text.size() <= maximumNameLength && text.find('\0') == std::string::npos;
@@ -85,35 +88,47 @@ Failure Sandbox::startBroker() {
     return std::nullopt;
 }
 
-int Sandbox::resolve(const std::string& path, const std::string& within, Resolution& resolution) {
-    FileStatus status;
-    if (int number = readFileStatus(AT_FDCWD, path.c_str(), status)) return number;
-    const auto now = std::chrono::steady_clock::now();
-    std::string key = path;
+std::string Sandbox::resolutionKey(const std::string& path, const std::string& within) {
+    std::string key;
+    key.reserve(path.size() + 1 + within.size());
+    key = path;
     if (!within.empty()) key.append(1, '\0').append(within);
-    {
-        std::lock_guard lock(_mutex);
-        auto known = _resolutions.find(key);
-        if (known != _resolutions.end() && known->second.status == status &&
-            now - known->second.checked < resolutionLifetime) {
-            resolution = known->second;
-            return 0;
-        }
-    }
+    return key;
+}
+
+/// The token of an earlier resolution, while the file is the one that it was made for.
+std::optional<std::string> Sandbox::knownToken(const std::string& key, const std::string& path,
+                                               const std::string& extensionClass, bool canonical) {
+    const auto now = std::chrono::steady_clock::now();
+    const auto isCurrent = [&](const Resolution& known) {
+        return now - known.checked < resolutionLifetime && known.tokenCanonical == canonical &&
+               known.tokenClass == extensionClass;
+    };
+    std::unique_lock lock(_mutex);
+    const auto known = _resolutions.find(key);
+    if (known == _resolutions.end() || !isCurrent(known->second)) return std::nullopt;
+    if (now - known->second.verified < verificationLifetime) return known->second.token;
+    lock.unlock();
+    FileStatus status;
+    if (readFileStatus(AT_FDCWD, path.c_str(), status) != 0) return std::nullopt;
+    lock.lock();
+    const auto again = _resolutions.find(key);
+    if (again == _resolutions.end() || !isCurrent(again->second) || !(again->second.status == status)) return std::nullopt;
+    again->second.verified = now;
+    return again->second.token;
+}
+
+int Sandbox::resolve(const std::string& path, const std::string& within, Resolution& resolution) {
+    resolution.checked = resolution.verified = std::chrono::steady_clock::now();
     if (int number = canonicalise(path, resolution.canonicalPath)) return number;
     if (!within.empty()) {
         std::string directory;
         if (int number = canonicalise(within, directory)) return number;
         if (!isWithin(resolution.canonicalPath, directory)) return EPERM;
     }
-    // Read anew by the canonical path: the given one may lead elsewhere by now.
+    // By the canonical path: the given one may lead elsewhere by now.
     if (int number = readFileStatus(AT_FDCWD, resolution.canonicalPath.c_str(), resolution.status)) return number;
-    if (!S_ISREG(resolution.status.mode) && !S_ISDIR(resolution.status.mode)) return EINVAL;
-    resolution.checked = now;
-    std::lock_guard lock(_mutex);
-    if (_resolutions.size() >= maximumResolutions) _resolutions.clear();
-    _resolutions.insert_or_assign(std::move(key), resolution);
-    return 0;
+    return S_ISREG(resolution.status.mode) || S_ISDIR(resolution.status.mode) ? 0 : EINVAL;
 }
 
 Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
@@ -122,20 +137,37 @@ Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const 
     if (!isName(extensionClass) || !path.starts_with('/') || path.find('\0') != std::string::npos ||
         within.find('\0') != std::string::npos)
         return systemError(EINVAL, path);
+    const bool canonical = flag == SandboxFlag::canonical;
+    std::string key = resolutionKey(path, within);
+    if (auto token = knownToken(key, path, extensionClass, canonical)) return *std::move(token);
+
     Resolution resolution;
     if (int number = resolve(path, within, resolution)) return systemError(number, path);
-    const bool canonical = flag == SandboxFlag::canonical;
     auto token = _signer->sign({SandboxGrant::Kind::file, extensionClass, canonical ? resolution.canonicalPath : path,
                                 canonical, resolution.status.identity});
     if (!token) return systemError(ENOMEM, path);
+    resolution.tokenClass = extensionClass;
+    resolution.tokenCanonical = canonical;
+    resolution.token = *token;
+    const std::lock_guard lock(_mutex);
+    if (_resolutions.size() >= maximumResolutions) _resolutions.clear();
+    _resolutions.insert_or_assign(std::move(key), std::move(resolution));
     return *std::move(token);
 }
 
 Result<std::string> Sandbox::issueService(const std::string& extensionClass, const std::string& name) {
     if (!_signer) return systemError(EPERM, name);
     if (!isName(extensionClass) || !isName(name)) return systemError(EINVAL, name);
+    std::string key = resolutionKey(extensionClass, name);
+    {
+        const std::lock_guard lock(_mutex);
+        if (const auto known = _serviceTokens.find(key); known != _serviceTokens.end()) return known->second;
+    }
     auto token = _signer->sign({SandboxGrant::Kind::service, extensionClass, name, false, {}});
     if (!token) return systemError(ENOMEM, name);
+    const std::lock_guard lock(_mutex);
+    if (_serviceTokens.size() >= maximumResolutions) _serviceTokens.clear();
+    _serviceTokens.insert_or_assign(std::move(key), *token);
     return *std::move(token);
 }
 

@@ -197,7 +197,7 @@ SystemLog::SystemLog(std::string identifier, std::string_view settings, int desc
 
 SystemLog& SystemLog::ofProcess() {
     static SystemLog& log = []() -> SystemLog& {
-        const char* settings = std::getenv(logEnvironmentVariable);
+        const char* settings = secure_getenv(logEnvironmentVariable); // it can show private arguments
         return *new SystemLog(program_invocation_short_name, settings ? settings : "", STDERR_FILENO);
     }();
     return log;

@@ -214,14 +214,18 @@ std::string StreamListener::bind(const std::string& directory, const std::string
     return {};
 }
 
-void StreamListener::close() {
-    if (_socket && !_fileName.empty()) {
-        struct stat status{};
-        if (::fstatat(_directory.get(), _fileName.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 &&
-            status.st_dev == _device && status.st_ino == _inode) {
-            ::unlinkat(_directory.get(), _fileName.c_str(), 0);
-        }
+/// While the lock is held nobody else can have made a file of this name; what somebody put there by hand stays.
+void StreamListener::removeName() const {
+    if (_fileName.empty()) return;
+    struct stat status{};
+    if (::fstatat(_directory.get(), _fileName.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 &&
+        status.st_dev == _device && status.st_ino == _inode) {
+        ::unlinkat(_directory.get(), _fileName.c_str(), 0);
     }
+}
+
+void StreamListener::close() {
+    if (_socket) removeName();
     _socket.reset();
     _spare.reset();
     // Last, so that whoever takes the name next finds the old socket gone. The lock's file stays: removing it could
@@ -264,6 +268,7 @@ void StreamListener::cancel() {
         handler.swap(_handler);
         if (!_resumed) return close();
     }
+    removeName(); // at once: the process may end before the loop gets to it
     _loop->post([listener = shared_from_this()] {
         if (listener->_socket) listener->_loop->unwatch(listener->_socket.get());
         listener->close();

@@ -42,6 +42,7 @@ private:
     void shed();
     void rest();
     void deliver(Event event);
+    void removeName() const;
     void close();
 
     const std::shared_ptr<Loop> _loop;

@@ -44,9 +44,9 @@ std::string textOf(std::optional<std::string_view> text) { return std::string(te
 
 /// The bundle was opened by the daemon's broker: no permission of this process is asked for again.
 bool showFile(linux_::Sandbox& sandbox, const std::string& token, const std::string& name) {
-    zembra::ZBSandboxExtension extension(sandbox, token);
-    extension.consume();
-    const int bundle = extension.handle() < 0 ? -1 : sandbox.descriptor(extension.handle());
+    const auto extension = zembra::ZBSandboxExtension::initWithExtension(sandbox, token);
+    extension->consume();
+    const int bundle = extension->handle() < 0 ? -1 : sandbox.descriptor(extension->handle());
     const Descriptor file(bundle < 0 ? -1 : openat(bundle, name.c_str(), O_RDONLY | O_CLOEXEC));
     if (file.get() < 0) {
         std::cerr << "Host: cannot read " << name << " through the token\n";

@@ -41,6 +41,7 @@ TEST(Bundle, SupportPathIsKeptOnceKnown) {
     EXPECT_EQ(bundle->plugInsPath(), "/App.app/PlugIns");
     content.hasSupportPath = false;
     EXPECT_EQ(bundle->bundleDirectory("Resources"), "/App.app/Resources");
+    EXPECT_EQ(bundle->bundleDirectory(""), "/App.app");
 }
 
 TEST(Bundle, InfoDictionaryIsLoggedWhenThereIsNone) {

@@ -58,6 +58,13 @@ TEST_F(InterfaceUtilitiesTest, CompoundIsMadeOnceForTheSameNames) {
     EXPECT_EQ(error, std::nullopt);
 }
 
+TEST_F(InterfaceUtilitiesTest, CompoundMadeTwiceAtOnceIsTheSameForAll) {
+    interfaces.overtaken.insert("__XX_COMPOUND__A");
+    const auto compound = compoundInterface(interfaces, Array{"A"}, nullptr);
+    ASSERT_TRUE(compound);
+    EXPECT_EQ(interfaces.find("__XX_COMPOUND__A"), compound);
+}
+
 TEST_F(InterfaceUtilitiesTest, CompoundOfAMissingInterfaceIsNotRegistered) {
     Failure error;
     EXPECT_EQ(compoundInterface(interfaces, Array{"A", "Z"}, &error), nullptr);
@@ -85,6 +92,31 @@ TEST_F(InterfaceUtilitiesTest, SpecificationDescribesArguments) {
     EXPECT_EQ(nested->interface(), interfaces.find("B"));
     constexpr auto last = std::numeric_limits<std::int64_t>::max();
     EXPECT_EQ(description->classes("open", last, InterfaceSide::reply), std::set<std::string>{"ClassA"});
+}
+
+TEST_F(InterfaceUtilitiesTest, SpecificationReadsTheFrontOfTheIndex) {
+    const std::pair<const char*, std::int64_t> cases[] = {
+        {"7", 7},
+        {"-7", -7},
+        {"+7", 7},
+        {" \t\n\v\f\r+7x", 7},
+        {"", 0},
+        {" ", 0},
+        {"x7", 0},
+        {"+", 0},
+        {"++7", 0},
+        {"+-7", 0},
+        {"-+7", 0},
+        {"+ 7", 0},
+        {" -99999999999999999999", std::numeric_limits<std::int64_t>::min()},
+    };
+    for (const auto& [text, index] : cases) {
+        const std::string operation = text; // each its own
+        EXPECT_EQ(interfaceClassSpecification(interfaces, *description, operation,
+                                              "reply:" + std::string(text) + ":{ClassA}"),
+                  std::nullopt);
+        EXPECT_FALSE(description->classes(operation, index, InterfaceSide::reply).empty()) << '"' << text << '"';
+    }
 }
 
 TEST_F(InterfaceUtilitiesTest, SpecificationQuotesWhatIsMalformed) {

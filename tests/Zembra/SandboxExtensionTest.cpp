@@ -4,6 +4,7 @@
 
 #include <cerrno>
 #include <gtest/gtest.h>
+#include <string>
 #include <vector>
 
 namespace {
@@ -21,6 +22,12 @@ protected:
         processLog.clear();
     }
 
+    /// The messages, all of which have to be of the debug level.
+    static std::vector<std::string> debugMessages() {
+        for (const auto& line : processLog.lines()) EXPECT_EQ(line.level, LogLevel::debug) << line.message;
+        return processLog.messages("sandbox");
+    }
+
     support::FakeSandbox sandbox;
     std::string token;
 };
@@ -33,7 +40,7 @@ TEST_F(SandboxExtensionTest, IssueAsksForTheRightClass) {
     EXPECT_EQ(*file, "file:com.nordane.app-sandbox.read:/Real.appex");
     const auto service = zembra::issueServiceLookupToken(sandbox, "org.example.share");
     EXPECT_EQ(*service, "service:com.nordane.zembra.plugin-service:org.example.share");
-    EXPECT_EQ(processLog.messages("sandbox"),
+    EXPECT_EQ(debugMessages(),
               (std::vector<std::string>{"issued file extension for /Link.appex -> " + *file,
                                         "issued mach extension for org.example.share -> " + *service}));
 
@@ -46,51 +53,50 @@ TEST_F(SandboxExtensionTest, IssueAsksForTheRightClass) {
 }
 
 TEST_F(SandboxExtensionTest, ConsumesOnceAndExpelsOnce) {
-    ZBSandboxExtension extension(sandbox, token);
-    EXPECT_EQ(extension.handle(), -1);
-    extension.consume();
-    extension.consume();
-    const auto handle = std::to_string(extension.handle());
+    const auto extension = ZBSandboxExtension::initWithExtension(sandbox, token);
+    EXPECT_EQ(extension->handle(), -1);
+    extension->consume();
+    extension->consume();
+    const auto handle = std::to_string(extension->handle());
     EXPECT_NE(handle, "-1");
-    extension.expel();
-    extension.expel();
-    EXPECT_EQ(extension.handle(), -1);
+    extension->expel();
+    extension->expel();
+    EXPECT_EQ(extension->handle(), -1);
     EXPECT_EQ(sandbox.consumed, 1);
     EXPECT_EQ(sandbox.released, 1);
-    EXPECT_EQ(
-        processLog.messages("sandbox"),
-        (std::vector<std::string>{"consuming extension " + token + " -> " + handle, "releasing extension " + handle}));
+    EXPECT_EQ(debugMessages(), (std::vector<std::string>{"consuming extension " + token + " -> " + handle,
+                                                         "releasing extension " + handle}));
 }
 
 TEST_F(SandboxExtensionTest, AFailedConsumeMayBeTriedAgain) {
-    ZBSandboxExtension extension(sandbox, token);
+    const auto extension = ZBSandboxExtension::initWithExtension(sandbox, token);
     sandbox.consumeError = EPERM;
-    extension.consume();
-    EXPECT_EQ(extension.handle(), -1);
+    extension->consume();
+    EXPECT_EQ(extension->handle(), -1);
     EXPECT_TRUE(
         processLog.contains(LogLevel::standard, "sandbox", "failed to consume extension " + token + " - errno=1"));
     sandbox.consumeError = 0;
-    extension.consume();
-    EXPECT_NE(extension.handle(), -1);
+    extension->consume();
+    EXPECT_NE(extension->handle(), -1);
 }
 
 TEST_F(SandboxExtensionTest, AFailedExpelCountsAsDone) {
-    ZBSandboxExtension extension(sandbox, token);
-    extension.consume();
-    const auto handle = std::to_string(extension.handle());
+    const auto extension = ZBSandboxExtension::initWithExtension(sandbox, token);
+    extension->consume();
+    const auto handle = std::to_string(extension->handle());
     sandbox.releaseError = EINVAL;
-    extension.expel();
-    EXPECT_EQ(extension.handle(), -1);
+    extension->expel();
+    EXPECT_EQ(extension->handle(), -1);
     EXPECT_TRUE(
         processLog.contains(LogLevel::standard, "sandbox", "failed to release extension " + handle + " - errno=22"));
 }
 
 TEST_F(SandboxExtensionTest, DestructionExpels) {
     {
-        ZBSandboxExtension extension(sandbox, token);
-        extension.consume();
-        EXPECT_EQ(extension, ZBSandboxExtension(sandbox, token)); // whatever their handles
-        EXPECT_NE(extension, ZBSandboxExtension(sandbox, "another"));
+        const auto extension = ZBSandboxExtension::initWithExtension(sandbox, token);
+        extension->consume();
+        EXPECT_EQ(*extension, *ZBSandboxExtension::initWithExtension(sandbox, token)); // whatever their handles
+        EXPECT_NE(*extension, *ZBSandboxExtension::initWithExtension(sandbox, "another"));
         EXPECT_EQ(sandbox.released, 0);
     }
     EXPECT_EQ(sandbox.released, 1);

@@ -4,6 +4,7 @@ import json
 import os
 import re
 import shutil
+import subprocess
 import tempfile
 import unittest
 
@@ -43,7 +44,7 @@ class Find(WithDaemon):
         self.assertEqual(form["info"]["VKExtensionAttributes"]["Languages"], ["en", "de"])
         for location in (["--url", "file://" + path], ["--uuid", form["uuid"]], ["--uuid", form["uuid"].lower()]):
             self.assertEqual(self.find(*location)["uuid"], form["uuid"], location)
-        relative = self.platform.zbctl("--json", "find", os.path.basename(path), cwd=os.path.dirname(path))
+        relative = self.platform.zbctl("--json", "find", "--", os.path.basename(path), cwd=os.path.dirname(path))
         self.assertEqual(json.loads(relative.stdout)["uuid"], form["uuid"])
 
     def test_for_people_names_the_plug_in_first(self):
@@ -51,6 +52,14 @@ class Find(WithDaemon):
         self.assertEqual(lines[0], "Word Count 2.1")
         self.assertIn("  info:", lines)
         self.assertTrue(any(re.fullmatch(r"  uuid +[0-9A-F-]{36}", line) for line in lines), lines)
+
+    def test_lost_output_is_a_failure(self):
+        for arguments in (["--json", "bulk"], ["find", self.platform.path(WORD_COUNT)], ["--help"]):
+            with open("/dev/full", "wb") as full:
+                result = subprocess.run([os.path.join(scratch.BUILD, "bin", "zbctl"), *arguments], stdout=full,
+                                        stderr=subprocess.PIPE, text=True, env=self.platform.client_environment,
+                                        timeout=scratch.DEADLINE, check=False)
+            self.assertEqual((result.returncode, result.stderr), (1, "zbctl: the output cannot be written\n"), arguments)
 
     def test_of_nothing_is_an_error_reply(self):
         for location in (["/"], ["--uuid", "00000000-0000-4000-8000-000000000000"], ["--url", "https://example.org/"]):
@@ -121,13 +130,24 @@ class Raw(WithDaemon):
             self.assertEqual(result.stderr, f"zbctl: error {code}: {text}\n")
             self.assertEqual(json.loads(result.stdout), {"errorcode": code, "error": text})
 
+    def test_takes_the_nesting_that_messages_may_have(self):
+        for depth, status in ((64, 0), (65, 2), (100_000, 2)):
+            rest = depth - 1  # the request is the first
+            self.raw(status, '{"request": "bulk", "version": 3, "x": ' + "[" * rest + "]" * rest + "}")
+
+    def test_refuses_a_key_that_stands_twice(self):
+        for content, key in (('{"request": "bulk", "request": "find", "version": 3}', "request"),
+                             ('{"request": "bulk", "version": 3, "x": [{"y": {}, "\\u0079": 1}]}', "y")):
+            self.assertEqual(self.raw(2, content).stderr, f'zbctl: -: the key "{key}" stands twice\n')
+        self.raw(0, '{"request": "bulk", "version": 3, "x": {"x": {"x": 1}, "y": {"x": 1}}}')
+
     def test_refuses_what_is_no_request(self):
         deep = '{"a":' * 100 + "1" + "}" * 100
         for content in ("", "{", "[]", '{"a": null}', '{"a": "\\u0000"}', '{"a": {"$uuid": "x"}}',
                         '{"a": {"$data": "<>"}}', '{"a": {"$date": "yesterday"}}', deep,
                         "<vlist><string>x</string></vlist>", "<vlist><dict>"):
             self.assertNotEqual(self.raw(2, content).stderr, "", content)
-        self.expect(2, "raw", "/nowhere")
+        self.assertEqual(self.expect(2, "raw", "/nowhere").stderr, "zbctl: /nowhere: No such file or directory\n")
 
 
 class WithoutDaemon(unittest.TestCase):
@@ -153,11 +173,18 @@ class WithoutDaemon(unittest.TestCase):
         shutil.copy(os.path.join(scratch.BUILD, "bin", "zbctl"), program)
         for arguments in ([], ["frobnicate"], ["--frobnicate", "bulk"], ["add"], ["find"], ["find", "--uuid", "x"],
                           ["find", "/", "--url", "file:///"], ["find", "--url", "a b"], ["bulk", "--flags", "many"],
+                          ["bulk", "--flags", "-1"], ["bulk", "--flags", "18446744073709551616"], ["bulk", "--flags", "0x"],
+                          ["watch", "--count", "-1"], ["watch", "a/b"], ["watch", ""],
                           ["bulk", "extra"], ["add", ""], ["add", b"/\xff"], ["sign", program],
-                          ["sign", program, "--show", "--remove"]):
+                          ["sign", program, "--show", "--remove"], ["sign", program, "--show", "-e", "a"],
+                          ["sign", program, "-e", "=a"], ["sign", program, "-e", b"a=\xff"]):
             result = self.platform.zbctl(*arguments)
             self.assertEqual((result.returncode, result.stdout), (2, ""), arguments)
             self.assertNotEqual(result.stderr, "", arguments)
+
+        for arguments, complaint in ((["find", ""], "a path in UTF-8"), (["find", "--uuid", ""], "a UUID"),
+                                     (["find", "--url", ""], "a URL")):
+            self.assertEqual(self.platform.zbctl(*arguments).stderr, f'zbctl: "" is not {complaint}\n')
 
     def test_help_and_version_are_no_errors(self):
         self.assertRegex(self.platform.zbctl("--version").stdout, r"^zbctl \d")
@@ -180,7 +207,8 @@ class WithoutDaemon(unittest.TestCase):
         self.assertEqual(json.loads(self.platform.zbctl("--json", "sign", program, "--show").stdout), {})
         self.assertEqual(self.status("sign", program, "--remove"), 0)
         self.assertEqual(self.status("sign", "/nowhere", "-e", "a"), 1)
-        self.assertEqual(self.status("sign", program, "--entitlements", "/nowhere"), 1)
+        for missing in ("/nowhere", ""):
+            self.assertEqual(self.status("sign", program, "--entitlements", missing), 1)
         os.chmod(program, 0o777)  # whoever may write to it could put another program there
         self.assertEqual(self.status("sign", program, "-e", "a"), 1)
 

@@ -111,4 +111,23 @@ TEST_F(ScannedPlugIn, TakesNoProgramFromElsewhere) {
     }
 }
 
+TEST_F(ScannedPlugIn, IsUnusableWhenItsManifestNestsTooDeep) {
+    // The manifest itself is one container, and its values are the others.
+    const auto scanned = [&](std::size_t nesting) {
+        Value value = "core";
+        for (std::size_t i = 1; i < nesting; ++i) value = Array{value};
+        support::writeManifest(bundle, support::plugInInfo("a", {}, {{"deep", value}}));
+        return scan(nullptr);
+    };
+    const auto deepest = scanned(maximumManifestNesting);
+    ASSERT_EQ(deepest.state, State::read);
+    const StoredDictionary stored(deepest.facts->info->encoded(), keys);
+    EXPECT_EQ(stored.dictionary(), deepest.facts->info->dictionary()) << "also read back";
+
+    const auto tooDeep = scanned(maximumManifestNesting + 1);
+    EXPECT_EQ(tooDeep.state, State::unusable);
+    EXPECT_EQ(tooDeep.reason.find("Info.vlist: "), 0U) << tooDeep.reason;
+    EXPECT_NE(tooDeep.reason.find("nested too deep"), std::string::npos) << tooDeep.reason;
+}
+
 } // namespace

@@ -118,11 +118,14 @@ TEST(BundlesManifest, UnusableOnesAreNone) {
     const auto read = [&] {
         return world.bundles().fromPath(world.path("A.app"), BundleMode::directory)->infoDictionary();
     };
-    writeFile(manifest, *platform::encodeXML(Dictionary{{"key", "value"}}));
+    platform::Value deepest = "core";
+    for (std::size_t i = 0; i < platform::maximumManifestNesting; ++i) deepest = Dictionary{{"key", deepest}};
+    writeFile(manifest, *platform::encodeXML(deepest));
     EXPECT_TRUE(read());
 
     const std::string head = "<?xml version=\"1.0\"?>\n";
     for (const std::string& bytes : {std::string(), *platform::encodeXML(platform::Array{"no dictionary"}),
+                                     *platform::encodeXML(Dictionary{{"key", deepest}}),
                                      *platform::encodeXML(Dictionary{{"big", std::string(1U << 20U, 'x')}}),
                                      head + "<!DOCTYPE v [<!ENTITY a \"b\">]><vlist><dict/></vlist>"}) {
         writeFile(manifest, bytes);

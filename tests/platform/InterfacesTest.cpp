@@ -12,9 +12,9 @@ TEST(Interfaces, CreateIsRefusedOnceRegistered) {
     const auto second = interfaces.create("I");
     ASSERT_TRUE(first && second);
     EXPECT_FALSE(interfaces.find("I")) << "not before it is registered";
-    interfaces.registerInterface(first);
-    interfaces.registerInterface(second);
-    EXPECT_EQ(interfaces.find("I"), first) << "what others already use stays";
+    EXPECT_EQ(interfaces.registerInterface(first), first);
+    EXPECT_EQ(interfaces.registerInterface(second), first) << "what others already use stays";
+    EXPECT_EQ(interfaces.find("I"), first);
     EXPECT_FALSE(interfaces.create("I"));
 }
 

@@ -5,6 +5,7 @@
 #include <memory>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace support {
@@ -17,14 +18,14 @@ public:
     std::set<std::string> unfindable;
     /// Names that cannot be created, as if another thread had been faster.
     std::set<std::string> taken;
+    /// Names under which another thread registers an interface just before the caller does.
+    std::set<std::string> overtaken;
     /// Every name looked up.
     std::vector<std::string> looked;
 
     /// Registers a new interface and returns it.
     std::shared_ptr<platform::Interface> add(const std::string& name) {
-        auto interface = platform::linux_::Interfaces::create(name);
-        registerInterface(interface);
-        return interface;
+        return platform::linux_::Interfaces::registerInterface(platform::linux_::Interfaces::create(name));
     }
 
     std::shared_ptr<platform::Interface> find(const std::string& name) override {
@@ -33,6 +34,10 @@ public:
     }
     std::shared_ptr<platform::Interface> create(const std::string& name) override {
         return taken.contains(name) ? nullptr : platform::linux_::Interfaces::create(name);
+    }
+    std::shared_ptr<platform::Interface> registerInterface(std::shared_ptr<platform::Interface> interface) override {
+        if (overtaken.contains(interface->name())) add(interface->name());
+        return platform::linux_::Interfaces::registerInterface(std::move(interface));
     }
 };
 

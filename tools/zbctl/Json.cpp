@@ -3,12 +3,12 @@
 #include "platform/linux/Utf8.h"
 
 #include <optional>
+#include <set>
 #include <vector>
 
 namespace zbctl {
 
 using platform::Array;
-using platform::Dictionary;
 using platform::Error;
 using platform::Kind;
 using platform::Result;
@@ -43,7 +43,7 @@ std::optional<Value> valueOfMarker(std::string_view marker, std::string_view tex
 bool isMarker(std::string_view key) { return key == uuidMarker || key == dataMarker || key == dateMarker; }
 
 Result<Value> fromJson(const Json& json, std::size_t depth) {
-    if (depth > platform::maximumNesting) return wrongInput("nested too deeply");
+    if (json.is_structured() && depth >= platform::maximumNesting) return wrongInput("nested too deeply");
     switch (json.type()) {
     case Json::value_t::boolean: return Value(json.get<bool>());
     case Json::value_t::number_integer: return Value(json.get<std::int64_t>());
@@ -64,16 +64,14 @@ Result<Value> fromJson(const Json& json, std::size_t depth) {
         return Value(Array(std::move(values)));
     }
     case Json::value_t::object: {
-        std::vector<Dictionary::Entry> entries;
+        platform::MutableDictionary dictionary;
         for (const auto& [name, element] : json.items()) {
             if (platform::linux_::firstBadByte(name)) return wrongInput("a key holds NUL");
             auto value = fromJson(element, depth + 1);
             if (!value) return value.error();
-            entries.push_back({Value(name), *std::move(value)});
+            dictionary.set(name, *std::move(value));
         }
-        auto dictionary = Dictionary::fromUniqueEntries(std::move(entries));
-        if (!dictionary) return wrongInput("a key stands twice");
-        return Value(*dictionary);
+        return Value(dictionary);
     }
     default: return wrongInput("null has no counterpart in a property list");
     }
@@ -113,6 +111,27 @@ Json toJson(const Value& value) {
     }
     }
     return nullptr;
+}
+
+Result<Json> parseJson(std::string_view text) {
+    // The parser lets a later entry take the place of an earlier one with the same key, without a word.
+    std::vector<std::set<std::string>> keysOfOpenObjects;
+    std::optional<std::string> repeated;
+    const auto watchKeys = [&](int, Json::parse_event_t event, const Json& parsed) {
+        if (event == Json::parse_event_t::object_start) {
+            keysOfOpenObjects.emplace_back();
+        } else if (event == Json::parse_event_t::object_end) {
+            keysOfOpenObjects.pop_back();
+        } else if (event == Json::parse_event_t::key) {
+            const auto& key = parsed.get_ref<const std::string&>();
+            if (!keysOfOpenObjects.back().insert(key).second) repeated = key;
+        }
+        return true;
+    };
+    Json json = Json::parse(text, watchKeys, false);
+    if (json.is_discarded()) return wrongInput("no valid JSON");
+    if (repeated) return wrongInput("the key \"" + *repeated + "\" stands twice");
+    return json;
 }
 
 Result<Value> fromJson(const Json& json) { return fromJson(json, 0); }

@@ -17,6 +17,9 @@ using Json = nlohmann::ordered_json;
 /// become null.
 Json toJson(const platform::Value& value);
 
+/// An error when the text is no JSON, or an object of it has a key twice: which of the entries counts would be a guess.
+platform::Result<Json> parseJson(std::string_view text);
+
 /// JSON's kinds as they are; null has no counterpart and is refused, as is what the encodings refuse (NUL in texts,
 /// too deep nesting).
 platform::Result<platform::Value> fromJson(const Json& json);

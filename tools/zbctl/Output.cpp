@@ -114,6 +114,8 @@ std::string printable(std::string_view text) {
     return result;
 }
 
+void printJson(std::ostream& out, const Value& value) { out << toJson(value).dump(indentation) << '\n'; }
+
 void printTree(std::ostream& out, const Value& value) { print(out, value, 0); }
 
 void printForm(std::ostream& out, const Dictionary& form) {
@@ -123,6 +125,12 @@ void printForm(std::ostream& out, const Dictionary& form) {
     if (const auto version = form.string(zembra::formKey::version)) out << ' ' << printable(*version);
     out << '\n';
     print(out, form, indentation);
+}
+
+bool flushOutput() {
+    std::cout.flush();
+    if (!std::cout) complain("the output cannot be written");
+    return static_cast<bool>(std::cout);
 }
 
 void complain(std::string_view text) { std::cerr << "zbctl: " << printable(text) << '\n'; }

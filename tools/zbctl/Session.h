@@ -15,7 +15,7 @@ namespace zbctl {
 /// What scripts rely on.
 enum class ExitStatus {
     success = 0,
-    failure = 1, // an error reply; for "sign", a program that cannot be signed
+    failure = 1, // an error reply; for "sign", a program that cannot be signed; for all, output that was lost
     usage = 2,
     noDaemon = 3, // not reached, or gone before it answered
 };

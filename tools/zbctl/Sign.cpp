@@ -1,6 +1,6 @@
 #include "platform/linux/Entitlements.h"
 #include "platform/linux/Files.h"
-#include "tools/zbctl/Json.h"
+#include "platform/linux/Utf8.h"
 #include "tools/zbctl/Output.h"
 #include "tools/zbctl/Verbs.h"
 
@@ -22,6 +22,11 @@ ExitStatus finish(const std::string& file, const Failure& failure) {
     return ExitStatus::failure;
 }
 
+/// An entitlement without a name, or one that would be written as another text than was given, helps nobody.
+bool isSetting(const std::string& setting) {
+    return !setting.empty() && setting.front() != '=' && !platform::linux_::firstBadByte(setting);
+}
+
 /// "KEY" sets true, "KEY=true" and "KEY=false" booleans, "KEY=TEXT" a string.
 void apply(const std::string& setting, MutableDictionary& entitlements) {
     const std::size_t separator = setting.find('=');
@@ -32,15 +37,15 @@ void apply(const std::string& setting, MutableDictionary& entitlements) {
 
 Result<MutableDictionary> entitlementsOf(const Signing& signing) {
     MutableDictionary entitlements;
-    if (!signing.entitlements.empty()) {
+    if (signing.entitlements) {
         platform::linux_::Files files(platform::linux_::Root::ofProcess());
-        const auto bytes = files.read(signing.entitlements, platform::linux_::maximumEntitlementsSize);
+        const auto bytes = files.read(*signing.entitlements, platform::linux_::maximumEntitlementsSize);
         if (!bytes) return bytes.error();
         const auto value = platform::decodePropertyList(*bytes);
         if (!value) return value.error();
         const auto dictionary = value->dictionary();
         if (!dictionary)
-            return platform::Error{platform::propertyListErrorDomain, 0, signing.entitlements + ": not a dictionary"};
+            return platform::Error{platform::propertyListErrorDomain, 0, *signing.entitlements + ": not a dictionary"};
         entitlements.merge(*dictionary);
     }
     for (const auto& setting : signing.settings) apply(setting, entitlements);
@@ -52,7 +57,7 @@ ExitStatus show(const Common& common, const std::string& file) {
     if (!entitlements) return finish(file, entitlements.error());
     const Dictionary shown = entitlements->value_or(Dictionary());
     if (common.json)
-        std::cout << toJson(shown).dump(2) << '\n';
+        printJson(std::cout, shown);
     else
         printTree(std::cout, shown);
     return ExitStatus::success;
@@ -63,6 +68,11 @@ ExitStatus show(const Common& common, const std::string& file) {
 ExitStatus sign(const Common& common, const Signing& signing) {
     if (signing.show) return show(common, signing.file);
     if (signing.remove) return finish(signing.file, platform::linux_::removeEntitlements(signing.file));
+    for (const auto& setting : signing.settings) {
+        if (isSetting(setting)) continue;
+        complain('"' + setting + "\" is not KEY or KEY=VALUE in UTF-8");
+        return ExitStatus::usage;
+    }
     const auto entitlements = entitlementsOf(signing);
     if (!entitlements) return finish(signing.file, entitlements.error());
     return finish(signing.file, platform::linux_::writeEntitlements(signing.file, *entitlements));

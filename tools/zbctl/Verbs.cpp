@@ -35,15 +35,10 @@ std::optional<std::string> absolutePath(const std::string& path) {
     return absolute.string();
 }
 
-void printJson(const Value& value) {
-    // What is no UTF-8 by accident of the file system must not stop the output.
-    std::cout << toJson(value).dump(2, ' ', false, Json::error_handler_t::replace) << '\n';
-}
-
 /// For requests whose success has no content.
 ExitStatus finish(const Common& common, const ReplyOrError& answer) {
     const ExitStatus status = report(answer);
-    if (status == ExitStatus::success && common.json) printJson(std::get<Dictionary>(answer));
+    if (status == ExitStatus::success && common.json) printJson(std::cout, std::get<Dictionary>(answer));
     return status;
 }
 
@@ -57,10 +52,9 @@ Result<std::string> contentOf(const std::string& file) {
 Result<Value> valueOf(const std::string& content) {
     const std::size_t start = content.find_first_not_of(" \t\r\n");
     if (start == std::string::npos || content[start] != '{') return platform::decodePropertyList(content);
-    const Json json = Json::parse(content, nullptr, false);
-    if (json.is_discarded())
-        return platform::Error{platform::propertyListErrorDomain, 0, "begins with a brace and is no JSON"};
-    return fromJson(json);
+    const auto json = parseJson(content);
+    if (!json) return json.error();
+    return fromJson(*json);
 }
 
 } // namespace
@@ -90,17 +84,16 @@ ExitStatus bulk(const Common& common, std::uint64_t flags) {
 ExitStatus find(const Common& common, const Location& location) {
     std::optional<platform::UUID> uuid;
     std::optional<platform::URL> url;
-    if (!location.uuid.empty()) {
-        uuid = platform::UUID::parse(location.uuid);
-    } else if (!location.url.empty()) {
-        url = platform::URL::parse(location.url);
-    } else if (const auto path = absolutePath(location.path)) {
+    if (location.uuid) {
+        uuid = platform::UUID::parse(*location.uuid);
+        if (!uuid) complain('"' + *location.uuid + "\" is not a UUID");
+    } else if (location.url) {
+        url = platform::URL::parse(*location.url);
+        if (!url) complain('"' + *location.url + "\" is not a URL");
+    } else if (const auto path = absolutePath(location.path.value_or(""))) {
         url = platform::URL::file(*path);
     }
-    if (!uuid && !url) {
-        if (location.path.empty()) complain("\"" + location.uuid + location.url + "\" is not a UUID or URL");
-        return ExitStatus::usage;
-    }
+    if (!uuid && !url) return ExitStatus::usage;
     Session session(common.service);
     const auto answer = session.ask([&](ZBDaemonClient& client, ZBDaemonClient::Callback callback) {
         if (uuid)
@@ -113,11 +106,11 @@ ExitStatus find(const Common& common, const Location& location) {
     const Value matches = std::get<Dictionary>(answer)[zembra::key::matches];
     const auto form = session.client().convertFromQMX(matches).dictionary();
     if (!form) {
-        complain("the reply describes no plug-in"); // it vanished between look-up and reply
+        complain("the reply describes no plug-in"); // "matches" is absent or not decodable
         return ExitStatus::failure;
     }
     if (common.json)
-        printJson(*form);
+        printJson(std::cout, *form);
     else
         printForm(std::cout, *form);
     return ExitStatus::success;
@@ -126,7 +119,7 @@ ExitStatus find(const Common& common, const Location& location) {
 ExitStatus raw(const Common& common, const std::string& file) {
     const auto content = contentOf(file);
     if (!content) {
-        complain(file + ": " + content.error().text());
+        complain(content.error().text());
         return ExitStatus::usage;
     }
     auto value = valueOf(*content);
@@ -151,7 +144,7 @@ ExitStatus raw(const Common& common, const std::string& file) {
     if (const Value matches = session.client().convertFromQMX(reply[zembra::key::matches]))
         reply.set(zembra::key::matches, matches);
     if (common.json)
-        printJson(reply);
+        printJson(std::cout, reply);
     else
         printTree(std::cout, reply);
     return status;

@@ -23,9 +23,9 @@ ExitStatus bulk(const Common& common, std::uint64_t flags);
 
 /// One of them is given.
 struct Location {
-    std::string uuid;
-    std::string url;
-    std::string path;
+    std::optional<std::string> uuid;
+    std::optional<std::string> url;
+    std::optional<std::string> path;
 };
 ExitStatus find(const Common& common, const Location& location);
 
@@ -35,14 +35,14 @@ ExitStatus raw(const Common& common, const std::string& file);
 
 struct Signing {
     std::string file;
-    std::string entitlements;          // a property-list file
-    std::vector<std::string> settings; // KEY or KEY=VALUE
+    std::optional<std::string> entitlements; // a property-list file
+    std::vector<std::string> settings;       // KEY or KEY=VALUE
     bool show = false;
     bool remove = false;
 };
 ExitStatus sign(const Common& common, const Signing& signing);
 
-/// A line per notification. Ends after `count` of them; never when it is 0.
-ExitStatus watch(const std::string& name, std::uint64_t count);
+/// A line per notification. Ends after `count` of them, or never.
+ExitStatus watch(const std::string& name, std::optional<std::uint64_t> count);
 
 } // namespace zbctl

@@ -1,4 +1,5 @@
 #include "platform/linux/Notifications.h"
+#include "platform/linux/UserDirectory.h"
 #include "tools/zbctl/Output.h"
 #include "tools/zbctl/Verbs.h"
 
@@ -20,7 +21,11 @@ struct Arrivals {
 
 } // namespace
 
-ExitStatus watch(const std::string& name, std::uint64_t count) {
+ExitStatus watch(const std::string& name, std::optional<std::uint64_t> count) {
+    if (platform::linux_::pathComponentError(name) != 0) {
+        complain('"' + name + "\" is not the name of a notification");
+        return ExitStatus::usage;
+    }
     platform::linux_::WorkQueues queues;
     platform::linux_::Notifications notifications(platform::linux_::Root::ofProcess());
     const auto arrivals = std::make_shared<Arrivals>();
@@ -34,7 +39,7 @@ ExitStatus watch(const std::string& name, std::uint64_t count) {
     std::cerr << "watching " << printable(name) << std::endl;
 
     std::unique_lock lock(arrivals->mutex);
-    for (std::uint64_t seen = 0; count == 0 || seen < count;) {
+    for (std::uint64_t seen = 0; !count || seen < *count;) {
         arrivals->changed.wait(lock, [&] { return arrivals->count > seen; });
         ++seen;
         std::cout << printable(name) << std::endl;

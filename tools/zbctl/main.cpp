@@ -1,18 +1,23 @@
 #include "Zembra/ZBProtocol.h"
 #include "platform/linux/SystemLog.h"
+#include "tools/zbctl/Options.h"
+#include "tools/zbctl/Output.h"
 #include "tools/zbctl/Verbs.h"
 
-#include <CLI/App.hpp>
 #include <CLI/Config.hpp>
 #include <CLI/Formatter.hpp>
 #include <csignal>
 #include <cstdlib>
+#include <optional>
+#include <string>
 
 #ifndef ZBD_VERSION
 #define ZBD_VERSION "unknown"
 #endif
 
 int main(int argc, char** argv) {
+    using zbctl::addNumber;
+    using zbctl::addText;
     using zbctl::ExitStatus;
     // The client's own log lines would only stand between a person and the answer.
     if (std::getenv(platform::linux_::logEnvironmentVariable) != nullptr)
@@ -23,11 +28,11 @@ int main(int argc, char** argv) {
     app.set_version_flag("--version", "zbctl " ZBD_VERSION);
     app.require_subcommand(1);
     app.fallthrough();
-    app.footer("Exit status: 0 success, 1 an error reply, 2 wrong usage, 3 no daemon.");
+    app.footer("Exit status: 0 success, 1 an error reply or lost output, 2 wrong usage, 3 no daemon.");
 
     zbctl::Common common;
     ExitStatus status = ExitStatus::success;
-    app.add_option("--service", common.service, "Name of the daemon's service")->type_name("NAME");
+    addText(&app, "--service", common.service, "Name of the daemon's service")->type_name("NAME");
     app.add_flag("--json", common.json, "Print JSON");
 
     std::vector<std::string> paths;
@@ -40,16 +45,15 @@ int main(int argc, char** argv) {
 
     std::uint64_t flags = 0;
     auto* bulk = app.add_subcommand("bulk", "Send the bulk request, which changes nothing");
-    bulk->add_option("--flags", flags, "Options, a number");
+    addNumber(bulk, "--flags", [&](std::uint64_t number) { flags = number; }, "Options, decimal or 0x...");
     bulk->callback([&] { status = zbctl::bulk(common, flags); });
 
     zbctl::Location location;
     auto* find = app.add_subcommand("find", "Show one plug-in");
-    auto* where = find->add_option_group("where");
-    where->add_option("--uuid", location.uuid, "The plug-in's UUID");
-    where->add_option("--url", location.url, "A file URL of its bundle");
-    where->add_option("PATH", location.path, "The path of its bundle");
-    where->require_option(1);
+    addText(find, "--uuid", location.uuid, "The plug-in's UUID")->type_name("UUID");
+    addText(find, "--url", location.url, "A file URL of its bundle")->type_name("URL");
+    addText(find, "PATH", location.path, "The path of its bundle");
+    find->require_option(1);
     find->callback([&] { status = zbctl::find(common, location); });
 
     std::string requestFile;
@@ -63,26 +67,27 @@ int main(int argc, char** argv) {
     auto* sign = app.add_subcommand("sign", "Write the entitlements of a program");
     sign->add_option("FILE", signing.file, "The program, or a bundle's executable")->required();
     auto* what = sign->add_option_group("what");
-    what->add_option("--entitlements", signing.entitlements, "A property list with all of them");
-    what->add_option("-e", signing.settings, "One entitlement: KEY, KEY=true, KEY=false or KEY=TEXT")
-        ->type_name("KEY[=VALUE]")
-        ->allow_extra_args(false);
-    auto* show = what->add_flag("--show", signing.show, "Print them");
-    what->add_flag("--remove", signing.remove, "Remove them all")->excludes(show);
+    auto* file = addText(what, "--entitlements", signing.entitlements, "A property list with all of them");
+    auto* setting = what->add_option("-e", signing.settings, "One entitlement: KEY, KEY=true, KEY=false or KEY=TEXT")
+                        ->type_name("KEY[=VALUE]")
+                        ->allow_extra_args(false);
+    auto* show = what->add_flag("--show", signing.show, "Print them")->excludes(file)->excludes(setting);
+    what->add_flag("--remove", signing.remove, "Remove them all")->excludes(file)->excludes(setting)->excludes(show);
     what->require_option(1, 0);
     sign->callback([&] { status = zbctl::sign(common, signing); });
 
     std::string notification = zembra::annotationChangeNotification;
-    std::uint64_t count = 0;
+    std::optional<std::uint64_t> count;
     auto* watch = app.add_subcommand("watch", "Print a line for each notification");
     watch->add_option("NAME", notification, "The notification")->capture_default_str();
-    watch->add_option("--count", count, "End after so many");
+    addNumber(watch, "--count", [&](std::uint64_t number) { count = number; }, "End after so many");
     watch->callback([&] { status = zbctl::watch(notification, count); });
 
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? 0 : static_cast<int>(ExitStatus::usage);
+        status = app.exit(error) == 0 ? ExitStatus::success : ExitStatus::usage;
     }
+    if (!zbctl::flushOutput() && status == ExitStatus::success) status = ExitStatus::failure;
     return static_cast<int>(status);
 }
