@@ -53,7 +53,8 @@ public:
     // Setting up. Each answers whether it succeeded; why it did not is logged. A record whose setup failed is to be
     // dropped.
 
-    /// An identifier that is no string counts as missing. `bundleInfo` may be absent. Without a UUID the record gets a random one. `info` is not used: subclasses may.
+    /// An identifier that is no string counts as missing. `bundleInfo` may be absent. Without a UUID the record gets a
+    /// random one. `info` is not used: subclasses may.
     virtual bool setupWithName(const platform::Value& identifier, const std::optional<platform::URL>& url,
                                const platform::Value& bundleInfo, const platform::Value& info,
                                const std::optional<platform::UUID>& uuid);

@@ -15,9 +15,7 @@ struct Error {
     std::optional<std::string> description = std::nullopt;
 
     /// The description, or the domain and the code when there is none.
-    std::string text() const {
-        return description ? *description : domain + " error " + std::to_string(code);
-    }
+    std::string text() const { return description ? *description : domain + " error " + std::to_string(code); }
 
     friend bool operator==(const Error&, const Error&) = default;
 };
@@ -26,10 +24,9 @@ struct Error {
 inline constexpr const char* posixErrorDomain = "Posix";
 
 /// A value, or the error that stands in its place. Asking for the one that is not there is a bug.
-template <class T>
-class [[nodiscard]] Result {
+template <class T> class [[nodiscard]] Result {
 public:
-    Result(T value) : _content(std::in_place_index<0>, std::move(value)) {}   // NOLINT(google-explicit-constructor)
+    Result(T value) : _content(std::in_place_index<0>, std::move(value)) {}     // NOLINT(google-explicit-constructor)
     Result(Error error) : _content(std::in_place_index<1>, std::move(error)) {} // NOLINT(google-explicit-constructor)
 
     explicit operator bool() const { return _content.index() == 0; }

@@ -53,22 +53,22 @@ struct Contents; // reaches into values for PropertyList.cpp
 class Value {
 public:
     Value() noexcept : _bits(0), _kind(Kind::none), _unsigned(false) {}
-    Value(bool value) noexcept;                     // NOLINT(google-explicit-constructor)
+    Value(bool value) noexcept; // NOLINT(google-explicit-constructor)
     template <std::signed_integral T>
     Value(T value) noexcept : Value(Signed{static_cast<std::int64_t>(value)}) {} // NOLINT(google-explicit-constructor)
     template <std::unsigned_integral T>
         requires(!std::same_as<T, bool>)
     Value(T value) noexcept : Value(Unsigned{static_cast<std::uint64_t>(value)}) {} // NOLINT
-    Value(double value) noexcept;                   // NOLINT(google-explicit-constructor)
-    Value(Date value) noexcept;                     // NOLINT(google-explicit-constructor)
+    Value(double value) noexcept; // NOLINT(google-explicit-constructor)
+    Value(Date value) noexcept;   // NOLINT(google-explicit-constructor)
     /// Bytes that are NUL or no well-formed UTF-8 (file names may hold such) become U+FFFD, so that every string that
     /// exists can travel.
-    Value(std::string_view value);                  // NOLINT(google-explicit-constructor)
+    Value(std::string_view value);                                      // NOLINT(google-explicit-constructor)
     Value(const std::string& value) : Value(std::string_view(value)) {} // NOLINT(google-explicit-constructor)
     Value(const char* value) : Value(std::string_view(value)) {}        // NOLINT(google-explicit-constructor)
-    Value(const UUID& value);                       // NOLINT(google-explicit-constructor)
-    Value(const Array& value);                      // NOLINT(google-explicit-constructor)
-    Value(const Dictionary& value);                 // NOLINT(google-explicit-constructor)
+    Value(const UUID& value);                                           // NOLINT(google-explicit-constructor)
+    Value(const Array& value);                                          // NOLINT(google-explicit-constructor)
+    Value(const Dictionary& value);                                     // NOLINT(google-explicit-constructor)
     static Value data(std::string_view bytes);
 
     // Inline: forms and replies are copies and ends of values for the most part.
@@ -130,8 +130,12 @@ public:
     std::string description() const;
 
 private:
-    struct Signed { std::int64_t value; };
-    struct Unsigned { std::uint64_t value; };
+    struct Signed {
+        std::int64_t value;
+    };
+    struct Unsigned {
+        std::uint64_t value;
+    };
     explicit Value(Signed value) noexcept;
     explicit Value(Unsigned value) noexcept;
     Value(Kind kind, detail::Node* node) noexcept;

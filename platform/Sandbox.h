@@ -17,9 +17,9 @@ class Sandbox {
 public:
     virtual ~Sandbox() = default;
 
-    /// A token for reading `path` (a file, or a directory and what is below it): for what lies there now. With `canonical` the path is resolved
-    /// first, and the token is for the result. `within`, when not empty, must hold the resolved path, or the service
-    /// refuses (EPERM). The error carries errno.
+    /// A token for reading `path` (a file, or a directory and what is below it): for what lies there now. With
+    /// `canonical` the path is resolved first, and the token is for the result. `within`, when not empty, must hold the
+    /// resolved path, or the service refuses (EPERM). The error carries errno.
     virtual Result<std::string> issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
                                           const std::string& within) = 0;
 

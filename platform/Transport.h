@@ -123,7 +123,8 @@ public:
     virtual ~Transport() = default;
     /// Never fails at once: a name that cannot be had is reported to the listener's handler as an error of kind
     /// `other`, after `resume`.
-    virtual std::shared_ptr<Listener> createListener(const std::string& serviceName, std::shared_ptr<WorkQueue> queue) = 0;
+    virtual std::shared_ptr<Listener> createListener(const std::string& serviceName,
+                                                     std::shared_ptr<WorkQueue> queue) = 0;
     /// Connects when first needed; failures come as connection-invalid events and as errors in place of replies.
     virtual std::shared_ptr<Connection> connect(const std::string& serviceName, std::shared_ptr<WorkQueue> queue) = 0;
     virtual std::unique_ptr<KeepAliveActivity> beginActivity(const std::string& name) = 0;

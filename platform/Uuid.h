@@ -28,8 +28,7 @@ struct UUID {
 
 } // namespace platform
 
-template <>
-struct std::hash<platform::UUID> {
+template <> struct std::hash<platform::UUID> {
     std::size_t operator()(const platform::UUID& uuid) const noexcept {
         // UUIDs are random or assigned by the registry, never chosen by a peer, so their own bits serve.
         std::size_t value = 0;

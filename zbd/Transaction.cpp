@@ -74,8 +74,8 @@ void Transaction::dispatch() {
     const auto type = _request.string(key::request);
     _version = _request.uint64(key::version).value_or(0);
     if (!zembra::isSupportedVersion(_version)) {
-        return fail(code::version, platform::format("unsupported protocol version %d (current %d)", _version,
-                                                    zembra::currentVersion));
+        return fail(code::version,
+                    platform::format("unsupported protocol version %d (current %d)", _version, zembra::currentVersion));
     }
     if (!_client->acceptWork()) return;
 

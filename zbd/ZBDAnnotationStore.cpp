@@ -90,9 +90,9 @@ bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
         const Dictionary database = content->dictionary().value_or(Dictionary());
         const auto version = database[versionKey].integerValue().value_or(0);
         if (version != databaseVersion) {
-            return zembra::errorWithCode(zembra::code::version,
-                                         platform::format("found database version %d needed version %d", version,
-                                                          databaseVersion));
+            return zembra::errorWithCode(
+                zembra::code::version,
+                platform::format("found database version %d needed version %d", version, databaseVersion));
         }
         _annotations = MutableDictionary::copyOf(database.dictionary(dataKey).value_or(Dictionary()));
         return std::nullopt;

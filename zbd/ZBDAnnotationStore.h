@@ -27,7 +27,7 @@ public:
     /// A store with its table loaded, migrated or empty. `path` is taken as written; none means the default location.
     /// Never writes unless it migrates. Ends the process when the container service fails.
     static std::unique_ptr<ZBDAnnotationStore> initWithDatabase(platform::Platform& platform,
-                                                               const std::optional<std::string>& path);
+                                                                const std::optional<std::string>& path);
 
     std::optional<platform::Dictionary> annotationForIdentifier(std::string_view annotationKey) const;
     std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn) const;

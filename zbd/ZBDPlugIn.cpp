@@ -38,7 +38,8 @@ bool ZBDPlugIn::setupWithProxy(const PlugInProxyRef& proxy) {
     setLocalizedName(valueOrAbsent(proxy->localizedName));
     setLocalizedShortName(valueOrAbsent(proxy->localizedShortName));
     setLocalizedContainingName(container ? valueOrAbsent(container->localizedName) : Value());
-    setLocalizedFilevaneActionNames(ZBDPluginAdditions::localizedFilevaneActionNamesForZBDict(_platform.registry, *proxy, declared));
+    setLocalizedFilevaneActionNames(
+        ZBDPluginAdditions::localizedFilevaneActionNamesForZBDict(_platform.registry, *proxy, declared));
     _originalIdentifier = valueOrAbsent(proxy->originalIdentifier);
     _entitlements = proxy->entitlements;
     _dataContainerURL = proxy->dataContainerURL;
@@ -63,7 +64,8 @@ platform::Failure ZBDPlugIn::diagnose() const {
         return zembra::errorWithCode(zembra::code::configuration, "this plug-in has no sandbox data container");
     }
     if (!containingUrl() && !path().starts_with(_platform.files.locate("/System/"))) {
-        return zembra::errorWithCode(zembra::code::configuration, "plug-ins outside containing apps must be in /System");
+        return zembra::errorWithCode(zembra::code::configuration,
+                                     "plug-ins outside containing apps must be in /System");
     }
     return std::nullopt;
 }

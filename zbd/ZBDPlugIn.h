@@ -19,7 +19,8 @@ namespace zbd {
 class ZBDPlugIn final : public zembra::ZBPlugInCore {
 public:
     /// Null for a proxy without location or identifier, and for a mis-configured plug-in, which is logged.
-    static std::shared_ptr<ZBDPlugIn> initWithCXData(platform::Platform& platform, const platform::PlugInProxyRef& proxy);
+    static std::shared_ptr<ZBDPlugIn> initWithCXData(platform::Platform& platform,
+                                                     const platform::PlugInProxyRef& proxy);
 
     /// A fresh proxy, by UUID or else by location; null when the registry knows neither.
     platform::PlugInProxyRef getProxy() const;
@@ -108,6 +109,15 @@ private:
         platform::MutableDictionary form;
     };
     mutable zembra::AtomicField<std::shared_ptr<const KeptForm>> _keptForm;
+
+    struct Tokens {
+        platform::Value extensions; // a dictionary, or absent
+        platform::Value service;    // a string, or absent
+        bool mayBeKept = false;
+        std::optional<platform::UUID> knowledge; // of the registry, when they were issued
+    };
+    std::shared_ptr<const Tokens> issueTokens() const;
+    mutable zembra::AtomicField<std::shared_ptr<const Tokens>> _keptTokens;
 };
 
 /// What the daemon adds to the registry's proxies.

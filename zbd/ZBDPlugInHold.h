@@ -39,8 +39,7 @@ private:
 
 } // namespace zbd
 
-template <>
-struct std::hash<zbd::ZBDPlugInHold> {
+template <> struct std::hash<zbd::ZBDPlugInHold> {
     std::size_t operator()(const zbd::ZBDPlugInHold& hold) const noexcept {
         return std::hash<platform::UUID>()(hold.uuid());
     }

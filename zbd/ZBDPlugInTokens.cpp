@@ -26,19 +26,39 @@ std::string errnoText(const platform::Error& error) {
 } // namespace
 
 void ZBDPlugIn::augmentForm(MutableDictionary& form) const {
-    static const Value wholeBundleOnly = Array{Value(wholeBundle)};
-    const Value resources = isAppExtension() ? wholeBundleOnly : pluginKey(manifest::shared);
-    if (resources) form.set(zembra::formKey::extensions, issueResourceExtensions(resources));
-    if (isData()) return;
+    currentInfo(); // takes over the registry's knowledge, which kept tokens have to match
+    auto tokens = _keptTokens.get();
+    if (!tokens || !tokens->knowledge || tokens->knowledge != _cxKnowledgeUUID.get() ||
+        log::sandbox().isEnabled(platform::LogLevel::debug)) { // whose reader sees each token issued
+        tokens = issueTokens();
+        _keptTokens.set(tokens->mayBeKept ? tokens : nullptr);
+    }
+    if (tokens->extensions) form.set(zembra::formKey::extensions, tokens->extensions);
+    if (tokens->service) form.set(zembra::formKey::serviceExtension, tokens->service);
+}
+
+std::shared_ptr<const ZBDPlugIn::Tokens> ZBDPlugIn::issueTokens() const {
+    auto tokens = std::make_shared<Tokens>();
+    tokens->knowledge = _cxKnowledgeUUID.get();
+    Value resources = pluginKey(manifest::shared);
+    if (isAppExtension()) resources = Array{Value(wholeBundle)};
+    if (resources) tokens->extensions = issueResourceExtensions(resources);
+    // The registry notices when a bundle directory is replaced, and then knows more; of single files within it does
+    // not.
+    tokens->mayBeKept = !resources || (isAppExtension() && !tokens->extensions.dictionary()->empty());
+    if (isData()) return tokens;
 
     const Value bundleIdentifier = infoKey(manifest::bundleIdentifier);
-    const auto token = zembra::issueServiceLookupToken(_platform.sandbox, std::string(bundleIdentifier.string().value_or("")));
+    const auto token =
+        zembra::issueServiceLookupToken(_platform.sandbox, std::string(bundleIdentifier.string().value_or("")));
     if (token) {
-        form.set(zembra::formKey::serviceExtension, *token);
+        tokens->service = *token;
     } else {
+        tokens->mayBeKept = false; // a refusal is logged each time
         log::ops().info("failed to make mach extension for %@ in plug-in at %@: %{public}s", bundleIdentifier, path(),
                         errnoText(token.error()));
     }
+    return tokens;
 }
 
 MutableDictionary ZBDPlugIn::issueResourceExtensions(const Value& resources) const {

@@ -35,7 +35,8 @@ std::shared_ptr<ZBDServer> ZBDServer::initForService(platform::Platform& platfor
     singleton() = self;
     self->setDelegate(self);
     // The handler keeps the server alive for as long as connections may come.
-    self->_service->setEventHandler([self](const platform::Listener::Event& event) { self->handleListenerEvent(event); });
+    self->_service->setEventHandler(
+        [self](const platform::Listener::Event& event) { self->handleListenerEvent(event); });
     self->_userPrefs = std::make_unique<ZBDUserPrefs>(platform.preferences);
     return self;
 }

@@ -64,6 +64,7 @@ public:
     const std::shared_ptr<platform::WorkQueue>& syncQueue() const { return _syncQueue; }
     const std::shared_ptr<platform::Listener>& service() const { return _service; }
     const ZBDUserPrefs& userPrefs() const { return *_userPrefs; }
+
 private:
     explicit ZBDServer(platform::Platform& platform);
     void handleListenerEvent(const platform::Listener::Event& event);

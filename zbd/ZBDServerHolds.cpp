@@ -17,7 +17,8 @@ ZBDServer::Holds ZBDServer::holds() const {
 
 bool ZBDServer::holdOnPlugIn(const ZBDPlugInRef& plugIn) {
     return _syncQueue->sync([&] {
-        return std::any_of(_holds.begin(), _holds.end(), [&](const auto& hold) { return hold->blocked().contains(plugIn); });
+        return std::any_of(_holds.begin(), _holds.end(),
+                           [&](const auto& hold) { return hold->blocked().contains(plugIn); });
     });
 }
 
@@ -116,8 +117,7 @@ void logTermination(int result, const std::optional<UUID>& uuid) {
     case platform::serviceHasNoInstances:
         log::ops().debug("ignitd reported no plug-ins on record for uuid=%@", uuid);
         break;
-    default:
-        log::ops().error("ignitd error attempting to terminate plug-ins: error=%d for uuid=%@", result, uuid);
+    default: log::ops().error("ignitd error attempting to terminate plug-ins: error=%d for uuid=%@", result, uuid);
     }
 }
 
@@ -128,11 +128,11 @@ void ZBDServer::terminatePlugIns(const std::vector<PlugInProxyRef>& proxies, std
     const auto wait = std::make_shared<TerminationWait>(proxies.size(), platform().queues.makeSerial("killer-waiter"),
                                                         std::move(reply));
     for (const PlugInProxyRef& proxy : proxies) {
-        const auto version = proxy->infoDictionary ? proxy->infoDictionary->string(zembra::manifest::bundleVersion)
-                                                   : std::nullopt;
+        const auto version =
+            proxy->infoDictionary ? proxy->infoDictionary->string(zembra::manifest::bundleVersion) : std::nullopt;
         const std::string serviceVersion(version.value_or("1"));
-        log::ops().debug("requesting termination for %@(%@) ignitd:%@ %@", proxy->bundleIdentifier, proxy->bundleVersion,
-                         serviceVersion, proxy->uuid);
+        log::ops().debug("requesting termination for %@(%@) ignitd:%@ %@", proxy->bundleIdentifier,
+                         proxy->bundleVersion, serviceVersion, proxy->uuid);
         platform().serviceManager.removeExternalService(proxy->bundleIdentifier.value_or(""), serviceVersion, killer,
                                                         [wait, uuid = proxy->uuid](int result) {
                                                             logTermination(result, uuid);

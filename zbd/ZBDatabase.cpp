@@ -164,7 +164,8 @@ std::optional<ZBDPlugInSet> ZBDatabase::findPlugIns(const std::optional<Dictiona
             *query, [&](const std::string& identifier, const std::optional<Dictionary>& entitlements) {
                 if (!elections) return true;
                 // A replacing plug-in shares the annotation of the one it replaces.
-                const auto replaced = entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
+                const auto replaced =
+                    entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
                 const std::string key(replaced.value_or(identifier));
                 const bool accepted = acceptByElection(*elections, key, entitlements);
                 log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);

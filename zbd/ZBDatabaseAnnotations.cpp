@@ -14,9 +14,7 @@ void ZBDatabase::setAnnotation(const std::optional<Dictionary>& annotation, cons
     _sync->sync([&] { _annotations->setAnnotation(annotation, plugIn); });
 }
 
-void ZBDatabase::notifyAnnotationChange() {
-    _platform.notifications.post(zembra::annotationChangeNotification);
-}
+void ZBDatabase::notifyAnnotationChange() { _platform.notifications.post(zembra::annotationChangeNotification); }
 
 void ZBDatabase::autoElect(const ZBDPlugIn& plugIn) {
     _sync->assertCurrent();

@@ -1,9 +1,9 @@
 #include "platform/linux/CodeSigning.h"
 
 #include "platform/linux/Descriptor.h"
-#include "platform/linux/SystemError.h"
 #include "platform/linux/Entitlements.h"
 #include "platform/linux/PeerProcess.h"
+#include "platform/linux/SystemError.h"
 
 #include <cerrno>
 #include <fcntl.h>

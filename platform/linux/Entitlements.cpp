@@ -1,8 +1,8 @@
 #include "platform/linux/Entitlements.h"
 
 #include "platform/linux/Descriptor.h"
-#include "platform/linux/SystemError.h"
 #include "platform/linux/ProcPath.h"
+#include "platform/linux/SystemError.h"
 
 #include <cerrno>
 #include <fcntl.h>

@@ -1,8 +1,8 @@
 #include "platform/linux/Processes.h"
 
 #include "platform/linux/Descriptor.h"
-#include "platform/linux/SystemError.h"
 #include "platform/linux/PeerProcess.h"
+#include "platform/linux/SystemError.h"
 
 #include <cerrno>
 #include <climits>

@@ -291,19 +291,14 @@ bool outsidesEqual(const Value& left, const Value& right) noexcept {
     if (left.isNumber()) return right.isNumber() && numbersEqual(left, right);
     if (left.kind() != right.kind()) return false;
     switch (left.kind()) {
-    case Kind::date:
-        return left.date()->seconds == right.date()->seconds;
+    case Kind::date: return left.date()->seconds == right.date()->seconds;
     case Kind::string:
-    case Kind::data:
-        return Contents::bytes(left).view() == Contents::bytes(right).view();
-    case Kind::uuid:
-        return left.uuid() == right.uuid();
-    case Kind::array:
-        return Contents::array(left).values.size() == Contents::array(right).values.size();
+    case Kind::data: return Contents::bytes(left).view() == Contents::bytes(right).view();
+    case Kind::uuid: return left.uuid() == right.uuid();
+    case Kind::array: return Contents::array(left).values.size() == Contents::array(right).values.size();
     case Kind::dictionary:
         return Contents::dictionary(left).entries.size() == Contents::dictionary(right).entries.size();
-    default:
-        return true;
+    default: return true;
     }
 }
 
@@ -461,41 +456,25 @@ private:
     void append(const Value& value, std::size_t depth) {
         if (isFull()) return;
         switch (value.kind()) {
-        case Kind::none:
-            _out += "(null)";
-            break;
-        case Kind::boolean:
-            _out += *value.boolean() ? "true" : "false";
-            break;
+        case Kind::none: _out += "(null)"; break;
+        case Kind::boolean: _out += *value.boolean() ? "true" : "false"; break;
         case Kind::integer:
             if (const auto number = value.int64())
                 appendNumber(*number);
             else
                 appendNumber(*value.uint64());
             break;
-        case Kind::real:
-            appendNumber(*value.real());
-            break;
+        case Kind::real: appendNumber(*value.real()); break;
         case Kind::date:
             _out += "<date ";
             appendNumber(value.date()->seconds);
             _out += '>';
             break;
-        case Kind::string:
-            appendText(*value.string());
-            break;
-        case Kind::data:
-            appendData(*value.data());
-            break;
-        case Kind::uuid:
-            _out += value.uuid()->text();
-            break;
-        case Kind::array:
-            appendArray(Contents::array(value).values, depth);
-            break;
-        case Kind::dictionary:
-            appendDictionary(Contents::dictionary(value).entries, depth);
-            break;
+        case Kind::string: appendText(*value.string()); break;
+        case Kind::data: appendData(*value.data()); break;
+        case Kind::uuid: _out += value.uuid()->text(); break;
+        case Kind::array: appendArray(Contents::array(value).values, depth); break;
+        case Kind::dictionary: appendDictionary(Contents::dictionary(value).entries, depth); break;
         }
     }
 

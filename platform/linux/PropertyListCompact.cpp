@@ -49,29 +49,18 @@ public:
 
     void append(const Value& value, std::size_t depth = 0) {
         switch (value.kind()) {
-        case Kind::none:
-            fail("an absent value has no encoding");
-        case Kind::boolean:
-            _out += static_cast<char>(*value.boolean() ? trueTag : falseTag);
-            break;
+        case Kind::none: fail("an absent value has no encoding");
+        case Kind::boolean: _out += static_cast<char>(*value.boolean() ? trueTag : falseTag); break;
         case Kind::integer:
             if (const auto number = value.int64())
                 appendNumber(integerTag, static_cast<std::uint64_t>(*number));
             else
                 appendNumber(unsignedTag, *value.uint64());
             break;
-        case Kind::real:
-            appendNumber(realTag, std::bit_cast<std::uint64_t>(*value.real()));
-            break;
-        case Kind::date:
-            appendNumber(dateTag, std::bit_cast<std::uint64_t>(value.date()->seconds));
-            break;
-        case Kind::string:
-            appendBytes(stringTag, *value.string());
-            break;
-        case Kind::data:
-            appendBytes(dataTag, *value.data());
-            break;
+        case Kind::real: appendNumber(realTag, std::bit_cast<std::uint64_t>(*value.real())); break;
+        case Kind::date: appendNumber(dateTag, std::bit_cast<std::uint64_t>(value.date()->seconds)); break;
+        case Kind::string: appendBytes(stringTag, *value.string()); break;
+        case Kind::data: appendBytes(dataTag, *value.data()); break;
         case Kind::uuid: {
             _out += static_cast<char>(uuidTag);
             const UUID uuid = *value.uuid();
@@ -205,12 +194,8 @@ private:
         std::uint64_t bits = 0;
         std::string_view bytes;
         switch (static_cast<std::uint8_t>(_bytes[_at++])) {
-        case falseTag:
-            value = false;
-            return true;
-        case trueTag:
-            value = true;
-            return true;
+        case falseTag: value = false; return true;
+        case trueTag: value = true; return true;
         case integerTag:
             if (!readNumber(bits)) return false;
             value = static_cast<std::int64_t>(bits);
@@ -239,16 +224,14 @@ private:
             if (!readBytes(bytes)) return false;
             value = Value::data(bytes);
             return true;
-        case uuidTag:
-            return readUUID(value, start);
+        case uuidTag: return readUUID(value, start);
         case arrayTag:
             return readContainer(smallestValue, start, depth,
                                  [&](std::uint32_t count) { return readItems(value, count, depth); });
         case dictionaryTag:
             return readContainer(smallestEntry, start, depth,
                                  [&](std::uint32_t count) { return readEntries(value, count, start, depth); });
-        default:
-            return fail("an unknown tag", start);
+        default: return fail("an unknown tag", start);
         }
     }
 

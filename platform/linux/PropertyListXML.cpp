@@ -171,37 +171,28 @@ private:
     bool append(const Value& value, std::size_t depth) {
         indent(depth);
         switch (value.kind()) {
-        case Kind::none:
-            return fail("an absent value");
-        case Kind::uuid:
-            return fail("a UUID");
-        case Kind::boolean:
-            _out += *value.boolean() ? "<true/>\n" : "<false/>\n";
-            return true;
+        case Kind::none: return fail("an absent value");
+        case Kind::uuid: return fail("a UUID");
+        case Kind::boolean: _out += *value.boolean() ? "<true/>\n" : "<false/>\n"; return true;
         case Kind::integer:
             if (const auto number = value.int64())
                 appendElement("integer", std::to_string(*number));
             else
                 appendElement("integer", std::to_string(*value.uint64()));
             return true;
-        case Kind::real:
-            appendElement("real", realText(*value.real()));
-            return true;
+        case Kind::real: appendElement("real", realText(*value.real())); return true;
         case Kind::date:
             if (!linux_::isEncodableDate(*value.date())) return fail("a date outside the years 1 to 9999");
             appendElement("date", dateText(*value.date()));
             return true;
-        case Kind::string:
-            return appendText("string", *value.string());
+        case Kind::string: return appendText("string", *value.string());
         case Kind::data:
             // The library counts in int and the text is a third longer.
             if (value.data()->size() > INT_MAX / 2) return fail("data of 1 GiB or more");
             appendElement("data", base64(*value.data()));
             return true;
-        case Kind::array:
-            return appendArray(*value.array(), depth);
-        case Kind::dictionary:
-            return appendDictionary(*value.dictionary(), depth);
+        case Kind::array: return appendArray(*value.array(), depth);
+        case Kind::dictionary: return appendDictionary(*value.dictionary(), depth);
         }
         return false;
     }
@@ -224,18 +215,10 @@ private:
         for (std::size_t at = 0; at < text.size(); ++at) {
             const char c = text[at];
             switch (c) {
-            case '&':
-                _out += "&amp;";
-                break;
-            case '<':
-                _out += "&lt;";
-                break;
-            case '>':
-                _out += "&gt;";
-                break; // else "]]>" could come out
-            case '\r':
-                _out += "&#13;";
-                break; // a bare one would be read as a newline
+            case '&': _out += "&amp;"; break;
+            case '<': _out += "&lt;"; break;
+            case '>': _out += "&gt;"; break;   // else "]]>" could come out
+            case '\r': _out += "&#13;"; break; // a bare one would be read as a newline
             default:
                 if (static_cast<unsigned char>(c) < 0x20 && c != '\t' && c != '\n') return fail("a control character");
                 if (c == '\xEF' && isNoncharacter(text.substr(at, 3))) return fail("a noncharacter");
@@ -403,8 +386,7 @@ private:
             else if (element != Element::key && !parent.awaitsValue())
                 problem = "a value without a key";
             break;
-        default:
-            problem = "an element inside text";
+        default: problem = "an element inside text";
         }
         if (element == Element::vlist) problem = "a vlist inside another";
         if (problem != nullptr) fail(problem);
@@ -422,8 +404,7 @@ private:
         case Element::no:
             if (!trimmed(text).empty()) fail("text where none belongs");
             break;
-        default:
-            frame.text += text;
+        default: frame.text += text;
         }
     }
 
@@ -451,19 +432,13 @@ private:
     /// The value of a finished element; absent after a failure.
     Value valueOf(Frame& frame) {
         switch (frame.element) {
-        case Element::vlist:
-            break;
+        case Element::vlist: break;
         case Element::key:
-        case Element::string:
-            return frame.text;
-        case Element::yes:
-            return true;
-        case Element::no:
-            return false;
-        case Element::integer:
-            return integer(trimmed(frame.text));
-        case Element::real:
-            return real(trimmed(frame.text));
+        case Element::string: return frame.text;
+        case Element::yes: return true;
+        case Element::no: return false;
+        case Element::integer: return integer(trimmed(frame.text));
+        case Element::real: return real(trimmed(frame.text));
         case Element::data: {
             std::erase_if(frame.text, isBlank);
             if (const auto bytes = base64Decoded(frame.text)) return Value::data(*bytes);
@@ -474,8 +449,7 @@ private:
             if (const auto date = dateFromText(trimmed(frame.text))) return *date;
             fail("a date that is not of the form 2026-11-22T21:00:00Z");
             break;
-        case Element::array:
-            return Array(std::move(frame.values));
+        case Element::array: return Array(std::move(frame.values));
         case Element::dictionary: {
             if (frame.awaitsValue()) {
                 fail("a key without a value");

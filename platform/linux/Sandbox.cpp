@@ -26,10 +26,6 @@ constexpr std::size_t maximumResolutions = 8192;
 /// nothing, so this bounds how long one is handed out in vain.
 constexpr std::chrono::seconds resolutionLifetime{5};
 
-/// How long a look at the file itself serves. Requests for one bundle come in bursts; a bundle that was replaced in
-/// between gives a token that opens nothing.
-constexpr std::chrono::milliseconds verificationLifetime{10};
-
 bool isName(const std::string& text) {
     return !text.empty() && text.size() <= maximumNameLength && text.find('\0') == std::string::npos;
 }
@@ -99,34 +95,28 @@ std::string Sandbox::resolutionKey(const std::string& path, const std::string& w
 /// The token of an earlier resolution, while the file is the one that it was made for.
 std::optional<std::string> Sandbox::knownToken(const std::string& key, const std::string& path,
                                                const std::string& extensionClass, bool canonical) {
-    const auto now = std::chrono::steady_clock::now();
-    const auto isCurrent = [&](const Resolution& known) {
-        return now - known.checked < resolutionLifetime && known.tokenCanonical == canonical &&
-               known.tokenClass == extensionClass;
-    };
-    std::unique_lock lock(_mutex);
-    const auto known = _resolutions.find(key);
-    if (known == _resolutions.end() || !isCurrent(known->second)) return std::nullopt;
-    if (now - known->second.verified < verificationLifetime) return known->second.token;
-    lock.unlock();
     FileStatus status;
     if (readFileStatus(AT_FDCWD, path.c_str(), status) != 0) return std::nullopt;
-    lock.lock();
-    const auto again = _resolutions.find(key);
-    if (again == _resolutions.end() || !isCurrent(again->second) || !(again->second.status == status)) return std::nullopt;
-    again->second.verified = now;
-    return again->second.token;
+    const auto now = std::chrono::steady_clock::now();
+    const std::lock_guard lock(_mutex);
+    const auto known = _resolutions.find(key);
+    if (known == _resolutions.end()) return std::nullopt;
+    const Resolution& resolution = known->second;
+    const bool isCurrent = resolution.status == status && now - resolution.checked < resolutionLifetime &&
+                           resolution.tokenCanonical == canonical && resolution.tokenClass == extensionClass;
+    return isCurrent ? std::optional(resolution.token) : std::nullopt;
 }
 
 int Sandbox::resolve(const std::string& path, const std::string& within, Resolution& resolution) {
-    resolution.checked = resolution.verified = std::chrono::steady_clock::now();
+    resolution.checked = std::chrono::steady_clock::now();
+    if (int number = readFileStatus(AT_FDCWD, path.c_str(), resolution.status)) return number;
     if (int number = canonicalise(path, resolution.canonicalPath)) return number;
     if (!within.empty()) {
         std::string directory;
         if (int number = canonicalise(within, directory)) return number;
         if (!isWithin(resolution.canonicalPath, directory)) return EPERM;
     }
-    // By the canonical path: the given one may lead elsewhere by now.
+    // Anew, by the canonical path: the given one may lead elsewhere by now.
     if (int number = readFileStatus(AT_FDCWD, resolution.canonicalPath.c_str(), resolution.status)) return number;
     return S_ISREG(resolution.status.mode) || S_ISDIR(resolution.status.mode) ? 0 : EINVAL;
 }

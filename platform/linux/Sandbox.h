@@ -54,8 +54,7 @@ private:
     struct Resolution {
         std::string canonicalPath;
         FileStatus status;
-        std::chrono::steady_clock::time_point checked;  // when it was resolved
-        std::chrono::steady_clock::time_point verified; // when the file itself was looked at
+        std::chrono::steady_clock::time_point checked; // when it was resolved
         // The token made of it last: the same grant gives the same text.
         std::string tokenClass;
         bool tokenCanonical = false;
@@ -71,10 +70,10 @@ private:
     std::unique_ptr<TokenSigner> _signer; // issuers only
     std::unique_ptr<SandboxBroker> _broker;
     mutable std::mutex _mutex;
-    std::unordered_map<std::string, Resolution> _resolutions; // guarded by _mutex; by path, NUL, directory
+    std::unordered_map<std::string, Resolution> _resolutions;    // guarded by _mutex; by path, NUL, directory
     std::unordered_map<std::string, std::string> _serviceTokens; // guarded by _mutex; by class, NUL, name
-    std::map<std::int64_t, Descriptor> _handles;              // guarded by _mutex; none for services
-    std::int64_t _nextHandle = 1;                             // guarded by _mutex
+    std::map<std::int64_t, Descriptor> _handles;                 // guarded by _mutex; none for services
+    std::int64_t _nextHandle = 1;                                // guarded by _mutex
 };
 
 } // namespace platform::linux_

@@ -218,8 +218,8 @@ std::string StreamListener::bind(const std::string& directory, const std::string
 void StreamListener::removeName() const {
     if (_fileName.empty()) return;
     struct stat status{};
-    if (::fstatat(_directory.get(), _fileName.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 &&
-        status.st_dev == _device && status.st_ino == _inode) {
+    if (::fstatat(_directory.get(), _fileName.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 && status.st_dev == _device &&
+        status.st_ino == _inode) {
         ::unlinkat(_directory.get(), _fileName.c_str(), 0);
     }
 }

@@ -47,19 +47,14 @@ public:
 
     Value next(int depth = 0) {
         switch (below(depth < 4 ? 10 : 8)) {
-        case 0:
-            return below(2) == 0;
-        case 1:
-            return static_cast<std::int64_t>(_random() >> below(64));
-        case 2:
-            return static_cast<std::uint64_t>(_random()) | (1ULL << 63U);
-        case 3:
-            return std::ldexp(static_cast<double>(_random()), static_cast<int>(below(200)) - 100);
+        case 0: return below(2) == 0;
+        case 1: return static_cast<std::int64_t>(_random() >> below(64));
+        case 2: return static_cast<std::uint64_t>(_random()) | (1ULL << 63U);
+        case 3: return std::ldexp(static_cast<double>(_random()), static_cast<int>(below(200)) - 100);
         case 4:
             return Date{std::ldexp(static_cast<double>(static_cast<std::int64_t>(_random())),
                                    -static_cast<int>(below(60)) - 28)};
-        case 5:
-            return Value::data(text());
+        case 5: return Value::data(text());
         case 6:
             if (_uuids == UUIDs::allowed) {
                 UUID uuid;
@@ -67,8 +62,7 @@ public:
                 return uuid;
             }
             [[fallthrough]];
-        case 7:
-            return text();
+        case 7: return text();
         case 8: {
             MutableArray array;
             for (auto i = below(6); i > 0; --i) array.append(next(depth + 1));
@@ -712,7 +706,8 @@ TEST(Decoding, KeepsTheNestingThatIsAskedFor) {
 
 TEST(ValueStrings, IllFormedBytesBecomeReplacementCharacters) {
     for (const auto& [bytes, expected] : {std::pair<std::string, std::string>{"caf\xE9.app", "caf\xEF\xBF\xBD.app"},
-                                          {std::string("a\0b", 3), "a\xEF\xBF\xBD" "b"},
+                                          {std::string("a\0b", 3), "a\xEF\xBF\xBD"
+                                                                   "b"},
                                           {"\xC3\xA9\xED\xA0\x80", "\xC3\xA9\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD"}}) {
         EXPECT_EQ(Value(bytes).string(), expected);
         std::string encoded;

@@ -35,9 +35,11 @@ struct FakeDaemon {
     std::optional<platform::Dictionary> ask(const std::shared_ptr<platform::Connection>& connection,
                                             const platform::Dictionary& message) {
         auto answer = std::make_shared<std::optional<platform::Dictionary>>();
-        connection->sendWithReply(message, fake.queues.makeSerial("replies"), [answer](const platform::ReplyOrError& reply) {
-            if (const auto* content = std::get_if<platform::Dictionary>(&reply)) *answer = *content;
-        });
+        connection->sendWithReply(message, fake.queues.makeSerial("replies"),
+                                  [answer](const platform::ReplyOrError& reply) {
+                                      if (const auto* content = std::get_if<platform::Dictionary>(&reply))
+                                          *answer = *content;
+                                  });
         fake.transport.deliver();
         return *answer;
     }

@@ -39,9 +39,9 @@ struct FakePlatform {
     FakeLocale locale;
     FakeProcesses processes;
     FakeFiles files;
-    platform::Platform platform{queues,     runLoop,     transport,  registry,      serviceManager,
-                                sandbox,    codeSigning, bundles,    interfaces,    preferences,
-                                containers, notifications, locale,   processes,     files};
+    platform::Platform platform{queues,     runLoop,       transport, registry,   serviceManager,
+                                sandbox,    codeSigning,   bundles,   interfaces, preferences,
+                                containers, notifications, locale,    processes,  files};
 
     FakePlatform() {
         files.addDirectory("/var/db");

@@ -65,7 +65,8 @@ TEST_F(AnnotationStore, UnloadableFileIsLoggedAndReplacedByTheFirstChange) {
         processLog.clear();
         fake.files.files[defaultPath] = bad.bytes;
         auto store = open();
-        EXPECT_TRUE(logged(LogLevel::error, "unable to load annotation database:file:///var/db/Zembra-Annotations error:" + bad.text));
+        EXPECT_TRUE(logged(LogLevel::error,
+                           "unable to load annotation database:file:///var/db/Zembra-Annotations error:" + bad.text));
         EXPECT_TRUE(store->annotations().empty());
         EXPECT_EQ(fake.files.files[defaultPath], bad.bytes) << "nothing is written before a change";
         store->setAnnotation(Dictionary{{"election", 1}}, *plugIn("b"));
@@ -88,7 +89,8 @@ TEST_F(AnnotationStore, TableThatIsNoDictionaryIsEmpty) {
 
 TEST_F(AnnotationStore, MigratesFromTheContainer) {
     fake.containers.allow("com.nordane.zbd", "/containers/old");
-    fake.files.files["/containers/old"] = xml(Dictionary{{"version", 16}, {"data", Dictionary{{"a", Dictionary{{"election", 1}}}}}});
+    fake.files.files["/containers/old"] =
+        xml(Dictionary{{"version", 16}, {"data", Dictionary{{"a", Dictionary{{"election", 1}}}}}});
     EXPECT_EQ(open()->annotationForIdentifier("a"), (Dictionary{{"election", 1}}));
     EXPECT_TRUE(logged(LogLevel::info, "migrating shared annotations"));
     EXPECT_TRUE(stored().dictionary("data")->contains("a"));
@@ -97,8 +99,8 @@ TEST_F(AnnotationStore, MigratesFromTheContainer) {
     fake.files.files.erase(defaultPath);
     fake.files.writeFailure = platform::Error{platform::fileErrorDomain, platform::fileWriteOutOfSpaceCode, "full"};
     EXPECT_TRUE(open()->annotationForIdentifier("a"));
-    EXPECT_TRUE(logged(LogLevel::error,
-                       "unable to save migrated annotations to file:///var/db/Zembra-Annotations error:full"));
+    EXPECT_TRUE(
+        logged(LogLevel::error, "unable to save migrated annotations to file:///var/db/Zembra-Annotations error:full"));
 }
 
 TEST_F(AnnotationStore, GivenPathIsTakenAsWritten) {
@@ -137,7 +139,8 @@ TEST_F(AnnotationStore, ReplacingPlugInSharesTheAnnotation) {
     store->setAnnotation(Dictionary{{"election", 1}}, *replacing);
     EXPECT_EQ(store->annotationForPlugIn(*old), (Dictionary{{"election", 1}}));
     // A value that is no identifier replaces nothing.
-    EXPECT_EQ(plugIn("other", Dictionary{{"com.nordane.developer.replace-plugin", true}})->annotationKey(), "com.example.other");
+    EXPECT_EQ(plugIn("other", Dictionary{{"com.nordane.developer.replace-plugin", true}})->annotationKey(),
+              "com.example.other");
 }
 
 TEST_F(AnnotationStore, UnsavedChangeGoesOutWithTheNext) {

@@ -58,7 +58,8 @@ struct Database : testing::Test {
 
 TEST_F(Database, QueueIsNamed) {
     const auto made = [&](std::string_view label) {
-        return std::any_of(fake.queues.made.begin(), fake.queues.made.end(), [&](const auto& m) { return m.label == label; });
+        return std::any_of(fake.queues.made.begin(), fake.queues.made.end(),
+                           [&](const auto& m) { return m.label == label; });
     };
     EXPECT_TRUE(made("ZBDatabase"));
 }
@@ -143,8 +144,9 @@ TEST_F(Database, UninstallNoticeRemovesThenTellsTheDelegate) {
     EXPECT_EQ(listener->removed, (std::vector<std::size_t>{2}));
     for (const auto& proxy : {a, b}) {
         EXPECT_TRUE(processLog.contains(LogLevel::standard, "ops",
-                                        "plug-in UNINSTALLED:" + *proxy->bundleIdentifier + " " + *proxy->plugInIdentifier +
-                                            "(1) " + proxy->uuid->text() + " " + proxy->bundleURL->path()));
+                                        "plug-in UNINSTALLED:" + *proxy->bundleIdentifier + " " +
+                                            *proxy->plugInIdentifier + "(1) " + proxy->uuid->text() + " " +
+                                            proxy->bundleURL->path()));
     }
 }
 
@@ -193,13 +195,15 @@ TEST_F(Database, ElectionPrefilterKeepsWhatTheRuleAsksFor) {
         const auto installed = *fake.registry.installedPlugIns();
         for (const auto& proxy : installed) {
             if (proxy->plugInIdentifier != "com.example." + name) continue;
-            database->setAnnotation(Dictionary{{"election", election}}, *zbd::ZBDPlugIn::initWithCXData(fake.platform, proxy));
+            database->setAnnotation(Dictionary{{"election", election}},
+                                    *zbd::ZBDPlugIn::initWithCXData(fake.platform, proxy));
         }
     };
     annotate("elected", 1);
     annotate("wide", 257);
 
-    const std::set<std::string> ones{"com.example.automatic", "com.example.elected", "com.example.wide", "com.example.replacing"};
+    const std::set<std::string> ones{"com.example.automatic", "com.example.elected", "com.example.wide",
+                                     "com.example.replacing"};
     const std::set<std::string> zeros{"com.example.none", "com.example.falsely"};
     std::set<std::string> all = ones;
     all.insert(zeros.begin(), zeros.end());
@@ -210,8 +214,8 @@ TEST_F(Database, ElectionPrefilterKeepsWhatTheRuleAsksFor) {
     for (const Case& c : {Case{"1", ones}, Case{"=1", ones}, Case{Array{"1", "=2"}, ones}, Case{"0", zeros},
                           Case{Array{"0", "1"}, all}, Case{"7", {}}, Case{Array(), {}}, Case{"=", {}},
                           // These build no prefilter, so the registry's whole answer stays.
-                          Case{"<>1", all}, Case{"", all}, Case{Array{"1", "!1"}, all}, Case{Array{"1", 2}, all}, Case{1, all},
-                          Case{true, all}}) {
+                          Case{"<>1", all}, Case{"", all}, Case{Array{"1", "!1"}, all}, Case{Array{"1", 2}, all},
+                          Case{1, all}, Case{true, all}}) {
         EXPECT_EQ(found(Dictionary{{"VKUserElection", c.pattern}}), c.expected) << c.pattern.description();
     }
     EXPECT_EQ(found(Dictionary{{"other", "1"}}), all);
@@ -232,7 +236,9 @@ TEST_F(Database, AutoElectionHappensWhenTheRecordIsBuilt) {
     const auto decided = install("decided", entitled);
     const auto reset = install("reset", entitled);
     const auto unentitled = install("unentitled");
-    const auto record = [&](const PlugInProxyRef& proxy) { return zbd::ZBDPlugIn::initWithCXData(fake.platform, proxy); };
+    const auto record = [&](const PlugInProxyRef& proxy) {
+        return zbd::ZBDPlugIn::initWithCXData(fake.platform, proxy);
+    };
     database->setAnnotation(Dictionary{{"election", 2}}, *record(decided));
     database->setAnnotation(Dictionary{{"election", 0}, {"extension", Dictionary{{"k", 1}}}}, *record(reset));
 
@@ -247,7 +253,8 @@ TEST_F(Database, AutoElectionHappensWhenTheRecordIsBuilt) {
 }
 
 TEST_F(Database, ApplicationsPlugIns) {
-    const auto application = fake.registry.installApplication({URL::file("/Applications/A.app"), "com.example.app", "A"});
+    const auto application =
+        fake.registry.installApplication({URL::file("/Applications/A.app"), "com.example.app", "A"});
     EXPECT_FALSE(database->plugInsWithinApplication(application->bundleURL));
     EXPECT_FALSE(database->plugInsWithinApplication(URL::file("/Applications/Unknown.app")));
     auto good = dataPlugIn("good");

@@ -36,7 +36,8 @@ struct PlugIn : testing::Test {
         processLog.clear();
         const std::string path = proxy.bundleURL->path();
         EXPECT_FALSE(make(std::move(proxy))) << reason;
-        EXPECT_TRUE(processLog.contains(LogLevel::info, "ops", "ignoring mis-configured plug-in at " + path + ": " + reason))
+        EXPECT_TRUE(
+            processLog.contains(LogLevel::info, "ops", "ignoring mis-configured plug-in at " + path + ": " + reason))
             << reason;
     }
 };
@@ -95,7 +96,8 @@ TEST_F(PlugIn, WithoutLocationOrIdentifierThereIsNone) {
     proxy = data();
     proxy.plugInIdentifier.reset();
     EXPECT_FALSE(make(proxy));
-    EXPECT_TRUE(processLog.contains(LogLevel::error, "ops", "missing identifier in plug-in at " + proxy.bundleURL->path()));
+    EXPECT_TRUE(
+        processLog.contains(LogLevel::error, "ops", "missing identifier in plug-in at " + proxy.bundleURL->path()));
 }
 
 TEST_F(PlugIn, MisconfiguredOnesAreRefusedWithTheirReason) {
@@ -168,7 +170,8 @@ TEST_F(PlugIn, ActionNamesAreLocalizedOrThemselves) {
     auto proxy = data();
     auto extension = platform::MutableDictionary::copyOf(*proxy.plugInDictionary);
     extension.set("VKExtensionFilevaneActions",
-                  Array{Dictionary{{"VKExtensionFilevaneActionName", "turn"}}, Dictionary{{"VKExtensionFilevaneActionName", "turn"}},
+                  Array{Dictionary{{"VKExtensionFilevaneActionName", "turn"}},
+                        Dictionary{{"VKExtensionFilevaneActionName", "turn"}},
                         Dictionary{{"VKExtensionFilevaneActionName", "flip"}}, Dictionary(), Value(3)});
     proxy.plugInDictionary = extension;
     fake.registry.setStringTable(proxy.bundleURL->path(), "Localizable", {{"turn", "Drehen"}});

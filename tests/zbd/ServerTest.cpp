@@ -46,7 +46,8 @@ TEST_F(Server, ConstructionMakesTheQueuesAndTheSingleton) {
     for (const auto& queue : daemon.fake.queues.made) made.emplace_back(queue.label, queue.quality);
     using enum platform::QualityOfService;
     for (const auto& expected : {std::pair{"qmx", standard}, {"service", userInitiated}, {"serverSync", standard}}) {
-        EXPECT_TRUE(std::find(made.begin(), made.end(), std::pair<std::string, platform::QualityOfService>(expected)) != made.end())
+        EXPECT_TRUE(std::find(made.begin(), made.end(), std::pair<std::string, platform::QualityOfService>(expected)) !=
+                    made.end())
             << expected.first;
     }
     EXPECT_EQ(zbd::ZBDServer::server(), daemon.server);
@@ -140,21 +141,23 @@ TEST_F(Server, UninstalledPlugInsHaveTheirInstancesEnded) {
     fake.serviceManager.allow();
     fake.serviceManager.addInstance("com.example.a", "1");
     auto versionless = support::dataPlugIn("b");
-    versionless.info = Dictionary{{"VBBundleIdentifier", "com.example.b"}, {"VKExtension", *versionless.info.dictionary("VKExtension")}};
+    versionless.info = Dictionary{{"VBBundleIdentifier", "com.example.b"},
+                                  {"VKExtension", *versionless.info.dictionary("VKExtension")}};
     const auto a = fake.registry.install(support::dataPlugIn("a"));
     const auto b = fake.registry.install(versionless);
     const auto c = fake.registry.install(support::dataPlugIn("c"));
     fake.serviceManager.fail("com.example.c", "1", 5);
     fake.registry.fireWillUninstall({a, b, c});
     fake.queues.runAll();
-    EXPECT_EQ(fake.serviceManager.removals(), (std::vector<support::FakeServiceManager::Service>{
-                                                  {"com.example.a", "1"}, {"com.example.b", "1"}, {"com.example.c", "1"}}));
+    EXPECT_EQ(fake.serviceManager.removals(),
+              (std::vector<support::FakeServiceManager::Service>{
+                  {"com.example.a", "1"}, {"com.example.b", "1"}, {"com.example.c", "1"}}));
     EXPECT_TRUE(processLog.contains(LogLevel::info, "ops",
                                     "one or more plug-ins have been terminated for uuid=" + a->uuid->text()));
     EXPECT_TRUE(processLog.contains(LogLevel::debug, "ops",
                                     "ignitd reported no plug-ins on record for uuid=" + b->uuid->text()));
-    EXPECT_TRUE(processLog.contains(LogLevel::error, "ops",
-                                    "ignitd error attempting to terminate plug-ins: error=5 for uuid=" + c->uuid->text()));
+    EXPECT_TRUE(processLog.contains(
+        LogLevel::error, "ops", "ignitd error attempting to terminate plug-ins: error=5 for uuid=" + c->uuid->text()));
     const auto lines = processLog.messages("ops");
     EXPECT_TRUE(lines.back().starts_with("removal complete for ")) << lines.back();
     EXPECT_TRUE(processLog.contains(LogLevel::debug, "ops",
@@ -173,7 +176,8 @@ TEST_F(Server, TerminationIsAnsweredAfterTheLastInstance) {
     for (int i = 0; i < 3; ++i) {
         EXPECT_EQ(replies, 0);
         EXPECT_TRUE(processLog.contains(LogLevel::debug, "ops", "awaiting termination reply #" + std::to_string(i)));
-        EXPECT_FALSE(processLog.contains(LogLevel::debug, "ops", "awaiting termination reply #" + std::to_string(i + 1)));
+        EXPECT_FALSE(
+            processLog.contains(LogLevel::debug, "ops", "awaiting termination reply #" + std::to_string(i + 1)));
         ASSERT_TRUE(fake.serviceManager.answer());
         fake.queues.runAll();
     }
@@ -216,7 +220,8 @@ TEST_F(Server, UnexpectedEventsAreLoggedAndAnswersGoOn) {
 TEST_F(Server, EveryThousandthRequestIsCounted) {
     const auto connection = daemon.connect();
     const auto used = [](int count) {
-        return processLog.contains(LogLevel::debug, "ops", "client 77 used " + std::to_string(count) + " requests so far");
+        return processLog.contains(LogLevel::debug, "ops",
+                                   "client 77 used " + std::to_string(count) + " requests so far");
     };
     for (int i = 1; i <= 2000; ++i) {
         daemon.ask(connection, {{"request", "bulk"}, {"version", 3}});

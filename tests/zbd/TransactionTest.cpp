@@ -1,5 +1,5 @@
-#include "tests/support/FakeDaemon.h"
 #include "Zembra/ZBDaemonClient.h"
+#include "tests/support/FakeDaemon.h"
 
 #include <gtest/gtest.h>
 
@@ -32,7 +32,8 @@ struct Transaction : testing::Test {
 TEST_F(Transaction, VersionIsJudgedFirst) {
     const auto connection = daemon.connect();
     const auto ask = [&](const Dictionary& message) { return *daemon.ask(connection, message); };
-    for (const auto& [version, shown] : {std::pair<Value, std::string>{1, "1"}, {4, "4"}, {0, "0"}, {"3", "0"}, {-3, "0"}}) {
+    for (const auto& [version, shown] :
+         {std::pair<Value, std::string>{1, "1"}, {4, "4"}, {0, "0"}, {"3", "0"}, {-3, "0"}}) {
         EXPECT_EQ(ask({{"request", "bulk"}, {"version", version}}),
                   errorReply(7, "unsupported protocol version " + shown + " (current 3)"));
     }
@@ -43,7 +44,8 @@ TEST_F(Transaction, VersionIsJudgedFirst) {
 TEST_F(Transaction, TypesAreExactStrings) {
     const auto connection = daemon.connect();
     EXPECT_EQ(*daemon.ask(connection, {{"version", 3}}), errorReply(4, "invalid request format (missing type)"));
-    EXPECT_EQ(*daemon.ask(connection, {{"version", 3}, {"request", 5}}), errorReply(4, "invalid request format (missing type)"));
+    EXPECT_EQ(*daemon.ask(connection, {{"version", 3}, {"request", 5}}),
+              errorReply(4, "invalid request format (missing type)"));
     EXPECT_EQ(daemon.ask("Bulk"), errorReply(4, "unrecognized request"));
     EXPECT_TRUE(processLog.contains(LogLevel::debug, "ops", "client 77 requested Bulk"));
 }
@@ -152,8 +154,9 @@ TEST_F(Transaction, FindOfAVanishedPlugInLogsAndSendsWhatThereIs) {
     EXPECT_FALSE(form.contains("bundleInfo"));
     bool isLogged = false;
     for (const auto& line : processLog.lines()) {
-        isLogged = isLogged || (line.level == LogLevel::error && line.category == "ops" &&
-                                line.message.starts_with("failed to export matching plug-in " + a->uuid->text() + ": "));
+        isLogged =
+            isLogged || (line.level == LogLevel::error && line.category == "ops" &&
+                         line.message.starts_with("failed to export matching plug-in " + a->uuid->text() + ": "));
     }
     EXPECT_TRUE(isLogged);
 }

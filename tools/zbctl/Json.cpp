@@ -101,12 +101,14 @@ Json toJson(const Value& value) {
     case Kind::uuid: return value.uuid()->text();
     case Kind::array: {
         Json json = Json::array();
-        for (const auto& element : *value.array()) json.push_back(toJson(element));
+        const auto array = value.array();
+        for (const auto& element : *array) json.push_back(toJson(element));
         return json;
     }
     case Kind::dictionary: {
         Json json = Json::object();
-        for (const auto& entry : *value.dictionary()) json[std::string(entry.name())] = toJson(entry.value);
+        const auto dictionary = value.dictionary();
+        for (const auto& entry : *dictionary) json[std::string(entry.name())] = toJson(entry.value);
         return json;
     }
     }

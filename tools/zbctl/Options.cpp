@@ -12,9 +12,10 @@ namespace {
 std::optional<std::uint64_t> numberOf(std::string_view text) {
     const bool hexadecimal = text.starts_with("0x") || text.starts_with("0X");
     if (hexadecimal) text.remove_prefix(2);
-    const char* end = text.data() + text.size();
+    const char* start = text.data();
+    const char* end = start + text.size();
     std::uint64_t number = 0;
-    const auto [stop, error] = std::from_chars(text.data(), end, number, hexadecimal ? 16 : 10);
+    const auto [stop, error] = std::from_chars(start, end, number, hexadecimal ? 16 : 10);
     if (error != std::errc() || stop != end) return std::nullopt;
     return number;
 }
@@ -23,18 +24,21 @@ std::optional<std::uint64_t> numberOf(std::string_view text) {
 
 void addNumber(CLI::App* verb, const std::string& name, std::function<void(std::uint64_t)> set,
                const std::string& description) {
-    const auto read = [name, set = std::move(set)](const std::string& text) {
-        const auto number = numberOf(text);
-        if (!number) throw CLI::ValidationError(name, '"' + text + "\" is not a number from 0 to 2^64-1");
-        set(*number);
+    const CLI::callback_t read = [set = std::move(set)](const CLI::results_t& texts) {
+        const auto number = numberOf(texts.front());
+        if (number) set(*number);
+        return number.has_value();
     };
-    verb->add_option_function<std::string>(name, read, description)->type_name("NUMBER");
+    verb->add_option(name, read, description)->type_name("NUMBER");
 }
 
 CLI::Option* addText(CLI::App* verb, const std::string& name, std::optional<std::string>& text,
                      const std::string& description) {
-    return verb->add_option_function<std::string>(
-        name, [&text](const std::string& given) { text = given; }, description);
+    const CLI::callback_t read = [&text](const CLI::results_t& texts) {
+        text = texts.front();
+        return true;
+    };
+    return verb->add_option(name, read, description)->type_name("TEXT");
 }
 
 } // namespace zbctl

@@ -36,13 +36,13 @@ ExitStatus watch(const std::string& name, std::optional<std::uint64_t> count) {
             arrivals->changed.notify_one();
         });
     // Whoever started this may now cause what is to be seen.
-    std::cerr << "watching " << printable(name) << std::endl;
+    std::cerr << "watching " << printable(name) << '\n' << std::flush;
 
     std::unique_lock lock(arrivals->mutex);
     for (std::uint64_t seen = 0; !count || seen < *count;) {
         arrivals->changed.wait(lock, [&] { return arrivals->count > seen; });
         ++seen;
-        std::cout << printable(name) << std::endl;
+        std::cout << printable(name) << '\n' << std::flush;
         if (!std::cout) return ExitStatus::failure;
     }
     return ExitStatus::success;

@@ -22,7 +22,7 @@ int main(int argc, char** argv) {
     // The client's own log lines would only stand between a person and the answer.
     if (std::getenv(platform::linux_::logEnvironmentVariable) != nullptr)
         platform::setSystemLog(platform::linux_::SystemLog::ofProcess());
-    std::signal(SIGPIPE, SIG_IGN);
+    (void)std::signal(SIGPIPE, SIG_IGN);
 
     CLI::App app("Asks zbd, the plug-in daemon. Set NORDANE_ROOT to ask the one of a scratch platform.", "zbctl");
     app.set_version_flag("--version", "zbctl " ZBD_VERSION);
