@@ -49,7 +49,7 @@ std::optional<Options> parse(int argc, char** argv) {
 
 int main(int argc, char** argv) {
     // Never destroyed: the process ends inside the run loop, while other threads still run.
-    auto& services = *new platform::linux_::LinuxPlatform;
+    static auto& services = *new platform::linux_::LinuxPlatform;
     log::ops().info("zbd is launching");
     const auto options = parse(argc, argv);
     if (!options) {

@@ -3,6 +3,7 @@
 #include "platform/linux/Registry.h"
 #include "tests/support/BundleTree.h"
 #include "tests/support/LocaleFake.h"
+#include "tests/support/Sanitizers.h"
 #include "tests/support/ScratchDirectory.h"
 
 #include <condition_variable>
@@ -510,6 +511,7 @@ TEST_F(RegistryOnDisk, UnwatchedBundlesAreVerifiedWhenSomebodyAsks) {
 }
 
 TEST_F(RegistryOnDisk, NothingGoesForWantOfDescriptors) {
+    if (support::checkerNeedsDescriptors) GTEST_SKIP() << "the checker needs descriptors itself";
     writeApplication(app, {"a"});
     start();
     rlimit before{};

@@ -1,3 +1,4 @@
+#include "tests/support/AbortMessages.h"
 #include "tests/support/FakePlatform.h"
 #include "zbd/ZBDAnnotationStore.h"
 #include "zbd/ZBDPlugIn.h"
@@ -110,7 +111,8 @@ TEST_F(AnnotationStore, GivenPathIsTakenAsWritten) {
 
 TEST_F(AnnotationStore, ContainerFailureEndsTheProcess) {
     fake.containers.failure = 13;
-    EXPECT_DEATH(open(), "unable to locate user container: error 13|");
+    support::printLogWhenAborted();
+    EXPECT_DEATH(open(), "failed to get storage container: error=13[^|]*unable to locate user container: error 13");
     fake.files.files[defaultPath] = xml(Dictionary{{"version", 16}});
     EXPECT_TRUE(open()) << "not asked for when the file loads";
 }
@@ -141,6 +143,34 @@ TEST_F(AnnotationStore, ReplacingPlugInSharesTheAnnotation) {
     // A value that is no identifier replaces nothing.
     EXPECT_EQ(plugIn("other", Dictionary{{"com.nordane.developer.replace-plugin", true}})->annotationKey(),
               "com.example.other");
+}
+
+TEST_F(AnnotationStore, WhatNoFileCanHoldIsNotTaken) {
+    auto store = open();
+    store->setAnnotation(Dictionary{{"election", 1}}, *plugIn("a"));
+    Value deep = 1;
+    for (std::size_t i = 0; i < platform::maximumNesting; ++i) deep = platform::Array{deep};
+    for (const Value& bad : {Value(platform::UUID::random()), Value("\x01"), deep}) {
+        processLog.clear();
+        store->setAnnotation(Dictionary{{"extension", Dictionary{{"k", bad}}}}, *plugIn("a"));
+        EXPECT_TRUE(logged(LogLevel::error, "unable to save annotations:file:///var/db/Zembra-Annotations error:"));
+        EXPECT_EQ(store->annotationForIdentifier("com.example.a"), (Dictionary{{"election", 1}}));
+    }
+    store->setAnnotation(Dictionary{{"election", 2}}, *plugIn("b"));
+    EXPECT_EQ(stored().dictionary("data")->size(), 2U) << "others are saved on";
+
+    // A file that could not be read back is not written.
+    const std::string large(ZBDAnnotationStore::maximumFileSize, 'x');
+    store->setAnnotation(Dictionary{{"extension", Dictionary{{"k", large}}}}, *plugIn("a"));
+    EXPECT_EQ(store->annotationForIdentifier("com.example.a"), (Dictionary{{"election", 1}}));
+}
+
+TEST_F(AnnotationStore, UnreadableFileIsReset) {
+    fake.files.readFailure =
+        platform::Error{platform::fileErrorDomain, platform::fileReadNoPermissionCode, "forbidden"};
+    EXPECT_TRUE(open()->annotations().empty());
+    EXPECT_TRUE(logged(LogLevel::error, "unable to load annotation database:file:///var/db/Zembra-Annotations "
+                                        "error:forbidden (resetting)"));
 }
 
 TEST_F(AnnotationStore, UnsavedChangeGoesOutWithTheNext) {

@@ -278,6 +278,7 @@ TEST_F(Database, RegistrationReportsTheRegistrysRefusal) {
     EXPECT_EQ(database->removePlugIn(url), (platform::Error{"Zembra", 2, "Catalix failed to deregister the plug-in"}));
     fake.registry.allowRegistration();
     EXPECT_FALSE(database->addPlugIn(url));
+    EXPECT_FALSE(database->removePlugIn(url));
 }
 
 TEST_F(Database, BuildingOffTheQueueStopsTheProcess) {

@@ -57,6 +57,8 @@ TEST_F(PlugIn, TakesItsFactsFromTheProxy) {
     EXPECT_EQ(plugIn->localizedContainingName(), Value("A"));
     EXPECT_EQ(plugIn->originalIdentifier(), Value("com.example.original"));
     EXPECT_EQ(plugIn->entitlements(), (Dictionary{{"e", true}}));
+    EXPECT_EQ(plugIn->dataContainerURL(), proxy.dataContainerURL);
+    EXPECT_EQ(plugIn->plugInDictionary(), proxy.plugInDictionary);
     EXPECT_EQ(plugIn->containingPath(), Value("/Applications/A.app"));
     EXPECT_FALSE(plugIn->onSystemVolume());
     EXPECT_EQ(plugIn->localizedFilevaneActionNames(), Dictionary());
@@ -158,6 +160,55 @@ TEST_F(PlugIn, GoneFromTheRegistryItKeepsItsFactsAndHasNoManifest) {
     EXPECT_EQ(plugIn->infoKey("VBBundleVersion"), Value("1"));
 }
 
+TEST_F(PlugIn, WithoutUUIDEachRecordHasItsOwnAndIsFoundByLocation) {
+    auto proxy = data();
+    proxy.uuid.reset();
+    const auto first = make(proxy);
+    const auto second = make(proxy);
+    ASSERT_TRUE(first && second);
+    EXPECT_NE(first->uuid(), second->uuid());
+    EXPECT_EQ(first->infoKey("VBBundleVersion"), Value("1"));
+    EXPECT_TRUE(processLog.contains(LogLevel::standard, "cx",
+                                    "Failed to find Plugin by " + first->uuid()->text() + " fallback to path " +
+                                        proxy.bundleURL->absoluteString()));
+}
+
+TEST_F(PlugIn, KeptFormAndTokensFollowTheRegistry) {
+    for (const char* category : {"cx", "sandbox"}) processLog.setLevel(category, LogLevel::info);
+    auto proxy = code("ext", ".appex");
+    fake.sandbox.allowFile(proxy.bundleURL->path());
+    fake.sandbox.services.insert("com.example.ext");
+    const auto plugIn = make(proxy);
+    const auto form = [&] {
+        auto current = plugIn->currentForm(nullptr);
+        plugIn->augmentForm(current);
+        return current;
+    };
+    const auto first = form();
+    auto second = form();
+    EXPECT_EQ(first, second);
+    EXPECT_EQ(first, [&] {
+        auto exported = plugIn->exportForm(nullptr);
+        plugIn->augmentForm(exported);
+        return exported;
+    }());
+    second.set("identifier", "changed");
+    EXPECT_EQ(form(), first) << "each caller has its own";
+
+    fake.sandbox.issueError = 13; // kept tokens are not asked for again, until the registry knows more
+    EXPECT_EQ(form(), first);
+    auto info = platform::MutableDictionary::copyOf(*proxy.infoDictionary);
+    info.set("VBBundleVersion", "2");
+    proxy.infoDictionary = info;
+    fake.registry.install(proxy);
+    const auto third = form();
+    EXPECT_EQ(third.dictionary("bundleInfo")->string("VBBundleVersion"), "2");
+    EXPECT_EQ(third.dictionary("extensions"), Dictionary());
+    plugIn->setLocalizedName("Neu");
+    EXPECT_EQ(form()["localizedDisplayName"], Value("Neu"));
+    for (const char* category : {"cx", "sandbox"}) processLog.setLevel(category, LogLevel::debug);
+}
+
 TEST_F(PlugIn, EntitlementsCountUnlessFalse) {
     auto proxy = data();
     proxy.entitlements = Dictionary{{"true", true}, {"false", false}, {"zero", 0}, {"text", "NO"}, {"array", Array()}};
@@ -211,7 +262,8 @@ TEST_F(PlugIn, FormCarriesTheTokensThatTheSandboxGrants) {
 
     const auto form = share(Array{"Fonts", 7, "Sounds", ".", "link"});
     std::vector<std::string> resources;
-    for (const auto& entry : *form.dictionary("extensions")) resources.emplace_back(entry.name());
+    const Dictionary extensions = *form.dictionary("extensions");
+    for (const auto& entry : extensions) resources.emplace_back(entry.name());
     EXPECT_EQ(resources, (std::vector<std::string>{"Fonts", "."}));
     EXPECT_TRUE(form.contains("service-extension"));
     EXPECT_TRUE(processLog.contains(LogLevel::info, "ops",
@@ -231,7 +283,11 @@ TEST_F(PlugIn, FormCarriesTheTokensThatTheSandboxGrants) {
 
 TEST_F(PlugIn, ApplicationExtensionSharesItsWholeBundle) {
     auto proxy = code("ext", ".appex");
-    fake.sandbox.allowFile(proxy.bundleURL->path());
+    const std::string path = proxy.bundleURL->path();
+    for (const char* file : {"", "/Fonts", "/Sounds"}) fake.sandbox.allowFile(path + file);
+    auto info = platform::MutableDictionary::copyOf(*proxy.infoDictionary);
+    info.set("VKExtension", Dictionary{{"VKExtensionAttributes", Dictionary()}, {"Shared", Array{"Fonts", "Sounds"}}});
+    proxy.infoDictionary = info;
     platform::MutableDictionary form;
     make(proxy)->augmentForm(form);
     ASSERT_EQ(form.dictionary("extensions")->size(), 1U);

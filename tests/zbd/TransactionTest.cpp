@@ -1,5 +1,7 @@
+#include "zbd/Transaction.h"
 #include "Zembra/ZBDaemonClient.h"
 #include "tests/support/FakeDaemon.h"
+#include "zbd/ZBDQmxClient.h"
 
 #include <gtest/gtest.h>
 
@@ -159,6 +161,74 @@ TEST_F(Transaction, FindOfAVanishedPlugInLogsAndSendsWhatThereIs) {
                          line.message.starts_with("failed to export matching plug-in " + a->uuid->text() + ": "));
     }
     EXPECT_TRUE(isLogged);
+}
+
+/// The walk over "uuids" has no request of its own yet, so it is called as a handler would.
+struct UUIDWalk : Transaction {
+    std::vector<std::string> walked;
+
+    /// The reply's error when the walk failed; an empty dictionary when every plug-in was visited.
+    Dictionary walk(MutableDictionary message, std::size_t stopAfter = 100) {
+        walked.clear();
+        const auto [host, accepted] =
+            daemon.fake.transport.makePair(daemon.peer, daemon.fake.queues.makeSerial("host"));
+        const auto client = zbd::ZBDQmxClient::initWithConnection(accepted, daemon.server);
+        const auto transaction = zbd::Transaction::initWithRequest({message, nullptr}, client);
+        const bool isComplete = transaction->processUuidList([&](const zbd::ZBDPlugInRef& plugIn) {
+            walked.emplace_back(*plugIn->identifier().string());
+            return walked.size() < stopAfter;
+        });
+        EXPECT_EQ(isComplete, transaction->reply().empty() && walked.size() < stopAfter);
+        return transaction->reply();
+    }
+    static bool logged(LogLevel level, const std::string& text) { return processLog.contains(level, "traffic", text); }
+};
+
+TEST_F(UUIDWalk, VisitsPlugInsByUUIDOrElseByPath) {
+    const auto a = daemon.fake.registry.install(dataPlugIn("a"));
+    const auto b = daemon.fake.registry.install(dataPlugIn("b"));
+    const UUID unknown = UUID::random();
+    const std::string path = b->bundleURL->path();
+    using Names = std::vector<std::string>;
+
+    EXPECT_EQ(walk({{"uuids", Array{*a->uuid, *b->uuid}}}), succeeded);
+    EXPECT_EQ(walked, (Names{"com.example.a", "com.example.b"}));
+    EXPECT_EQ(walk({{"uuids", Array()}}), succeeded);
+    EXPECT_EQ(walk({{"uuids", Array{*a->uuid, unknown}}, {"paths", Array{"/nowhere", path}}}), succeeded);
+    EXPECT_EQ(walked, (Names{"com.example.a", "com.example.b"}));
+    EXPECT_TRUE(logged(LogLevel::info, "Failed to find plugin by " + unknown.text()));
+    EXPECT_TRUE(logged(LogLevel::info, "Looking for plugin " + unknown.text() + " by path " + path));
+
+    walk({{"uuids", Array{*a->uuid, *b->uuid}}}, 1);
+    EXPECT_EQ(walked, (Names{"com.example.a"})) << "the callback may stop it";
+}
+
+TEST_F(UUIDWalk, AnswersWhatItCannotWalk) {
+    const auto a = daemon.fake.registry.install(dataPlugIn("a"));
+    const UUID unknown = UUID::random();
+    const Dictionary noList = errorReply(4, "invalid request format (uuid)");
+    const Dictionary badElement = errorReply(4, "invalid request (bad uuid array)");
+    const Dictionary notFound = errorReply(4, "no such plugin (uuid not found)");
+    const struct {
+        MutableDictionary message;
+        Dictionary reply;
+        std::size_t walked;
+    } cases[] = {
+        {{}, noList, 0},
+        {{{"uuids", *a->uuid}}, noList, 0},
+        {{{"uuids", Array{*a->uuid, a->uuid->text()}}}, badElement, 1},
+        {{{"uuids", Array{*a->uuid, unknown, *a->uuid}}}, notFound, 1},
+        {{{"uuids", Array{unknown}}, {"paths", Array{7}}}, notFound, 0},
+        {{{"uuids", Array{unknown}}, {"paths", Array{"/nowhere"}}}, notFound, 0},
+        {{{"uuids", Array{unknown}}, {"paths", a->bundleURL->path()}}, notFound, 0},
+        {{{"uuids", Array{unknown, unknown}}, {"paths", Array{a->bundleURL->path()}}}, notFound, 0},
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(walk(c.message), c.reply) << Value(c.message).description();
+        EXPECT_EQ(walked.size(), c.walked);
+    }
+    EXPECT_TRUE(logged(LogLevel::standard, "Paths present but not an array (ignoring values)"));
+    EXPECT_TRUE(logged(LogLevel::standard, "Paths present but has different count than UUIDs (ignoring)"));
 }
 
 } // namespace
