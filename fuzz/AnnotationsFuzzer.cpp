@@ -1,6 +1,7 @@
 // The annotation file: whatever it holds, the store opens, takes a change, and the file can be read back.
 #include "tests/support/FakePlatform.h"
 #include "zbd/ZBDAnnotationStore.h"
+#include "zbd/ZBDPlugIn.h"
 
 #include <cstdint>
 #include <cstdlib>

@@ -1,5 +1,4 @@
 #include "Zembra/ZBDaemonClient.h"
-#include "tests/support/AbortMessages.h"
 #include "tests/support/SystemLogFake.h"
 #include "tests/support/TransportFake.h"
 #include "tests/support/WorkQueueFake.h"
@@ -189,7 +188,7 @@ TEST(ErrorInReply, FollowsCodeAndText) {
 }
 
 TEST(ErrorInReplyDeathTest, ATextWithoutACodeStopsTheProcess) {
-    support::printLogWhenAborted();
+    support::processLog.print();
     EXPECT_DEATH((void)ZBDaemonClient::errorInReply(Dictionary{{"error", "odd"}}),
                  "zbd reported error without a code: odd");
 }

@@ -1,5 +1,4 @@
 #include "Zembra/ZBPlugInCore.h"
-#include "tests/support/AbortMessages.h"
 #include "tests/support/RegistryFake.h"
 #include "tests/support/SystemLogFake.h"
 
@@ -91,7 +90,7 @@ TEST(EqualityDeathTest, WithoutUuidStopsTheProcess) {
     const auto with = ZBPlugInCore::initWithName("org.example.a", extensionURL, Value(), Value(), std::nullopt);
     const ZBPlugInCore without;
     EXPECT_FALSE(*with == without);
-    support::printLogWhenAborted();
+    support::processLog.print();
     EXPECT_DEATH((void)without.isEqual(*with), "self.uuid");
     EXPECT_DEATH((void)without.hash(), "self.uuid");
 }
@@ -103,7 +102,7 @@ TEST(OldStyleDeathTest, FollowsTheManifestDictionary) {
     plugIn.setBundleInfoDictionary(Dictionary{{"Zembra", Dictionary()}});
     EXPECT_TRUE(plugIn.oldStyle());
     plugIn.setBundleInfoDictionary(Dictionary());
-    support::printLogWhenAborted();
+    support::processLog.print();
     EXPECT_DEATH((void)plugIn.oldStyle(), "unknown plug-in configuration style");
 }
 

@@ -2,6 +2,8 @@
 
 #include "platform/SystemLog.h"
 
+#include <atomic>
+#include <cstdio>
 #include <deque>
 #include <map>
 #include <mutex>
@@ -93,6 +95,8 @@ public:
             if (line.level == level && line.category == category && line.message == message) return true;
         return false;
     }
+    /// From now on lines go to standard error too, where a death test can match them.
+    void print() { _isPrinting = true; }
     void clear() {
         const std::lock_guard guard(_lock);
         _lines.clear();
@@ -104,11 +108,13 @@ private:
         return found == _levels.end() ? _level : found->second;
     }
     void write(const platform::LogRecord& record) noexcept override {
+        if (_isPrinting) std::fprintf(stderr, "%s\n", std::string(record.message).c_str());
         const std::lock_guard guard(_lock);
         _lines.push_back(
             {std::string(record.category), record.level, std::string(record.message), std::string(record.format)});
     }
 
+    std::atomic<bool> _isPrinting = false;
     mutable std::mutex _lock; // guards what follows, the default handle aside
     std::deque<platform::LogHandle> _handles;
     std::set<std::string> _refused;

@@ -1,4 +1,3 @@
-#include "tests/support/AbortMessages.h"
 #include "tests/support/FakePlatform.h"
 #include "zbd/ZBDAnnotationStore.h"
 #include "zbd/ZBDPlugIn.h"
@@ -111,8 +110,8 @@ TEST_F(AnnotationStore, GivenPathIsTakenAsWritten) {
 
 TEST_F(AnnotationStore, ContainerFailureEndsTheProcess) {
     fake.containers.failure = 13;
-    support::printLogWhenAborted();
-    EXPECT_DEATH(open(), "failed to get storage container: error=13[^|]*unable to locate user container: error 13");
+    EXPECT_DEATH((processLog.print(), open()),
+                 "failed to get storage container: error=13[^|]*unable to locate user container: error 13");
     fake.files.files[defaultPath] = xml(Dictionary{{"version", 16}});
     EXPECT_TRUE(open()) << "not asked for when the file loads";
 }
