@@ -247,7 +247,7 @@ void StreamConnection::sendWithReply(const Dictionary& message, std::shared_ptr<
         }
     }
     // Not on the caller's thread: it may hold locks that the handler takes.
-    if (error) queue->async([handler = std::move(handler), error = std::move(*error)] { handler(error); });
+    if (error) queue->async([hear = std::move(handler), problem = std::move(*error)] { hear(problem); });
 }
 
 void StreamConnection::forgetRequest(std::uint64_t id) {
