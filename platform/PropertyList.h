@@ -164,6 +164,7 @@ public:
                  requires(const Range& range) { Value(*range.begin()); })
     static Array of(const Range& range) {
         std::vector<Value> values;
+        if constexpr (requires { range.size(); }) values.reserve(range.size());
         for (const auto& element : range) values.emplace_back(element);
         return Array(std::move(values));
     }

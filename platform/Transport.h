@@ -44,16 +44,21 @@ public:
 struct ReceivedMessage {
     Value content;
     std::shared_ptr<ReplyToken> reply; // absent when the sender expects no reply
+    // Keeps the message's place among those that its sender has waiting here; the last copy gives it up.
+    std::shared_ptr<const void> place = nullptr;
 };
 
 /// The one reply to a request, to be filled and sent.
 struct ReplyMessage {
     MutableDictionary content;
     std::shared_ptr<ReplyToken> token;
+    std::shared_ptr<const void> place = nullptr; // the request's
 };
 
 /// The create-reply operation: an empty reply that goes to whoever waits for this request.
-inline ReplyMessage createReply(const ReceivedMessage& request) { return {MutableDictionary(), request.reply}; }
+inline ReplyMessage createReply(const ReceivedMessage& request) {
+    return {MutableDictionary(), request.reply, request.place};
+}
 
 using ConnectionEvent = std::variant<ReceivedMessage, TransportError>;
 /// A reply, or the error in its place.

@@ -112,6 +112,7 @@ bool Transaction::marshalPaths(const PathCallback& callback) {
         return false;
     }
     for (const Value& element : *paths) {
+        if (!_client->acceptWork()) return false; // nobody is left to answer
         const auto text = element.string();
         if (!text) {
             fail(code::malformed, "invalid request format");

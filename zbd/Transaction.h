@@ -35,7 +35,7 @@ public:
     /// dropped, unless its version already refused it.
     void dispatch();
 
-    // The walks over a request's plug-in list. One that returns false has answered.
+    // The walks over a request's plug-in list. One that returns false has answered, or has nobody to answer.
     bool marshalPaths(const PathCallback& callback);
     /// As `marshalPaths`; when every path was processed the success reply has been sent.
     bool processPaths(const PathCallback& callback);

@@ -66,7 +66,8 @@ int main(int argc, char** argv) {
     server->setCacheLimit(options->cacheLimit);
     const auto terminate = platform.runLoop.makeSignalSource(SIGTERM, [&server] {
         server->stop();
-        std::exit(EXIT_SUCCESS);
+        // Without exit handlers: those of libraries take away what other threads are still using.
+        std::_Exit(EXIT_SUCCESS);
     });
     terminate->activate();
     server->run();

@@ -94,8 +94,9 @@ bool BundleScanner::visitResources(int directory, const std::string& path, FileS
         for (const auto& table : tables) {
             states.add(folder.get(), table);
             if (content == nullptr) continue;
-            const auto bytes = readFile(folder.get(), table, maximumManifestSize);
             *content += language + "/" + table + "=";
+            if (content->size() >= maximumTablesSize) continue;
+            const auto bytes = readFile(folder.get(), table, maximumManifestSize);
             if (bytes && *bytes) *content += **bytes;
         }
     }

@@ -18,6 +18,10 @@ inline constexpr std::size_t maximumManifestSize = 1U << 20U;
 /// Languages of a bundle, and string tables of a language, that are looked at.
 inline constexpr std::size_t maximumResourceEntries = 256;
 
+/// What is read of a bundle's string tables to tell whether they changed. Those beyond are only listed, so that a
+/// bundle of many large tables costs neither memory nor time.
+inline constexpr std::size_t maximumTablesSize = std::size_t{4} << 20U;
+
 enum class BundleKind { application, plugIn };
 
 struct ScannedBundle {

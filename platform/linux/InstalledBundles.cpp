@@ -18,6 +18,8 @@ constexpr std::string_view plugInsName = "PlugIns";
 constexpr std::size_t maximumFolderDepth = 4;
 /// Each registration by path is looked at with every change on disk.
 constexpr std::size_t maximumRegistrations = 4096;
+/// Every directory on the way to one is watched, and walking there takes time for each.
+constexpr std::ptrdiff_t maximumRegistrationDepth = 64;
 constexpr const char* everything = ""; // every path is below it
 
 LogHandle& cx() {
@@ -165,6 +167,10 @@ bool InstalledBundles::registerPlugIn(const std::string& path, const Tell& tell)
         cx().error("too many plug-ins are registered by path");
         return false;
     }
+    if (std::ranges::count(path, '/') > maximumRegistrationDepth) {
+        cx().error("the plug-in at %@ lies too deep to be followed", path);
+        return false;
+    }
     if (!_registrations.insert(path).second) return false; // awaited, and still not there
     _unsavedRegistrations.insert(path);
     tell(rescan({path}, Manifests::maybeBeingWritten));
@@ -172,6 +178,7 @@ bool InstalledBundles::registerPlugIn(const std::string& path, const Tell& tell)
     _registrations.erase(path);
     _unsavedRegistrations.insert(path);
     save();
+    tell(rescan({path}, Manifests::maybeBeingWritten)); // gives up what the search watches
     return false;
 }
 
@@ -545,12 +552,13 @@ void InstalledBundles::identify(std::vector<std::shared_ptr<InstalledPlugIn>> ad
     }
     takeFrom(gone, isSameDirectory);
     takeFrom(gone, isSamePlace);
+    std::set<UUID> taken; // one directory may be met at two paths while it moves
     for (const auto& plugIn : added) {
         const auto candidates = _store.removedPlugIns(plugIn->facts->identity, plugIn->path);
         auto before = std::ranges::find_if(candidates, [&](const auto& one) { return isSameDirectory(*plugIn, one); });
         if (before == candidates.end())
             before = std::ranges::find_if(candidates, [&](const auto& one) { return isSamePlace(*plugIn, one); });
-        if (before == candidates.end() || isInUse(before->uuid)) continue;
+        if (before == candidates.end() || isInUse(before->uuid) || !taken.insert(before->uuid).second) continue;
         become(*plugIn, *before);
         _unsavedReturned.push_back(before->uuid);
     }

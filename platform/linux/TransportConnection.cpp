@@ -257,6 +257,13 @@ void StreamConnection::forgetRequest(std::uint64_t id) {
     updateInterest();
 }
 
+void StreamConnection::forgetSilentMessage() {
+    const std::lock_guard lock(_mutex);
+    --_waitingSilently;
+    updatePause();
+    updateInterest();
+}
+
 bool StreamConnection::appendOut(FrameType type, std::uint64_t id, const Value& content) {
     return appendFrame(_out, type, id, content);
 }
@@ -309,8 +316,8 @@ void StreamConnection::closeSocket() {
 void StreamConnection::updatePause() {
     if (!isAccepted() || _state != State::open) return;
     if (!_paused) {
-        _paused = _waiting.size() >= maximumWaitingRequests || unsent() > pauseUnsentBytes;
-    } else if (_waiting.size() <= resumeWaitingRequests && unsent() <= resumeUnsentBytes) {
+        _paused = _waiting.size() + _waitingSilently >= maximumWaitingRequests || unsent() > pauseUnsentBytes;
+    } else if (_waiting.size() + _waitingSilently <= resumeWaitingRequests && unsent() <= resumeUnsentBytes) {
         _paused = false;
         _loop->post([connection = self()] { connection->onTurn(); }); // buffered frames give no event
     }
@@ -526,6 +533,8 @@ bool StreamConnection::deliverRequest(const Frame& frame, bool moreFollow) {
         if (expectsReply) {
             isDuplicate = std::find(_waiting.begin(), _waiting.end(), frame.id) != _waiting.end();
             if (!isDuplicate) _waiting.push_back(frame.id);
+        } else {
+            ++_waitingSilently;
         }
         _gathering = moreFollow;
         handler = _handler;
@@ -539,9 +548,15 @@ bool StreamConnection::deliverRequest(const Frame& frame, bool moreFollow) {
         malformed(content.error().text().c_str());
         return true;
     }
-    std::shared_ptr<ReplyToken> token;
-    if (expectsReply) token = std::make_shared<Token>(self(), frame.id);
-    deliverEvent(handler, ReceivedMessage{*std::move(content), std::move(token)});
+    ReceivedMessage message{*std::move(content), nullptr};
+    if (expectsReply) {
+        message.reply = std::make_shared<Token>(self(), frame.id);
+    } else {
+        message.place = std::shared_ptr<const void>(nullptr, [weak = std::weak_ptr(self())](const void*) {
+            if (const auto connection = weak.lock()) connection->forgetSilentMessage();
+        });
+    }
+    deliverEvent(handler, message);
     return true;
 }
 

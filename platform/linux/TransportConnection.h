@@ -121,6 +121,7 @@ private:
     Remains takeRemains();
 
     void forgetRequest(std::uint64_t id);
+    void forgetSilentMessage();
 
     const std::shared_ptr<Loop> _loop;
     const std::string _directory; // connecting ends only, as the next two
@@ -151,6 +152,7 @@ private:
     std::uint32_t _interest = 0;
     std::string _out;
     std::size_t _outSent = 0;
+    std::size_t _waitingSilently = 0;    // delivered messages without reply that somebody still holds
     std::vector<std::uint64_t> _waiting; // ids of delivered requests without a reply; a handful
     std::uint64_t _nextId = 1;
     std::map<std::uint64_t, PendingReply> _pending;
