@@ -7,7 +7,6 @@
 namespace zembra {
 
 using platform::Array;
-using platform::Connection;
 using platform::ConnectionEvent;
 using platform::Dictionary;
 using platform::Failure;

@@ -4,6 +4,8 @@
 #include "Zembra/ZBManifest.h"
 #include "Zembra/ZBUtilities.h"
 
+#include <utility>
+
 namespace zembra {
 
 using platform::Array;
@@ -36,7 +38,7 @@ const Dictionary& formLayout() {
 
 /// The dictionary; or, where a form brought in another kind of value, that value as it came.
 Value dictionaryOr(const std::optional<Dictionary>& dictionary, Value asItCame) {
-    return dictionary ? Value(*dictionary) : asItCame;
+    return dictionary ? Value(*dictionary) : std::move(asItCame);
 }
 
 } // namespace

@@ -31,6 +31,8 @@ std::optional<Options> parse(int argc, char** argv) {
     // The plus sign lets the first operand end the options, whatever the environment says.
     while ((letter = getopt(argc, argv, "+c:d:S:v")) != -1) {
         switch (letter) {
+        // Leading digits count and anything else is 0, as administrators know it.
+        // NOLINTNEXTLINE(cert-err34-c)
         case 'c': options.cacheLimit = static_cast<std::uint32_t>(std::atoi(optarg)); break;
         case 'd': options.database = optarg; break;
         case 'S': options.service = optarg; break;

@@ -1,7 +1,7 @@
 #include "platform/TracePoints.h"
 
 // Each point gets a counter that tracers raise while they listen.
-// NOLINTNEXTLINE(bugprone-reserved-identifier): the name that sys/sdt.h asks for
+// NOLINTNEXTLINE(bugprone-reserved-identifier,cert-dcl37-c,cert-dcl51-cpp): the name that sys/sdt.h asks for
 #define _SDT_HAS_SEMAPHORES 1
 #include <sys/sdt.h>
 
