@@ -247,6 +247,7 @@ void StreamConnection::sendWithReply(const Dictionary& message, std::shared_ptr<
         }
     }
     // Not on the caller's thread: it may hold locks that the handler takes.
+    // NOLINTNEXTLINE(bugprone-use-after-move): it was moved only where there is no error
     if (error) queue->async([hear = std::move(handler), problem = std::move(*error)] { hear(problem); });
 }
 
