@@ -1,15 +1,13 @@
 #include "platform/linux/Entitlements.h"
 
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/FileTrust.h"
 #include "platform/linux/ProcPath.h"
 #include "platform/linux/SystemError.h"
 
 #include <cerrno>
 #include <fcntl.h>
-#include <linux/magic.h>
 #include <sys/stat.h>
-#include <sys/statvfs.h>
-#include <sys/vfs.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -24,15 +22,6 @@ bool isPrivileged() { return geteuid() == 0; }
 /// shows in the group's bits.
 bool belongsTo(const struct stat& status, uid_t owner) {
     return S_ISREG(status.st_mode) && status.st_uid == owner && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
-}
-
-/// True where owner and attribute are the kernel's own word and not that of whoever brought the file system: an
-/// ordinary user may mount a FUSE file system or a stick with files of any owner and attribute, but only with nosuid.
-/// What is in memory alone was made on this machine, so nosuid, usual there, does not matter.
-bool isTrustedFileSystem(int descriptor) {
-    struct statfs status{};
-    if (fstatfs(descriptor, &status) != 0) return false;
-    return status.f_type == TMPFS_MAGIC || (status.f_flags & ST_NOSUID) == 0;
 }
 
 /// Empty attributes count as broken, so an empty text stands for "none".

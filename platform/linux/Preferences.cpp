@@ -113,7 +113,7 @@ Value Preferences::value(const std::string& domain, const std::string& key) {
 }
 
 Result<Preferences::Stored> Preferences::read(const std::string& domain) const {
-    const auto directory = openUserDirectory(_root, _user, {directoryName}, MissingDirectory::refused);
+    const auto directory = openUserDirectory(_root.users(), _user, {directoryName}, MissingDirectory::refused);
     if (!directory) return directory.error();
     const std::string place = path(domain);
     // Not blocking, should it be a pipe; not through a link, which could lead to a file that others write.
@@ -141,7 +141,7 @@ Failure Preferences::setValue(const std::string& domain, const std::string& key,
     for (const auto& name : {domain, fileName(domain)}) {
         if (const int number = pathComponentError(name)) return systemError(number, "preferences domain");
     }
-    const auto directory = openUserDirectory(_root, _user, {directoryName}, MissingDirectory::made);
+    const auto directory = openUserDirectory(_root.users(), _user, {directoryName}, MissingDirectory::made);
     if (!directory) return directory.error();
     // Held from reading to writing, so that two writers do not undo each other; ends with the descriptor.
     while (::flock(directory->get(), LOCK_EX) != 0) {

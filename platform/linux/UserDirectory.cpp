@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
-#include <string>
 #include <sys/stat.h>
 
 namespace platform::linux_ {
@@ -15,15 +14,22 @@ namespace {
 constexpr std::size_t maximumComponent = 255; // NAME_MAX of the file systems in use
 constexpr int openFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
 
-/// The directory that holds the users' private ones. Made by the superuser it lets every user add their own, as /tmp
-/// does: a squatted private directory is of no use, because its owner is checked.
-Result<Descriptor> openUsersDirectory(const Root& root, uid_t user, MissingDirectory missing) {
-    const std::string path = root.users();
+} // namespace
+
+int pathComponentError(std::string_view name) {
+    if (name.empty() || name == "." || name == "..") return EINVAL;
+    const auto forbidden = [](char c) { return c == '/' || static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
+    if (std::any_of(name.begin(), name.end(), forbidden)) return EINVAL;
+    return name.size() > maximumComponent ? ENAMETOOLONG : 0;
+}
+
+Result<Descriptor> openUsersDirectory(const std::string& path, uid_t user, MissingDirectory missing) {
     if (missing == MissingDirectory::made) {
         for (std::size_t end = path.find('/', 1); end != std::string::npos; end = path.find('/', end + 1)) {
             // A failure shows when the last directory is opened.
             static_cast<void>(::mkdir(path.substr(0, end).c_str(), 0755));
         }
+        // A squatted private directory in it is of no use, because its owner is checked.
         if (::mkdir(path.c_str(), 0755) == 0 && ::geteuid() == 0 && ::chmod(path.c_str(), 01777) != 0) {
             return systemError(errno, path);
         }
@@ -37,23 +43,14 @@ Result<Descriptor> openUsersDirectory(const Root& root, uid_t user, MissingDirec
     return directory;
 }
 
-} // namespace
+Result<Descriptor> openUserDirectory(const std::string& users, uid_t user,
+                                     std::initializer_list<std::string_view> components, MissingDirectory missing) {
+    auto opened = openUsersDirectory(users, user, missing);
+    if (!opened) return opened.error();
 
-int pathComponentError(std::string_view name) {
-    if (name.empty() || name == "." || name == "..") return EINVAL;
-    const auto forbidden = [](char c) { return c == '/' || static_cast<unsigned char>(c) < 0x20 || c == 0x7f; };
-    if (std::any_of(name.begin(), name.end(), forbidden)) return EINVAL;
-    return name.size() > maximumComponent ? ENAMETOOLONG : 0;
-}
-
-Result<Descriptor> openUserDirectory(const Root& root, uid_t user, std::initializer_list<std::string_view> components,
-                                     MissingDirectory missing) {
-    auto users = openUsersDirectory(root, user, missing);
-    if (!users) return users.error();
-
-    Descriptor directory = *std::move(users);
+    Descriptor directory = *std::move(opened);
     const std::string own = std::to_string(user);
-    std::string path = root.users();
+    std::string path = users;
     const auto enter = [&](const std::string& name) -> Failure {
         path += '/' + name;
         if (missing == MissingDirectory::made && ::mkdirat(directory.get(), name.c_str(), 0700) != 0 &&

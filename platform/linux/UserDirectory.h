@@ -2,9 +2,9 @@
 
 #include "platform/Error.h"
 #include "platform/linux/Descriptor.h"
-#include "platform/linux/Root.h"
 
 #include <initializer_list>
+#include <string>
 #include <string_view>
 #include <sys/types.h>
 
@@ -17,10 +17,16 @@ int pathComponentError(std::string_view name);
 
 enum class MissingDirectory { refused, made };
 
-/// Opens the directory `components` below the private directory of `user`. From that private directory on, every
-/// directory must be a real one (symbolic links are not followed), belong to `user` and be closed to everybody else;
-/// missing ones are made so. Errors carry errno; EPERM tells of a foreign owner, EACCES of an open mode.
-Result<Descriptor> openUserDirectory(const Root& root, uid_t user, std::initializer_list<std::string_view> components,
-                                     MissingDirectory missing);
+/// Opens `path`, a directory that holds a private one for every user, named by the user's id. It must belong to the
+/// superuser or to `user`, and others may add their own to it but not touch what is there (as in /tmp). A missing one
+/// is made, by the superuser for every user, else for the caller alone. Errors as below.
+Result<Descriptor> openUsersDirectory(const std::string& path, uid_t user, MissingDirectory missing);
+
+/// Opens the directory `components` below the private directory of `user` in the directory `users`. From that private
+/// directory on, every directory must be a real one (symbolic links are not followed), belong to `user` and be closed
+/// to everybody else; missing ones are made so. Errors carry errno; EPERM tells of a foreign owner, EACCES of an open
+/// mode.
+Result<Descriptor> openUserDirectory(const std::string& users, uid_t user,
+                                     std::initializer_list<std::string_view> components, MissingDirectory missing);
 
 } // namespace platform::linux_
