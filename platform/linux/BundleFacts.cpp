@@ -1,55 +1,93 @@
 #include "platform/linux/BundleFacts.h"
 
-#include <cstddef>
+#include "platform/linux/EncodedDictionary.h"
+
+#include <functional>
 #include <vector>
 
 namespace platform::linux_ {
 
 namespace {
 
-/// What a hostile bundle makes up shall not stay for ever.
-constexpr std::size_t maximumKeys = 4096;
+/// What is longer is a text for people, and stands in one manifest only.
+constexpr std::size_t maximumSharedString = 64;
 
 } // namespace
 
-Dictionary SharedKeys::share(const Dictionary& dictionary) {
+Dictionary SharedStrings::share(const Dictionary& dictionary) {
+    const std::lock_guard lock(_mutex);
+    return shareLocked(dictionary);
+}
+
+Dictionary SharedStrings::shareLocked(const Dictionary& dictionary) {
     std::vector<Dictionary::Entry> entries;
     entries.reserve(dictionary.size());
-    for (const auto& [key, value] : dictionary) {
-        const auto inner = value.dictionary();
-        entries.push_back({key, inner ? Value(share(*inner)) : value});
-    }
-    {
-        const std::lock_guard lock(_mutex);
-        for (auto& entry : entries) {
-            if (const auto known = _keys.find(entry.name()); known != _keys.end())
-                entry.key = known->second;
-            else if (_keys.size() < maximumKeys)
-                _keys.emplace(entry.name(), entry.key);
-        }
-    }
+    for (const auto& [key, value] : dictionary) entries.push_back({shareLocked(key), shareLocked(value)});
     return *Dictionary::fromUniqueEntries(std::move(entries));
 }
 
-StoredDictionary::StoredDictionary(const Dictionary& dictionary, SharedKeys& keys)
-    : _keys(keys), _dictionary(keys.share(dictionary)) {
-    std::call_once(_decoding, [] {});
+// NOLINTNEXTLINE(misc-no-recursion): decoders bound the nesting.
+Value SharedStrings::shareLocked(const Value& value) {
+    if (const auto dictionary = value.dictionary()) return shareLocked(*dictionary);
+    if (const auto array = value.array()) {
+        std::vector<Value> values;
+        values.reserve(array->size());
+        for (const auto& element : *array) values.push_back(shareLocked(element));
+        return Array(std::move(values));
+    }
+    const auto text = value.string();
+    if (!text || text->size() > maximumSharedString) return value;
+    Value& known = _strings[std::hash<std::string_view>()(*text) % _strings.size()];
+    if (known.string() != text) known = value;
+    return known;
 }
 
-const Dictionary& StoredDictionary::dictionary() const {
-    std::call_once(_decoding, [&] {
-        if (auto value = decodeCompact(_encoded, UUIDs::refused, maximumManifestNesting)) {
-            if (auto dictionary = value->dictionary()) _dictionary = _keys.share(*dictionary);
-        }
-        _encoded = std::string();
-    });
-    return _dictionary;
+Value StoredDictionary::content() const {
+    if (_isDecoded.load(std::memory_order_acquire)) return _content;
+    const std::lock_guard lock(_strings._mutex);
+    return _content;
+}
+
+Dictionary StoredDictionary::dictionary() const {
+    const Value content = this->content();
+    if (const auto dictionary = content.dictionary()) return *dictionary;
+    const auto value = decodeCompact(*content.data(), UUIDs::refused, maximumManifestNesting);
+    const auto decoded = value ? value->dictionary() : std::nullopt;
+    if (!decoded) return {};
+    if (_keeps == Keeps::encoding) return *decoded;
+    const std::lock_guard lock(_strings._mutex);
+    // Another thread may have been first.
+    if (!_isDecoded.load(std::memory_order_relaxed)) {
+        _content = _strings.shareLocked(*decoded);
+        _isDecoded.store(true, std::memory_order_release);
+    }
+    return *_content.dictionary();
 }
 
 std::string StoredDictionary::encoded() const {
+    const Value content = this->content();
+    if (const auto bytes = content.data()) return std::string(*bytes);
     std::string bytes;
-    appendCompact(bytes, dictionary());
+    appendCompact(bytes, content);
     return bytes;
+}
+
+Value StoredDictionary::find(std::initializer_list<std::string_view> names) const {
+    Value value = content();
+    if (!value.data()) {
+        for (const auto name : names) {
+            const auto dictionary = value.dictionary();
+            value = dictionary ? (*dictionary)[name] : Value();
+        }
+        return value;
+    }
+    auto encoded = value.data();
+    for (const auto name : names) {
+        encoded = findEncoded(*encoded, name);
+        if (!encoded) return {};
+    }
+    auto decoded = decodeCompact(*encoded, UUIDs::refused, maximumManifestNesting);
+    return decoded ? *std::move(decoded) : Value();
 }
 
 } // namespace platform::linux_

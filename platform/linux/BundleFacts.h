@@ -2,62 +2,79 @@
 
 #include "platform/PropertyList.h"
 
+#include <array>
+#include <atomic>
+#include <cstddef>
 #include <cstdint>
+#include <initializer_list>
 #include <memory>
 #include <mutex>
-#include <optional>
 #include <string>
 #include <string_view>
-#include <unordered_map>
 
 namespace platform::linux_ {
 
-/// Makes dictionaries hold the same key only once: all manifests have the same few, and in one after another they
-/// would take more memory than the values. Any thread.
-class SharedKeys {
+/// Makes dictionaries hold the same text only once: all manifests have the same keys and many of the same values, which
+/// in one after another would take more memory than what tells them apart. Any thread.
+class SharedStrings {
 public:
-    /// An equal dictionary.
+    /// An equal dictionary, in storage of its own that is no larger than it needs to be.
     Dictionary share(const Dictionary& dictionary);
 
 private:
+    friend class StoredDictionary;
+    Dictionary shareLocked(const Dictionary& dictionary);
+    Value shareLocked(const Value& value);
+
     std::mutex _mutex;
-    std::unordered_map<std::string_view, Value> _keys; // each under the text that it holds
+    /// Each text at the place that its hash names, where a later one takes over. So what many manifests hold is mostly
+    /// there, and what strangers make up does not stay.
+    std::array<Value, 4096> _strings;
 };
 
-/// A dictionary that came from the database, in its compact encoding until somebody asks for it: most manifests of a
-/// start are never looked at. Any thread.
+/// A dictionary of a bundle, in its compact encoding until somebody asks for it: most are never looked at. Any thread.
 class StoredDictionary {
 public:
-    // `keys` must outlive this.
-    StoredDictionary(const Dictionary& dictionary, SharedKeys& keys);
-    StoredDictionary(std::string encoded, SharedKeys& keys) : _keys(keys), _encoded(std::move(encoded)) {}
+    enum class Keeps {
+        encoding,        // however often it is asked for
+        whatWasAskedFor, // the dictionary in place of the encoding, once it was asked for
+    };
 
-    /// Empty when the stored bytes are damaged.
-    const Dictionary& dictionary() const;
+    // `strings` must outlive this.
+    StoredDictionary(std::string_view encoded, SharedStrings& strings, Keeps keeps)
+        : _strings(strings), _keeps(keeps), _content(Value::data(encoded)) {}
+
+    /// Empty when the stored bytes are damaged. Shares its storage with the next answer if that is what is kept.
+    Dictionary dictionary() const;
     /// The compact encoding.
     std::string encoded() const;
+    /// The value under `names[0]`, in that the one under `names[1]` and so on; absent when there is none. Decodes
+    /// nothing else, and keeps nothing.
+    Value find(std::initializer_list<std::string_view> names) const;
 
 private:
-    SharedKeys& _keys;
-    mutable std::once_flag _decoding;
-    mutable std::string _encoded; // given up when it is decoded
-    mutable Dictionary _dictionary;
+    Value content() const;
+
+    SharedStrings& _strings;
+    const Keeps _keeps;
+    mutable std::atomic<bool> _isDecoded = false; // then `_content` stays as it is
+    mutable Value _content;                       // the encoding as data, or the dictionary
 };
 
 /// Which directory it is: a directory that was replaced differs also when the new one got the old inode number.
-struct FileIdentity {
+struct DirectoryIdentity {
     std::uint64_t device = 0;
     std::uint64_t inode = 0;
     std::int64_t birth = 0; // nanoseconds since 1970; 0 where the file system keeps none
-    friend bool operator==(const FileIdentity&, const FileIdentity&) = default;
+    friend bool operator==(const DirectoryIdentity&, const DirectoryIdentity&) = default;
 };
 
 /// What the registry keeps of one bundle directory. Immutable but for `evidence`.
 struct BundleFacts {
-    FileIdentity identity;
+    DirectoryIdentity identity;
     /// A digest of the states (inode, size, times) of every file that was read. While the files still give the same
-    /// digest, nothing needs to be read again. 0: read again in any case. For the registry's own thread only.
-    mutable std::uint64_t evidence = 0;
+    /// digest, nothing needs to be read again. 0: read again in any case.
+    mutable std::atomic<std::uint64_t> evidence = 0;
     std::uint64_t fingerprint = 0; // a digest of the content: manifest, entitlements, string tables
     bool hasResources = false;     // most bundles have none, and need no look for localized names
     std::string executable;        // its file name; empty without one, and for applications, whose program is not read

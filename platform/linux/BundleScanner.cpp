@@ -30,6 +30,18 @@ std::uint64_t digest(std::string_view bytes) {
     return std::max<std::uint64_t>(value, 1); // 0 stands for "none"
 }
 
+/// Takes off `left` the values in `value`, itself included. False when there are more.
+// NOLINTNEXTLINE(misc-no-recursion): decoders bound the nesting.
+bool takeValues(std::size_t& left, const Value& value) {
+    if (left == 0) return false;
+    --left;
+    if (const auto array = value.array())
+        return std::ranges::all_of(*array, [&](const Value& element) { return takeValues(left, element); });
+    if (const auto dictionary = value.dictionary())
+        return std::ranges::all_of(*dictionary, [&](const auto& entry) { return takeValues(left, entry.value); });
+    return true;
+}
+
 /// Now, by the clock that files are stamped with.
 std::int64_t fileClock() {
     timespec now{};
@@ -43,15 +55,16 @@ std::int64_t fileClock() {
 /// recent and is read again another time.
 class BundleScanner::FileStates {
 public:
-    FileIdentity add(int directory, const std::string& name, int flags = 0) {
+    DirectoryIdentity add(int directory, const std::string& name, int flags = 0) {
         struct statx status{};
         if (statx(directory, name.c_str(), flags | AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &status) !=
             0) {
             _states += "absent";
             return {};
         }
-        const FileIdentity identity{(std::uint64_t{status.stx_dev_major} << 32U) | status.stx_dev_minor, status.stx_ino,
-                                    (status.stx_mask & STATX_BTIME) != 0 ? inNanoseconds(status.stx_btime) : 0};
+        const DirectoryIdentity identity{(std::uint64_t{status.stx_dev_major} << 32U) | status.stx_dev_minor,
+                                         status.stx_ino,
+                                         (status.stx_mask & STATX_BTIME) != 0 ? inNanoseconds(status.stx_btime) : 0};
         const std::int64_t changed = inNanoseconds(status.stx_ctime);
         append(_states, identity.device);
         append(_states, identity.inode);
@@ -76,18 +89,18 @@ private:
     bool _isRecent = false;
 };
 
-bool BundleScanner::visitResources(int directory, const std::string& path, FileStates& states,
-                                   std::string* content) const {
+bool BundleScanner::visitResources(int directory, const std::string& path, const Watch& watch, FileStates& states,
+                                   std::string* content) {
     const Descriptor resources = openDirectory(directory, resourcesName);
     if (!resources) return false;
     const std::string resourcesPath = path + "/" + resourcesName;
-    _watch(resources.get(), resourcesPath);
+    watch(resources.get(), resourcesPath);
     auto languages = listDirectory(resources.get()).value_or(DirectoryListing()).directories;
     if (languages.size() > maximumResourceEntries) languages.resize(maximumResourceEntries);
     for (const auto& language : languages) {
         const Descriptor folder = openDirectory(resources.get(), language);
         if (!folder) continue;
-        _watch(folder.get(), resourcesPath + "/" + language);
+        watch(folder.get(), resourcesPath + "/" + language);
         auto tables = listDirectory(folder.get()).value_or(DirectoryListing()).others;
         std::erase_if(tables, [](const auto& name) { return !name.ends_with(tableSuffix); });
         if (tables.size() > maximumResourceEntries) tables.resize(maximumResourceEntries);
@@ -103,20 +116,28 @@ bool BundleScanner::visitResources(int directory, const std::string& path, FileS
     return true;
 }
 
+bool BundleScanner::isUnchanged(int directory, const std::string& path, const BundleFacts& known, const Watch& watch) {
+    const std::uint64_t evidence = known.evidence;
+    if (evidence == 0) return false;
+    FileStates states;
+    const bool isSameDirectory = states.add(directory, "", AT_EMPTY_PATH) == known.identity;
+    states.add(directory, manifestName);
+    if (!known.executable.empty()) states.add(directory, known.executable);
+    // Where none were, the directory's own state tells that there are none.
+    if (known.hasResources) visitResources(directory, path, watch, states, nullptr);
+    return isSameDirectory && states.evidence() == evidence;
+}
+
+bool BundleScanner::isUnchanged(const std::string& path, const BundleFacts& known) const {
+    const Descriptor directory = openDirectory(path);
+    return directory && isUnchanged(directory.get(), path, known, [](int, const std::string&) {});
+}
+
 ScannedBundle BundleScanner::scan(int directory, const std::string& path, BundleKind kind,
                                   const BundleFactsRef& known) const {
     using State = ScannedBundle::State;
     _watch(directory, path);
-    if (known && known->evidence != 0) {
-        FileStates states;
-        const bool isSameDirectory = states.add(directory, "", AT_EMPTY_PATH) == known->identity;
-        states.add(directory, manifestName);
-        if (!known->executable.empty()) states.add(directory, known->executable);
-        // Where none were, the directory's own state tells that there are none.
-        if (known->hasResources) visitResources(directory, path, states, nullptr);
-        if (isSameDirectory && states.evidence() == known->evidence)
-            return {State::unchanged, {}, known->identity, known};
-    }
+    if (known && isUnchanged(directory, path, *known, _watch)) return {State::unchanged, {}, known->identity, known};
 
     FileStates states;
     auto facts = std::make_shared<BundleFacts>();
@@ -135,9 +156,17 @@ ScannedBundle BundleScanner::scan(int directory, const std::string& path, Bundle
     if (!value) return without(State::unusable, std::string(manifestName) + ": " + value.error().text());
     const auto info = value->dictionary();
     if (!info) return without(State::unusable, std::string(manifestName) + ": not a dictionary");
-    facts->info = std::make_shared<const StoredDictionary>(*info, _keys);
+    std::size_t left = maximumManifestValues + 1; // the manifest is a value itself
+    if (!takeValues(left, *info)) {
+        const std::string limit = std::to_string(maximumManifestValues);
+        return without(State::unusable, std::string(manifestName) + ": more than " + limit + " values");
+    }
     std::string content;
     appendCompact(content, *info);
+    // Few ask for an application's manifest, and then for a name in it.
+    facts->info = std::make_shared<const StoredDictionary>(
+        content, _strings,
+        kind == BundleKind::application ? StoredDictionary::Keeps::encoding : StoredDictionary::Keeps::whatWasAskedFor);
 
     const auto executable = info->string("VBBundleExecutable");
     if (kind == BundleKind::plugIn && executable && isFileName(*executable)) {
@@ -148,11 +177,13 @@ ScannedBundle BundleScanner::scan(int directory, const std::string& path, Bundle
         // Entitlements that cannot be read entitle to nothing.
         if (entitlements && *entitlements) {
             content += "entitlements=";
+            const std::size_t start = content.size();
             appendCompact(content, **entitlements);
-            facts->entitlements = std::make_shared<const StoredDictionary>(**entitlements, _keys);
+            facts->entitlements = std::make_shared<const StoredDictionary>(
+                std::string_view(content).substr(start), _strings, StoredDictionary::Keeps::whatWasAskedFor);
         }
     }
-    facts->hasResources = visitResources(directory, path, states, &content);
+    facts->hasResources = visitResources(directory, path, _watch, states, &content);
     facts->evidence = states.evidence();
     facts->fingerprint = digest(content);
     return {State::read, {}, facts->identity, facts};

@@ -15,6 +15,10 @@ inline constexpr std::string_view tableSuffix = ".vlist";
 /// A manifest is a page of text; what is larger is a mistake or an attack.
 inline constexpr std::size_t maximumManifestSize = 1U << 20U;
 
+/// Values in a manifest, those in its arrays and dictionaries included. Real ones have dozens, a few hundreds. The size
+/// alone is no bound: a million values of a byte each take up a hundred times the memory once they are decoded.
+inline constexpr std::size_t maximumManifestValues = 20'000;
+
 /// Languages of a bundle, and string tables of a language, that are looked at.
 inline constexpr std::size_t maximumResourceEntries = 256;
 
@@ -35,30 +39,35 @@ struct ScannedBundle {
     };
     State state = State::absent;
     std::string reason;
-    FileIdentity identity; // of the directory, in every state
+    DirectoryIdentity identity; // of the directory, in every state
     BundleFactsRef facts;
 };
 
 /// Reads bundles from disk. Nothing that a bundle contains makes it block, follow links or take more memory than the
-/// bounds above.
+/// bounds above. Any thread; `watch` is called by `scan` alone.
 class BundleScanner {
 public:
     /// Called with each directory of a bundle before anything in it is looked at, so that whoever watches it misses
     /// no later change.
     using Watch = std::function<void(int directory, const std::string& path)>;
 
-    BundleScanner(Watch watch, SharedKeys& keys) : _watch(std::move(watch)), _keys(keys) {}
+    BundleScanner(Watch watch, SharedStrings& strings) : _watch(std::move(watch)), _strings(strings) {}
 
     /// `directory` is open, `path` its name for `watch`. `known` are the facts of an earlier scan, or null.
     ScannedBundle scan(int directory, const std::string& path, BundleKind kind, const BundleFactsRef& known) const;
 
+    /// Whether the files of the bundle at `path` are still those that `known` were read from. False also for doubt.
+    bool isUnchanged(const std::string& path, const BundleFacts& known) const;
+
 private:
     class FileStates;
+    static bool isUnchanged(int directory, const std::string& path, const BundleFacts& known, const Watch& watch);
     /// Goes through the string tables, and with `content` appends what they contain to it. False without resources.
-    bool visitResources(int directory, const std::string& path, FileStates& states, std::string* content) const;
+    static bool visitResources(int directory, const std::string& path, const Watch& watch, FileStates& states,
+                               std::string* content);
 
     const Watch _watch;
-    SharedKeys& _keys;
+    SharedStrings& _strings;
 };
 
 } // namespace platform::linux_

@@ -4,9 +4,12 @@
 #include "platform/linux/DirectoryFiles.h"
 
 #include <algorithm>
+#include <array>
 #include <chrono>
 #include <sys/inotify.h>
 #include <sys/stat.h>
+#include <unordered_map>
+#include <unordered_set>
 
 namespace platform::linux_ {
 
@@ -59,24 +62,19 @@ template <class Map> auto lookUp(const Map& map, const std::string& path) {
     return found == map.end() ? typename Map::mapped_type() : found->second;
 }
 
-std::optional<std::string> text(const Dictionary& dictionary, std::string_view key) {
-    const auto view = dictionary.string(key);
-    return view ? std::optional<std::string>(*view) : std::nullopt;
-}
-
 } // namespace
 
-InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limits)
+InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limits, Start start)
     : _top(root.directory()),
       _folders{{root.applications(), FolderKind::applications},
                {root.system() + "/Applications", FolderKind::applications},
                {root.system() + "/Library/PlugIns", FolderKind::plugIns}},
       _limits(limits),
-      _store(root.database() + "/Catalix.sqlite", _keys),
+      _store(root.database() + "/Catalix.sqlite", _strings),
       _watcher(limits.watches),
       _scanner([this](int directory,
                       const std::string& path) { _watcher.watch(directory, path, RegistryWatcher::Role::content); },
-               _keys) {
+               _strings) {
     std::optional<std::string> problem;
     auto contents = _store.open(problem);
     if (problem) cx().error("the registry's database was not usable: %{public}s", *problem);
@@ -86,7 +84,13 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     _exclusions = std::move(contents.exclusions);
     _isKnowledgeUnsaved = !contents.knowledge;
     _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
-    rescan({everything}, Manifests::settled);
+    if (start == Start::verified || !contents.knowledge) rescan({everything}, Manifests::settled);
+}
+
+bool InstalledBundles::isUnchanged(const InstalledPlugIn& plugIn) const {
+    const auto& application = plugIn.application;
+    return _scanner.isUnchanged(plugIn.path, *plugIn.facts) &&
+           (!application || _scanner.isUnchanged(application->path, *application->facts));
 }
 
 /// The application, the plug-in outside applications or the subfolder at or around `path`. None for what is no
@@ -128,6 +132,7 @@ void InstalledBundles::touch(const std::string& path, Places& places) const {
 }
 
 InstalledBundles::Change InstalledBundles::catchUp() {
+    if (!_isVerified) return rescan({everything}, Manifests::settled);
     std::vector<RegistryWatcher::Event> events;
     if (!_watcher.read(events)) {
         cx().info("too many changes at once; looking at all bundles");
@@ -151,6 +156,7 @@ InstalledBundles::Change InstalledBundles::catchUp() {
 }
 
 InstalledBundles::Change InstalledBundles::verify() {
+    if (!_isVerified) return catchUp();
     Places places = _incomplete;
     for (const auto& directory : _watcher.unwatched()) touch(directory, places);
     return rescan(std::move(places), Manifests::settled);
@@ -203,6 +209,7 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
         return all.contains(everything) ||
                std::ranges::any_of(ancestors(place), [&](const auto& directory) { return all.contains(directory); });
     });
+    if (places.contains(everything)) _isVerified = true;
     _manifests = manifests;
     _isShort = false;
     Found found;
@@ -301,11 +308,13 @@ void InstalledBundles::scanPlugIn(int directory, const std::string& path, const 
         found.plugIns[path] = {facts, known->identifier, application};
         return;
     }
-    const Dictionary& info = facts->info->dictionary();
-    const auto dictionary = plugInDictionary(info);
+    auto dictionary = facts->info->find({"VKExtension"}).dictionary();
+    if (!dictionary) dictionary = facts->info->find({"Zembra"}).dictionary();
     if (!dictionary) return; // a bundle of another kind
-    auto identifier = text(*dictionary, "VKExtensionIdentifier");
-    if (!identifier) identifier = text(info, "VBBundleIdentifier");
+    Value identifierValue = (*dictionary)["VKExtensionIdentifier"];
+    if (!identifierValue.string()) identifierValue = facts->info->find({"VBBundleIdentifier"});
+    std::optional<std::string> identifier;
+    if (const auto text = identifierValue.string()) identifier = *text;
     // It names directories, and stands in logs. (A plug-in without any is left to the daemon, which says so.)
     if (identifier && !isFileName(*identifier)) return refuse(path, "unusable identifier");
     _refusals.erase(path);
@@ -429,7 +438,7 @@ bool InstalledBundles::takeInApplications(const Places& places, const Found& fou
         if (application && application->facts->identity == facts->identity &&
             application->facts->fingerprint == facts->fingerprint) {
             if (application->facts->evidence != facts->evidence) _unsavedApplications.insert(path);
-            application->facts->evidence = facts->evidence;
+            application->facts->evidence = facts->evidence.load();
             continue;
         }
         application = std::make_shared<const InstalledApplication>(InstalledApplication{path, facts, {}});
@@ -453,7 +462,7 @@ void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, C
             known && known->facts->identity == seen.facts->identity && known->identifier == seen.identifier;
         if (isSame && known->facts->fingerprint == seen.facts->fingerprint && known->application == application) {
             if (known->facts->evidence != seen.facts->evidence) _unsavedPlugIns.insert(path);
-            known->facts->evidence = seen.facts->evidence;
+            known->facts->evidence = seen.facts->evidence.load();
             continue;
         }
         auto plugIn = std::make_shared<InstalledPlugIn>();
@@ -520,9 +529,12 @@ bool InstalledBundles::repointPlugIns() {
 /// Finds for each added plug-in who it was before: the same directory, wherever it was, or else the same identifier
 /// at the same place.
 void InstalledBundles::identify(std::vector<std::shared_ptr<InstalledPlugIn>> added, const PlugIns& removed) {
-    std::vector<RemovedPlugIn> gone;
-    for (const auto& [path, plugIn] : removed) {
-        gone.push_back({path, plugIn->uuid, plugIn->identifier, plugIn->originalIdentifier, plugIn->facts->identity});
+    if (added.empty() && removed.empty()) return;
+    const Date date = now();
+    for (const auto& plugIn : added) {
+        plugIn->uuid = UUID::random();
+        plugIn->originalIdentifier = plugIn->identifier;
+        plugIn->registered = date;
     }
     const auto isSameDirectory = [](const InstalledPlugIn& plugIn, const RemovedPlugIn& before) {
         const bool isSame = before.identity == plugIn.facts->identity;
@@ -535,38 +547,53 @@ void InstalledBundles::identify(std::vector<std::shared_ptr<InstalledPlugIn>> ad
         plugIn.uuid = before.uuid;
         plugIn.originalIdentifier = before.originalIdentifier;
     };
-    const auto takeFrom = [&](std::vector<RemovedPlugIn>& candidates, const auto& isSame) {
+
+    PlugIns gone = removed; // without those that are back under another path or as another bundle
+    std::unordered_multimap<std::uint64_t, std::string> goneByInode; // thousands move when a folder above them does
+    for (const auto& [path, plugIn] : gone) goneByInode.emplace(plugIn->facts->identity.inode, path);
+    const auto asRemoved = [](const InstalledPlugIn& plugIn) {
+        return RemovedPlugIn{plugIn.path, plugIn.uuid, plugIn.identifier, plugIn.originalIdentifier,
+                             plugIn.facts->identity};
+    };
+    const auto takeFrom = [&](const auto& pathsFor, const auto& isSame) {
         std::erase_if(added, [&](const auto& plugIn) {
-            const auto before = std::ranges::find_if(candidates, [&](const auto& one) { return isSame(*plugIn, one); });
-            if (before == candidates.end()) return false;
-            become(*plugIn, *before);
-            candidates.erase(before);
-            return true;
+            for (const auto& path : pathsFor(*plugIn)) {
+                const auto candidate = gone.find(path);
+                if (candidate == gone.end()) continue;
+                const auto before = asRemoved(*candidate->second);
+                if (!isSame(*plugIn, before)) continue;
+                become(*plugIn, before);
+                gone.erase(candidate);
+                return true;
+            }
+            return false;
         });
     };
-    const Date date = now();
-    for (const auto& plugIn : added) {
-        plugIn->uuid = UUID::random();
-        plugIn->originalIdentifier = plugIn->identifier;
-        plugIn->registered = date;
-    }
-    takeFrom(gone, isSameDirectory);
-    takeFrom(gone, isSamePlace);
-    std::set<UUID> taken; // one directory may be met at two paths while it moves
+    takeFrom(
+        [&](const InstalledPlugIn& plugIn) {
+            std::set<std::string> paths;
+            const auto [begin, end] = goneByInode.equal_range(plugIn.facts->identity.inode);
+            for (auto next = begin; next != end; ++next) paths.insert(next->second);
+            return paths;
+        },
+        isSameDirectory);
+    takeFrom([](const InstalledPlugIn& plugIn) { return std::array{plugIn.path}; }, isSamePlace);
+
+    std::unordered_set<UUID> inUse; // one directory may be met at two paths while it moves
     for (const auto& plugIn : added) {
         const auto candidates = _store.removedPlugIns(plugIn->facts->identity, plugIn->path);
         auto before = std::ranges::find_if(candidates, [&](const auto& one) { return isSameDirectory(*plugIn, one); });
         if (before == candidates.end())
             before = std::ranges::find_if(candidates, [&](const auto& one) { return isSamePlace(*plugIn, one); });
-        if (before == candidates.end() || isInUse(before->uuid) || !taken.insert(before->uuid).second) continue;
+        if (before == candidates.end()) continue;
+        if (inUse.empty()) {
+            for (const auto& [path, known] : _plugIns) inUse.insert(known->uuid);
+        }
+        if (!inUse.insert(before->uuid).second) continue;
         become(*plugIn, *before);
         _unsavedReturned.push_back(before->uuid);
     }
-    std::ranges::move(gone, std::back_inserter(_unsavedRemoved));
-}
-
-bool InstalledBundles::isInUse(const UUID& uuid) const {
-    return std::ranges::any_of(_plugIns, [&](const auto& entry) { return entry.second->uuid == uuid; });
+    for (const auto& [path, plugIn] : gone) _unsavedRemoved.push_back(asRemoved(*plugIn));
 }
 
 void InstalledBundles::save() {

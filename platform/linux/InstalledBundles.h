@@ -27,15 +27,26 @@ public:
         bool isChanged = false; // anything that the registry tells about anything
     };
 
-    /// Reads the database and then the disk. `root` has no symbolic links in it.
-    InstalledBundles(const Root& root, const RegistryLimits& limits);
+    enum class Start {
+        verified, // what is known then is true
+        stored,   // what the database tells, when it tells anything; the first `catchUp` makes it true
+    };
+
+    /// Reads the database, and then, as `start` says, the disk. `root` has no symbolic links in it.
+    InstalledBundles(const Root& root, const RegistryLimits& limits, Start start = Start::verified);
+
+    /// Whether the disk was looked at since the start.
+    bool isVerified() const { return _isVerified; }
+    /// Whether the plug-in's bundle, and its application's, are still on disk as they were read: for one that is asked
+    /// for before everything is verified. Any thread.
+    bool isUnchanged(const InstalledPlugIn& plugIn) const;
 
     /// Readable when `catchUp` has something to do; negative when there is no such descriptor.
     int descriptor() const { return _watcher.descriptor(); }
     /// Takes in everything that happened on disk until now.
     Change catchUp();
     /// Something may have changed that `catchUp` does not hear of; `verify` finds it.
-    bool needsVerifying() const { return !_watcher.unwatched().empty() || !_incomplete.empty(); }
+    bool needsVerifying() const { return !_isVerified || !_watcher.unwatched().empty() || !_incomplete.empty(); }
     Change verify();
 
     using Tell = std::function<void(const Change&)>;
@@ -91,13 +102,12 @@ private:
     void takeInPlugIns(const Places& places, const Found& found, Change& change);
     bool repointPlugIns();
     void identify(std::vector<std::shared_ptr<InstalledPlugIn>> added, const PlugIns& removed);
-    bool isInUse(const UUID& uuid) const;
     void save();
 
     const std::string _top;
     const std::vector<Folder> _folders;
     const RegistryLimits _limits;
-    SharedKeys _keys;
+    SharedStrings _strings;
     RegistryStore _store;
     RegistryWatcher _watcher;
     BundleScanner _scanner;
@@ -107,6 +117,7 @@ private:
     std::set<std::string> _registrations; // registered by path; installed or awaited
     Exclusions _exclusions;               // unregistered although they lie where plug-ins are looked for
     Knowledge _knowledge;
+    bool _isVerified = false;
 
     Manifests _manifests = Manifests::settled;    // during a scan
     bool _isShort = false;                        // during a scan: something could not be looked at

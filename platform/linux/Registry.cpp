@@ -1,19 +1,26 @@
 #include "platform/linux/Registry.h"
 
 #include "platform/SystemLog.h"
+#include "platform/linux/ActingAsPeer.h"
+#include "platform/linux/BundleScanner.h"
 #include "platform/linux/Descriptor.h"
 #include "platform/linux/DirectoryFiles.h"
 #include "platform/linux/InstalledBundles.h"
+#include "platform/linux/ProcPath.h"
 #include "platform/linux/RegistryQuery.h"
 #include "platform/linux/RegistrySnapshot.h"
+#include "platform/linux/SDKFiles.h"
 #include "platform/linux/ServiceThread.h"
 #include "platform/linux/StringTables.h"
 
 #include <atomic>
+#include <condition_variable>
 #include <cstdlib>
+#include <fcntl.h>
 #include <filesystem>
 #include <functional>
 #include <future>
+#include <linux/openat2.h>
 #include <mutex>
 #include <poll.h>
 #include <sys/eventfd.h>
@@ -24,7 +31,6 @@ namespace platform::linux_ {
 
 namespace {
 
-constexpr const char* sdkFolder = "/Library/SDKs";
 constexpr const char* placeholderKey = "VBBundleIsPlaceholder";
 
 /// The path with its symbolic links resolved; none for what does not exist.
@@ -80,10 +86,11 @@ public:
         : _root(withoutLinks(root)),
           _locale(locale),
           _containers(containers),
-          _bundles(_root, limits),
+          _bundles(_root, limits, InstalledBundles::Start::stored),
           _wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
         show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
         _thread = startServiceThread("registry", [this] { run(); });
+        if (!_thread) publish(_bundles.catchUp());
     }
 
     ~Implementation() {
@@ -106,10 +113,25 @@ public:
         return _snapshot;
     }
 
-    /// The snapshot for an answer. What is not watched is verified soon after somebody asked.
+    /// The snapshot for an answer, once the disk was looked at. What is not watched is verified soon after somebody
+    /// asked.
     std::shared_ptr<const RegistrySnapshot> snapshotForAnswer() {
+        if (!_isVerified.load(std::memory_order_acquire)) {
+            std::unique_lock lock(_mutex);
+            _verified.wait(lock, [&] { return _isVerified.load(std::memory_order_relaxed); });
+        }
         if (_needsVerifying.load(std::memory_order_relaxed) && !_isVerifyWanted.exchange(true)) wake();
         return snapshot();
+    }
+
+    /// The plug-in that `find` finds in the snapshot for an answer. While the disk is not looked at yet, one that was
+    /// known before the start and is unchanged need not wait for that.
+    template <class F> InstalledPlugInRef lookUp(F&& find) {
+        if (!_isVerified.load(std::memory_order_acquire)) {
+            const auto plugIn = find(*snapshot());
+            if (plugIn && _bundles.isUnchanged(*plugIn)) return plugIn;
+        }
+        return find(*snapshotForAnswer());
     }
 
     std::shared_ptr<const Languages> languages() {
@@ -131,12 +153,12 @@ public:
         _languages = std::move(renewed);
     }
 
-    PlugInProxyRef proxy(const InstalledPlugInRef& plugIn, const Languages& languages, bool isInstalled = true) {
+    PlugInProxyRef proxy(const InstalledPlugInRef& plugIn, const Languages& languages) {
         if (!plugIn) return nullptr;
         if (auto made = madeOf(plugIn->proxy, languages)) return made;
         auto proxy = describe(*plugIn, languages);
-        if (isInstalled && !isDataOnly(*proxy->infoDictionary) && proxy->plugInIdentifier) {
-            auto container = _containers.userContainer(*proxy->plugInIdentifier);
+        if (!isDataOnly(*proxy->infoDictionary) && proxy->plugInIdentifier) {
+            auto container = makeContainer(*proxy->plugInIdentifier);
             // Not kept without its container: what prevents that may pass.
             if (!container) return proxy;
             proxy->dataContainerURL = URL::file(*container);
@@ -219,6 +241,7 @@ private:
     }
 
     void run() {
+        publish(_bundles.catchUp());
         while (true) {
             pollfd waiting[] = {{_bundles.descriptor(), POLLIN, 0}, {_wake.get(), POLLIN, 0}};
             (void)poll(waiting, 2, -1);
@@ -246,17 +269,28 @@ private:
         Observers observers;
         const std::lock_guard lock(_mutex);
         _snapshot.swap(snapshot);
+        releaseAnswers();
         for (const auto& weak : _observers) {
             if (auto observer = weak.lock()) observers.push_back(std::move(observer));
         }
         return observers;
     }
 
+    /// Before any notice, for observers ask, or wait for others who do. With the lock held.
+    void releaseAnswers() {
+        if (_bundles.isVerified() && !_isVerified.exchange(true)) _verified.notify_all();
+    }
+
     void publish(const InstalledBundles::Change& change) {
         _needsVerifying.store(_bundles.needsVerifying(), std::memory_order_relaxed);
-        if (!change.isChanged) return;
+        if (!change.isChanged) {
+            const std::lock_guard lock(_mutex);
+            return releaseAnswers();
+        }
         const auto& [uuid, sequence] = _bundles.knowledge();
-        if (!change.removed.empty() && !change.installed.empty()) {
+        // At the start nobody was told of what went while the registry was not running.
+        const bool isStart = !_isVerified.load(std::memory_order_relaxed);
+        if (!change.removed.empty() && !change.installed.empty() && !isStart) {
             // What takes the place of another one is seen only after that one's end was told: the two may share a UUID.
             const auto observers =
                 show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(),
@@ -265,28 +299,58 @@ private:
         }
         const auto observers =
             show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
-        if (change.installed.empty())
-            tellRemoved(observers, change.removed);
-        else
-            tellInstalled(observers, change.installed);
+        if (change.installed.empty() || isStart) tellRemoved(observers, change.removed);
+        tellInstalled(observers, change.installed);
+        if (!change.removed.empty()) discardContainers();
+    }
+
+    Result<std::string> makeContainer(const std::string& identifier) {
+        {
+            // First, so that none is ever there unnoticed.
+            const std::lock_guard lock(_madeMutex);
+            _containersMade.insert(identifier);
+        }
+        return _containers.userContainer(identifier);
+    }
+
+    /// What was made for plug-ins that went and left nothing in it goes too: a bundle whose identifier is rewritten
+    /// again and again would leave a directory for each. Those made meanwhile from an older snapshot go the next time.
+    void discardContainers() {
+        std::set<std::string> unused;
+        {
+            const std::lock_guard lock(_madeMutex);
+            unused.swap(_containersMade);
+        }
+        std::set<std::string> used;
+        for (const auto& [path, plugIn] : _bundles.plugIns()) {
+            if (auto node = plugIn->identifier ? unused.extract(*plugIn->identifier) : decltype(unused)::node_type())
+                used.insert(std::move(node));
+        }
+        for (const auto& identifier : unused) _containers.discardEmpty(identifier);
+        const std::lock_guard lock(_madeMutex);
+        _containersMade.merge(used);
     }
 
     void tellRemoved(const Observers& observers, const PlugIns& plugIns) {
         if (observers.empty() || plugIns.empty()) return;
-        const auto notice = noticeOf(plugIns, false);
+        const auto notice = noticeOf(plugIns);
         for (const auto& observer : observers) observer->pluginsWillUninstall(notice);
     }
 
     void tellInstalled(const Observers& observers, const PlugIns& plugIns) {
         if (observers.empty() || plugIns.empty()) return;
-        const auto notice = noticeOf(plugIns, true);
+        const auto notice = noticeOf(plugIns);
         for (const auto& observer : observers) observer->pluginsDidInstall(notice);
     }
 
-    std::vector<PlugInProxyRef> noticeOf(const PlugIns& plugIns, bool areInstalled) {
+    /// Nobody needs the container of a plug-in that is only told of, so none is made.
+    std::vector<PlugInProxyRef> noticeOf(const PlugIns& plugIns) {
         const auto current = languages();
         std::vector<PlugInProxyRef> notice;
-        for (const auto& [path, plugIn] : plugIns) notice.push_back(proxy(plugIn, *current, areInstalled));
+        for (const auto& [path, plugIn] : plugIns) {
+            PlugInProxyRef made = madeOf(plugIn->proxy, *current);
+            notice.push_back(made ? std::move(made) : describe(*plugIn, *current));
+        }
         return notice;
     }
 
@@ -340,9 +404,12 @@ private:
     std::vector<std::weak_ptr<RegistryObserver>> _observers;
     std::vector<std::function<void()>> _actions;
     bool _isStopping = false;
+    std::atomic<bool> _isVerified = false; // the snapshot tells what is on disk, not what was there at the last stop
+    std::condition_variable _verified;
 
     mutable std::mutex _madeMutex; // for everything that was made of records; innermost, too
     std::shared_ptr<const Languages> _languages;
+    std::set<std::string> _containersMade; // identifiers
 
     std::atomic<bool> _needsVerifying = false;
     std::atomic<bool> _isVerifyWanted = false;
@@ -375,27 +442,19 @@ std::optional<std::vector<PlugInProxyRef>> Registry::plugInsMatching(const Dicti
 }
 
 PlugInProxyRef Registry::plugInForUUID(const UUID& uuid) {
-    const auto plugIn = _implementation->snapshotForAnswer()->plugIn(uuid);
+    const auto plugIn = _implementation->lookUp([&](const RegistrySnapshot& known) { return known.plugIn(uuid); });
     return plugIn ? _implementation->proxy(plugIn, *_implementation->languages()) : nullptr;
 }
 
 PlugInProxyRef Registry::plugInForURL(const URL& url) {
     if (!url.isFile()) return nullptr;
-    const auto snapshot = _implementation->snapshotForAnswer();
-    auto plugIn = snapshot->plugInAt(url.path());
-    if (!plugIn) {
-        if (const auto path = canonical(url.path())) plugIn = snapshot->plugInAt(*path);
-    }
+    const auto plugIn =
+        _implementation->lookUp([&](const RegistrySnapshot& known) { return known.plugInAt(url.path()); });
     return plugIn ? _implementation->proxy(plugIn, *_implementation->languages()) : nullptr;
 }
 
 std::shared_ptr<const ApplicationRecord> Registry::applicationForURL(const URL& url) {
-    if (!url.isFile()) return nullptr;
-    const auto snapshot = _implementation->snapshotForAnswer();
-    auto application = snapshot->applicationAt(url.path());
-    if (!application) {
-        if (const auto path = canonical(url.path())) application = snapshot->applicationAt(*path);
-    }
+    const auto application = url.isFile() ? _implementation->snapshotForAnswer()->applicationAt(url.path()) : nullptr;
     return application ? _implementation->record(application, *_implementation->languages()) : nullptr;
 }
 
@@ -403,15 +462,22 @@ std::vector<PlugInProxyRef> Registry::plugInsOfApplication(const ApplicationReco
     return _implementation->proxies(_implementation->snapshotForAnswer()->plugInsOf(application.bundleURL.path()));
 }
 
+bool Registry::mayRegister(const URL& url, const AuditToken& peer) {
+    if (!url.isFile()) return false;
+    if (geteuid() != 0) return true; // it reads nothing but what its own user may read
+    const ActingAsPeer acting(rightsOfPeer(peer));
+    if (!acting.isReady()) return false;
+    const Descriptor manifest = openReference(url.path() + "/" + manifestName, RESOLVE_NO_SYMLINKS);
+    return manifest && faccessat(AT_FDCWD, procPath(manifest.get()).c_str(), R_OK, AT_EACCESS) == 0;
+}
+
 bool Registry::registerPlugIn(const URL& url) {
-    const auto path = url.isFile() ? canonical(url.path()) : std::nullopt;
-    return path && _implementation->registerPlugIn(*path);
+    // One bundle under two names would be two plug-ins. A link that comes into the way from now on is not followed.
+    return url.isFile() && canonical(url.path()) == url.path() && _implementation->registerPlugIn(url.path());
 }
 
 bool Registry::unregisterPlugIn(const URL& url) {
-    if (!url.isFile()) return false;
-    // A registration may outlive its bundle, and then only the path that was registered is left to name it.
-    return _implementation->unregisterPlugIn(canonical(url.path()).value_or(url.path()));
+    return url.isFile() && _implementation->unregisterPlugIn(url.path());
 }
 
 void Registry::clearSchemaCaches() { _implementation->clearSchemaCaches(); }
@@ -432,14 +498,7 @@ Registry::localizedStrings(const PlugInProxy& proxy, const std::set<std::string>
 }
 
 std::optional<Dictionary> Registry::sdkDictionary(const std::string& extensionPoint) {
-    const std::string name = extensionPoint + std::string(tableSuffix);
-    if (!isFileName(name)) return std::nullopt;
-    const Descriptor folder = openDirectory(_implementation->root().system() + sdkFolder);
-    if (!folder) return std::nullopt;
-    const auto bytes = readFile(folder.get(), name, maximumManifestSize);
-    if (!bytes || !*bytes) return std::nullopt;
-    const auto value = decodePropertyList(**bytes, maximumManifestNesting);
-    return value ? value->dictionary() : std::nullopt;
+    return readSDKFile(_implementation->root(), extensionPoint);
 }
 
 void Registry::settle() { _implementation->settle(); }

@@ -41,6 +41,7 @@ public:
     PlugInProxyRef plugInForURL(const URL& url) override;
     std::shared_ptr<const ApplicationRecord> applicationForURL(const URL& url) override;
     std::vector<PlugInProxyRef> plugInsOfApplication(const ApplicationRecord& application) override;
+    bool mayRegister(const URL& url, const AuditToken& peer) override;
     bool registerPlugIn(const URL& url) override;
     bool unregisterPlugIn(const URL& url) override;
     void clearSchemaCaches() override;

@@ -10,9 +10,13 @@ namespace {
 constexpr std::string_view identifierKey = "VKExtensionIdentifier";
 constexpr std::string_view uuidKey = "com.nordane.uuid";
 
+/// Keys of manifests are words. What is longer shall not be kept with an index.
+constexpr std::size_t maximumKeyLength = 256;
+
 /// Keys whose values the registry does not have, or that no host asks for often enough to keep an index.
 bool isLeftToFullMatch(std::string_view key) {
-    return key == "VKUserElection" || key == "VKExtensionContainingApp" || key.starts_with("ENTITLEMENT:");
+    return key.size() > maximumKeyLength || key == "VKUserElection" || key == "VKExtensionContainingApp" ||
+           key.starts_with("ENTITLEMENT:");
 }
 
 /// Entries of one query that are tested. More would make a host's query dear without making its answer much smaller.
@@ -70,11 +74,9 @@ std::vector<std::string> valuesForEquality(const InstalledPlugIn& plugIn, const 
     if (key == identifierKey && plugIn.identifier) return {normalizedForEquality(*plugIn.identifier)};
     if (key == uuidKey) return {normalizedForEquality(plugIn.uuid.text())};
 
-    const Dictionary& info = plugIn.facts->info->dictionary();
-    const auto extension = info.dictionary("VKExtension");
-    const auto attributes = extension ? extension->dictionary("VKExtensionAttributes") : std::nullopt;
-    Value value = attributes ? (*attributes)[key] : Value();
-    if (!value) value = info[key];
+    const StoredDictionary& info = *plugIn.facts->info;
+    Value value = info.find({"VKExtension", "VKExtensionAttributes", key});
+    if (!value) value = info.find({key});
 
     std::vector<std::string> values;
     if (const auto text = value.string()) values.push_back(normalizedForEquality(*text));

@@ -19,12 +19,13 @@ std::string normalizedForEquality(std::string_view text);
 struct EqualityTest {
     std::string key;
     std::vector<std::string> values; // normalized; may be empty, which nothing passes
+    friend bool operator==(const EqualityTest&, const EqualityTest&) = default;
 };
 
 /// The entries of a query that are plain equality.
 std::vector<EqualityTest> equalityTests(const Dictionary& query);
 
-/// The normalized texts of a plug-in with which a test of `key` compares.
+/// The normalized texts of a plug-in with which a test of `key` compares. Nothing of its manifest is kept decoded.
 std::vector<std::string> valuesForEquality(const InstalledPlugIn& plugIn, const std::string& key);
 
 } // namespace platform::linux_

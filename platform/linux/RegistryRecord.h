@@ -45,7 +45,7 @@ struct RemovedPlugIn {
     UUID uuid;
     std::optional<std::string> identifier;
     std::optional<std::string> originalIdentifier;
-    FileIdentity identity;
+    DirectoryIdentity identity;
 };
 
 /// Counts the states of the registry's data.
@@ -57,7 +57,7 @@ struct Knowledge {
 // Each ordered by path.
 using Applications = std::map<std::string, InstalledApplicationRef>;
 using PlugIns = std::map<std::string, InstalledPlugInRef>;
-using Exclusions = std::map<std::string, FileIdentity>;
+using Exclusions = std::map<std::string, DirectoryIdentity>;
 
 /// The manifest's plug-in dictionary: "VKExtension", else the older "Zembra".
 inline std::optional<Dictionary> plugInDictionary(const Dictionary& info) {

@@ -3,28 +3,51 @@
 #include "platform/linux/DirectoryFiles.h"
 
 #include <algorithm>
-#include <numeric>
+#include <functional>
 
 namespace platform::linux_ {
 
 namespace {
 
-/// Hosts choose the keys they ask for; more of them than this take turns.
-constexpr std::size_t maximumIndexes = 16;
+constexpr std::size_t maximumRecent = 16;
+
+/// Larger answers cost more to hand on than to find, and questions may be as large as a message.
+constexpr std::size_t maximumKeptAnswer = 4096;
+constexpr std::size_t maximumKeptQuestion = 4096; // bytes
+
+bool isWorthKeeping(const std::vector<EqualityTest>& tests) {
+    std::size_t size = 0;
+    for (const auto& test : tests) {
+        for (const auto& value : test.values) size += sizeof value + value.size();
+    }
+    return size <= maximumKeptQuestion;
+}
+
+std::uint32_t hashOf(const std::string& value) { return static_cast<std::uint32_t>(std::hash<std::string>()(value)); }
 
 } // namespace
 
 RegistrySnapshot::RegistrySnapshot(const PlugIns& plugIns, const Applications& applications, Knowledge knowledge,
                                    const PlugIns& hidden)
     : _knowledge(knowledge) {
-    _plugIns.reserve(plugIns.size());
+    struct Place {
+        UUID uuid;
+        std::uint32_t byPath; // the number of the plug-in in the order of the paths
+        const InstalledPlugInRef* plugIn;
+    };
+    std::vector<Place> places;
+    places.reserve(plugIns.size());
     for (const auto& [path, plugIn] : plugIns) {
-        if (!hidden.contains(path)) _plugIns.push_back(plugIn);
+        if (!hidden.contains(path))
+            places.push_back({plugIn->uuid, static_cast<std::uint32_t>(places.size()), &plugIn});
     }
-    std::ranges::sort(_plugIns, {}, [](const auto& plugIn) { return plugIn->uuid; });
-    _byPath.resize(_plugIns.size());
-    std::iota(_byPath.begin(), _byPath.end(), 0U);
-    std::ranges::sort(_byPath, {}, [&](std::uint32_t position) { return std::string_view(_plugIns[position]->path); });
+    std::ranges::sort(places, {}, &Place::uuid);
+    _plugIns.reserve(places.size());
+    _byPath.resize(places.size());
+    for (const auto& place : places) {
+        _byPath[place.byPath] = static_cast<std::uint32_t>(_plugIns.size());
+        _plugIns.push_back(*place.plugIn);
+    }
     _applications.reserve(applications.size());
     for (const auto& [path, application] : applications) _applications.push_back(application);
 }
@@ -59,46 +82,90 @@ std::vector<InstalledPlugInRef> RegistrySnapshot::plugInsOf(std::string_view app
     return answer;
 }
 
+template <class Question, class Made>
+std::shared_ptr<const Made> RegistrySnapshot::Recent<Question, Made>::find(const Question& question) {
+    const auto found = std::ranges::find(_made, question, [](const auto& entry) -> const auto& { return entry.first; });
+    if (found == _made.end()) return nullptr;
+    _made.splice(_made.begin(), _made, found);
+    return found->second;
+}
+
+template <class Question, class Made>
+void RegistrySnapshot::Recent<Question, Made>::keep(const Question& question, std::shared_ptr<const Made> made) {
+    _made.emplace_front(question, std::move(made));
+    if (_made.size() > maximumRecent) _made.pop_back();
+}
+
 std::shared_ptr<const RegistrySnapshot::Index> RegistrySnapshot::indexFor(const std::string& key) const {
-    const std::lock_guard lock(_mutex);
-    const auto known = std::ranges::find(_indexes, key, [](const auto& entry) { return entry.first; });
-    if (known != _indexes.end()) {
-        _indexes.splice(_indexes.begin(), _indexes, known);
-        return known->second;
-    }
+    const std::lock_guard lock(_mutex); // held on: who asks for the same key meanwhile waits instead of making it too
+    if (auto known = _indexes.find(key)) return known;
     auto index = std::make_shared<Index>();
+    index->reserve(_plugIns.size());
     for (std::uint32_t position = 0; position < _plugIns.size(); ++position) {
-        for (auto& value : valuesForEquality(*_plugIns[position], key)) (*index)[std::move(value)].push_back(position);
+        for (const auto& value : valuesForEquality(*_plugIns[position], key))
+            index->push_back({hashOf(value), position});
     }
-    _indexes.emplace_front(key, index);
-    if (_indexes.size() > maximumIndexes) _indexes.pop_back();
+    std::ranges::sort(*index);
+    index->shrink_to_fit();
+    _indexes.keep(key, index);
     return index;
+}
+
+RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vector<EqualityTest>& tests) const {
+    /// What passes one test: a run of postings, rising by position, for each of its values.
+    struct Answer {
+        std::shared_ptr<const Index> index;
+        std::vector<Postings> runs;
+        std::size_t size = 0;
+
+        bool contains(std::uint32_t position) const {
+            return std::ranges::any_of(
+                runs, [&](Postings run) { return std::ranges::binary_search(run, position, {}, &Posting::position); });
+        }
+    };
+    std::vector<Answer> answers;
+    for (const auto& test : tests) {
+        Answer answer{indexFor(test.key), {}, 0};
+        for (const auto& value : test.values) {
+            const auto run = std::ranges::equal_range(*answer.index, hashOf(value), {}, &Posting::hash);
+            answer.size += run.size();
+            if (!run.empty()) answer.runs.emplace_back(run.begin(), run.end());
+        }
+        if (answer.runs.empty()) return {};
+        answers.push_back(std::move(answer));
+    }
+    std::ranges::sort(answers, {}, &Answer::size);
+    const auto others = std::span(answers).subspan(1);
+    Positions positions;
+    for (const auto& run : answers.front().runs) {
+        for (const auto& [hash, position] : run) {
+            if (std::ranges::all_of(others, [&](const Answer& other) { return other.contains(position); }))
+                positions.push_back(position);
+        }
+    }
+    // Several values, or several elements of one, may name the same plug-in.
+    std::ranges::sort(positions);
+    const auto doubles = std::ranges::unique(positions);
+    positions.erase(doubles.begin(), doubles.end());
+    return positions;
 }
 
 std::vector<InstalledPlugInRef> RegistrySnapshot::matching(const std::vector<EqualityTest>& tests) const {
     if (tests.empty()) return _plugIns;
-    std::vector<Positions> answers;
-    for (const auto& test : tests) {
-        const auto index = indexFor(test.key);
-        Positions answer;
-        for (const auto& value : test.values) {
-            const auto found = index->find(value);
-            if (found != index->end()) answer.insert(answer.end(), found->second.begin(), found->second.end());
-        }
-        // Several values, or several elements of one, may name the same plug-in.
-        std::ranges::sort(answer);
-        const auto doubles = std::ranges::unique(answer);
-        answer.erase(doubles.begin(), doubles.end());
-        if (answer.empty()) return {};
-        answers.push_back(std::move(answer));
+    const bool mayKeep = isWorthKeeping(tests);
+    std::shared_ptr<const Positions> positions;
+    if (mayKeep) {
+        const std::lock_guard lock(_mutex);
+        positions = _answers.find(tests);
     }
-    const auto smallest = std::ranges::min_element(answers, {}, &Positions::size);
+    if (!positions) {
+        positions = std::make_shared<const Positions>(positionsMatching(tests));
+        const std::lock_guard lock(_mutex);
+        if (mayKeep && positions->size() <= maximumKeptAnswer) _answers.keep(tests, positions);
+    }
     std::vector<InstalledPlugInRef> plugIns;
-    for (const auto position : *smallest) {
-        const bool passes = std::ranges::all_of(
-            answers, [&](const Positions& answer) { return std::ranges::binary_search(answer, position); });
-        if (passes) plugIns.push_back(_plugIns[position]);
-    }
+    plugIns.reserve(positions->size());
+    for (const auto position : *positions) plugIns.push_back(_plugIns[position]);
     return plugIns;
 }
 

@@ -3,15 +3,15 @@
 #include "platform/linux/RegistryQuery.h"
 #include "platform/linux/RegistryRecord.h"
 
-#include <cstddef>
+#include <compare>
 #include <cstdint>
-#include <functional>
 #include <list>
+#include <memory>
 #include <mutex>
-#include <optional>
+#include <span>
 #include <string>
 #include <string_view>
-#include <unordered_map>
+#include <utility>
 #include <vector>
 
 namespace platform::linux_ {
@@ -32,19 +32,36 @@ public:
     /// In the order of their paths.
     std::vector<InstalledPlugInRef> plugInsOf(std::string_view applicationPath) const;
 
-    /// The plug-ins that pass every one of the tests, ordered by UUID; all of them when there are no tests. Costs the
-    /// size of the smallest answer to one of the tests, once a key was asked for.
+    /// The plug-ins that pass every one of the tests, and perhaps a few others, ordered by UUID; all of them when there
+    /// are no tests. Costs the size of the smallest answer to one of the tests, once a key was asked for; and only its
+    /// own size when the same was asked a short while ago, as hosts do.
     std::vector<InstalledPlugInRef> matching(const std::vector<EqualityTest>& tests) const;
 
 private:
-    using Positions = std::vector<std::uint32_t>; // in `_plugIns`, rising
-    struct Hash {
-        using is_transparent = void;
-        std::size_t operator()(std::string_view text) const { return std::hash<std::string_view>()(text); }
+    using Positions = std::vector<std::uint32_t>; // in `_plugIns`
+    /// A plug-in under one of its values for a key. The value by its hash alone: it takes a tenth of the memory, and
+    /// two values with one hash make an answer larger, never smaller.
+    struct Posting {
+        std::uint32_t hash;
+        std::uint32_t position;
+        friend auto operator<=>(const Posting&, const Posting&) = default;
     };
-    using Index = std::unordered_map<std::string, Positions, Hash, std::equal_to<>>; // by normalized value
+    using Index = std::vector<Posting>; // rising
+    using Postings = std::span<const Posting>;
+
+    /// What was made for the last few questions: hosts choose these, and more of them than `maximumRecent` take turns.
+    template <class Question, class Made> class Recent {
+    public:
+        /// Null when it is not there.
+        std::shared_ptr<const Made> find(const Question& question);
+        void keep(const Question& question, std::shared_ptr<const Made> made);
+
+    private:
+        std::list<std::pair<Question, std::shared_ptr<const Made>>> _made; // the last used one first
+    };
 
     std::shared_ptr<const Index> indexFor(const std::string& key) const;
+    Positions positionsMatching(const std::vector<EqualityTest>& tests) const;
 
     const Knowledge _knowledge;
     std::vector<InstalledPlugInRef> _plugIns;
@@ -52,7 +69,8 @@ private:
     std::vector<InstalledApplicationRef> _applications; // ordered by path
 
     mutable std::mutex _mutex;
-    mutable std::list<std::pair<std::string, std::shared_ptr<const Index>>> _indexes; // the last used one first
+    mutable Recent<std::string, Index> _indexes; // by key
+    mutable Recent<std::vector<EqualityTest>, Positions> _answers;
 };
 
 } // namespace platform::linux_

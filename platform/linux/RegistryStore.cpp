@@ -83,38 +83,43 @@ public:
     std::int64_t integer() { return sqlite3_column_int64(_statement, _column++); }
     std::uint64_t bits() { return static_cast<std::uint64_t>(integer()); }
     double real() { return sqlite3_column_double(_statement, _column++); }
-    std::string text() { return optionalText().value_or(std::string()); }
-    std::optional<std::string> optionalText() {
+    /// None for NULL. Good until the next row is read.
+    std::optional<std::string_view> bytes() {
         const int column = _column++;
         if (sqlite3_column_type(_statement, column) == SQLITE_NULL) return std::nullopt;
         const void* bytes = sqlite3_column_blob(_statement, column);
         const auto size = static_cast<std::size_t>(sqlite3_column_bytes(_statement, column));
-        return bytes == nullptr ? std::string() : std::string(static_cast<const char*>(bytes), size);
+        return bytes == nullptr ? std::string_view() : std::string_view(static_cast<const char*>(bytes), size);
+    }
+    std::string text() { return std::string(bytes().value_or(std::string_view())); }
+    std::optional<std::string> optionalText() {
+        const auto text = bytes();
+        return text ? std::optional<std::string>(*text) : std::nullopt;
     }
     std::optional<UUID> uuid() {
-        const std::string bytes = text();
+        const auto bytes = this->bytes().value_or(std::string_view());
         UUID uuid;
         if (bytes.size() != uuid.bytes.size()) return std::nullopt;
         std::memcpy(uuid.bytes.data(), bytes.data(), bytes.size());
         return uuid;
     }
-    FileIdentity identity() {
-        FileIdentity identity;
+    DirectoryIdentity identity() {
+        DirectoryIdentity identity;
         identity.device = bits();
         identity.inode = bits();
         identity.birth = integer();
         return identity;
     }
-    BundleFactsRef facts(SharedKeys& keys) {
+    BundleFactsRef facts(SharedStrings& strings, StoredDictionary::Keeps keeps) {
         auto facts = std::make_shared<BundleFacts>();
         facts->identity = identity();
         facts->evidence = bits();
         facts->fingerprint = bits();
         facts->hasResources = integer() != 0;
         facts->executable = text();
-        facts->info = std::make_shared<const StoredDictionary>(text(), keys);
-        if (auto entitlements = optionalText())
-            facts->entitlements = std::make_shared<const StoredDictionary>(*std::move(entitlements), keys);
+        facts->info = std::make_shared<const StoredDictionary>(bytes().value_or(std::string_view()), strings, keeps);
+        if (const auto entitlements = bytes())
+            facts->entitlements = std::make_shared<const StoredDictionary>(*entitlements, strings, keeps);
         return facts;
     }
 
@@ -123,7 +128,7 @@ private:
     int _column = 0;
 };
 
-RegistryStore::RegistryStore(std::string path, SharedKeys& keys) : _path(std::move(path)), _keys(keys) {}
+RegistryStore::RegistryStore(std::string path, SharedStrings& strings) : _path(std::move(path)), _strings(strings) {}
 RegistryStore::~RegistryStore() = default;
 
 RegistryStore::Contents RegistryStore::open(std::optional<std::string>& problem) {
@@ -187,7 +192,7 @@ Failure RegistryStore::read(Contents& contents) {
              [&](Row row) {
                  auto application = std::make_shared<InstalledApplication>();
                  application->path = row.text();
-                 application->facts = row.facts(_keys);
+                 application->facts = row.facts(_strings, StoredDictionary::Keeps::encoding);
                  const auto& path = application->path;
                  contents.applications.emplace_hint(contents.applications.end(), path, application);
              }) &&
@@ -196,7 +201,7 @@ Failure RegistryStore::read(Contents& contents) {
              [&](Row row) {
                  auto plugIn = std::make_shared<InstalledPlugIn>();
                  plugIn->path = row.text();
-                 plugIn->facts = row.facts(_keys);
+                 plugIn->facts = row.facts(_strings, StoredDictionary::Keeps::whatWasAskedFor);
                  const auto uuid = row.uuid();
                  plugIn->identifier = row.optionalText();
                  plugIn->originalIdentifier = row.optionalText();
@@ -300,7 +305,7 @@ void RegistryStore::setRegistered(const std::string& path, bool isRegistered) {
         path);
 }
 
-void RegistryStore::setExcluded(const std::string& path, const std::optional<FileIdentity>& identity) {
+void RegistryStore::setExcluded(const std::string& path, const std::optional<DirectoryIdentity>& identity) {
     if (!identity) return run("DELETE FROM exclusion WHERE path = ?", path);
     run("INSERT OR REPLACE INTO exclusion VALUES (?, ?, ?, ?)", path, stored(identity->device), stored(identity->inode),
         identity->birth);
@@ -319,7 +324,7 @@ void RegistryStore::keepRemoved(std::size_t count) {
     run("DELETE FROM removed WHERE number <= (SELECT max(number) FROM removed) - ?", static_cast<std::int64_t>(count));
 }
 
-std::vector<RemovedPlugIn> RegistryStore::removedPlugIns(const FileIdentity& identity, const std::string& path) {
+std::vector<RemovedPlugIn> RegistryStore::removedPlugIns(const DirectoryIdentity& identity, const std::string& path) {
     std::vector<RemovedPlugIn> found;
     if (!_database) return found;
     const Statement statement =

@@ -26,7 +26,7 @@ public:
         Exclusions exclusions;
     };
 
-    RegistryStore(std::string path, SharedKeys& keys);
+    RegistryStore(std::string path, SharedStrings& strings);
     ~RegistryStore();
     RegistryStore(const RegistryStore&) = delete;
     RegistryStore& operator=(const RegistryStore&) = delete;
@@ -50,14 +50,14 @@ public:
     void put(const InstalledPlugIn& plugIn);
     void removePlugIn(const std::string& path);
     void setRegistered(const std::string& path, bool isRegistered);
-    void setExcluded(const std::string& path, const std::optional<FileIdentity>& identity);
+    void setExcluded(const std::string& path, const std::optional<DirectoryIdentity>& identity);
     void remember(const RemovedPlugIn& removed);
     void forget(const UUID& removed);
     /// Forgets the oldest of the removed plug-ins but for `count`.
     void keepRemoved(std::size_t count);
 
     /// The removed plug-ins with this directory or this path.
-    std::vector<RemovedPlugIn> removedPlugIns(const FileIdentity& identity, const std::string& path);
+    std::vector<RemovedPlugIn> removedPlugIns(const DirectoryIdentity& identity, const std::string& path);
 
 private:
     class Row;
@@ -80,7 +80,7 @@ private:
     Error lastError() const;
 
     const std::string _path;
-    SharedKeys& _keys;
+    SharedStrings& _strings;
     std::unique_ptr<sqlite3, Close> _database;
     Failure _failure; // the first one of the transaction under way
 };

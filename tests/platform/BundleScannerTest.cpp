@@ -47,8 +47,8 @@ protected:
 
     support::ScratchDirectory scratch;
     const std::string bundle = scratch / "a.appex";
-    SharedKeys keys;
-    const BundleScanner scanner{[](int, const std::string&) {}, keys};
+    SharedStrings strings;
+    const BundleScanner scanner{[](int, const std::string&) {}, strings};
 };
 
 TEST_F(ScannedPlugIn, IsReadAgainAfterEachChangeAndOnlyThen) {
@@ -90,7 +90,9 @@ TEST_F(ScannedPlugIn, IsReadAgainAfterEachChangeAndOnlyThen) {
         const auto unchanged = scan(known);
         EXPECT_EQ(unchanged.state, State::unchanged) << "before " << what;
         EXPECT_EQ(unchanged.facts, known);
+        EXPECT_TRUE(scanner.isUnchanged(bundle, *known)) << "before " << what;
         make();
+        EXPECT_FALSE(scanner.isUnchanged(bundle, *known)) << what;
         const auto changed = scan(known);
         ASSERT_EQ(changed.state, State::read) << what;
         EXPECT_EQ(changed.facts->fingerprint != known->fingerprint, changesContent) << what;
@@ -101,9 +103,8 @@ TEST_F(ScannedPlugIn, IsReadAgainAfterEachChangeAndOnlyThen) {
 TEST_F(ScannedPlugIn, TakesNoProgramFromElsewhere) {
     support::writeFile(scratch / "program", "code");
     ASSERT_FALSE(writeEntitlements(scratch / "program", Dictionary{{"com.nordane.any", true}}));
+    std::filesystem::create_symlink(scratch / "program", bundle + "/link");
     for (const char* name : {"../program", "link", "..", ""}) {
-        std::error_code ignored; // there from the first round on
-        std::filesystem::create_symlink(scratch / "program", bundle + "/link", ignored);
         support::writeManifest(bundle, support::plugInInfo("a", {}, {{"VBBundleExecutable", name}}));
         const auto scanned = scan(nullptr);
         ASSERT_EQ(scanned.state, State::read) << name;
@@ -111,23 +112,35 @@ TEST_F(ScannedPlugIn, TakesNoProgramFromElsewhere) {
     }
 }
 
-TEST_F(ScannedPlugIn, IsUnusableWhenItsManifestNestsTooDeep) {
+TEST_F(ScannedPlugIn, IsUnusableBeyondTheLimitsOfAManifest) {
     // The manifest itself is one container, and its values are the others.
-    const auto scanned = [&](std::size_t nesting) {
+    const auto nested = [](std::size_t nesting) {
         Value value = "core";
         for (std::size_t i = 1; i < nesting; ++i) value = Array{value};
-        support::writeManifest(bundle, support::plugInInfo("a", {}, {{"deep", value}}));
-        return scan(nullptr);
+        return support::plugInInfo("a", {}, {{"deep", value}});
     };
-    const auto deepest = scanned(maximumManifestNesting);
-    ASSERT_EQ(deepest.state, State::read);
-    const StoredDictionary stored(deepest.facts->info->encoded(), keys);
-    EXPECT_EQ(stored.dictionary(), deepest.facts->info->dictionary()) << "also read back";
-
-    const auto tooDeep = scanned(maximumManifestNesting + 1);
-    EXPECT_EQ(tooDeep.state, State::unusable);
-    EXPECT_EQ(tooDeep.reason.find("Info.vlist: "), 0U) << tooDeep.reason;
-    EXPECT_NE(tooDeep.reason.find("nested too deep"), std::string::npos) << tooDeep.reason;
+    // Beside the array stand five values: identifier, plug-in dictionary, protocol, attributes and the array itself.
+    const auto filled = [](std::size_t values) {
+        return support::plugInInfo("a", {}, {{"many", Array(std::vector<Value>(values - 5, Value(true)))}});
+    };
+    struct Limit {
+        Dictionary most, tooMuch;
+        const char* reason;
+    };
+    for (const auto& [most, tooMuch, reason] :
+         {Limit{nested(maximumManifestNesting), nested(maximumManifestNesting + 1), "nested too deep"},
+          Limit{filled(maximumManifestValues), filled(maximumManifestValues + 1), "more than 20000 values"}}) {
+        support::writeManifest(bundle, most);
+        const auto taken = scan(nullptr);
+        ASSERT_EQ(taken.state, State::read) << taken.reason;
+        const StoredDictionary stored(taken.facts->info->encoded(), strings, StoredDictionary::Keeps::encoding);
+        EXPECT_EQ(stored.dictionary(), most) << "also read back";
+        support::writeManifest(bundle, tooMuch);
+        const auto refused = scan(nullptr);
+        EXPECT_EQ(refused.state, State::unusable);
+        EXPECT_TRUE(refused.reason.starts_with("Info.vlist: ")) << refused.reason;
+        EXPECT_NE(refused.reason.find(reason), std::string::npos) << refused.reason;
+    }
 }
 
 } // namespace

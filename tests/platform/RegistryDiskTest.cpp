@@ -1,14 +1,17 @@
 #include "platform/linux/Containers.h"
 #include "platform/linux/Entitlements.h"
+#include "platform/linux/PeerProcess.h"
 #include "platform/linux/Registry.h"
 #include "tests/support/BundleTree.h"
 #include "tests/support/LocaleFake.h"
 #include "tests/support/Sanitizers.h"
 #include "tests/support/ScratchDirectory.h"
 
+#include <algorithm>
 #include <condition_variable>
 #include <fcntl.h>
 #include <fstream>
+#include <functional>
 #include <gtest/gtest.h>
 #include <map>
 #include <mutex>
@@ -48,24 +51,22 @@ public:
         for (const auto& notice : take()) ++counts[notice];
         return counts;
     }
-    void hold() {
-        const std::lock_guard lock(_mutex);
-        _isHolding = true;
-        _isHeld = false;
-    }
+    void hold() { set(true); }
+    void release() { set(false); }
     void waitUntilHeld() {
         std::unique_lock lock(_mutex);
         ASSERT_TRUE(_changed.wait_for(lock, std::chrono::seconds(30), [&] { return _isHeld; }));
-    }
-    void release() {
-        const std::lock_guard lock(_mutex);
-        _isHolding = false;
-        _changed.notify_all();
     }
 
     Registry* registry = nullptr; // to be asked inside the notices
 
 private:
+    void set(bool isHolding) {
+        const std::lock_guard lock(_mutex);
+        _isHolding = isHolding;
+        _isHeld = false;
+        _changed.notify_all();
+    }
     void add(const std::string& sign, const std::vector<PlugInProxyRef>& proxies) {
         std::unique_lock lock(_mutex);
         for (const auto& proxy : proxies) _notices.push_back(sign + proxy->plugInIdentifier.value_or("none"));
@@ -214,38 +215,87 @@ TEST_F(RegistryOnDisk, StatePersists) {
     start();
     ASSERT_TRUE(registry().registerPlugIn(URL::file(byPath)));
     ASSERT_TRUE(registry().unregisterPlugIn(URL::file(app + "/PlugIns/b.appex")));
-    const auto before = at(plugIn);
-    const auto tool = uuidAt(byPath);
-    const auto knowledge = registry().knowledgeUUID();
+    const UUID uuid = uuidAt(plugIn);
+    const UUID tool = uuidAt(byPath);
     const auto sequence = registry().knowledgeSequenceNumber();
     writeManifest(plugIn, plugInInfo("renamed"));
-    writeManifest(plugIn, plugInInfo("a"));
     settle();
-
-    start();
     start();
     EXPECT_EQ(settle(), Notices{});
     EXPECT_EQ(count(), 2U);
-    EXPECT_EQ(uuidAt(plugIn), *before->uuid);
+    EXPECT_EQ(uuidAt(plugIn), uuid);
     EXPECT_EQ(at(plugIn)->originalIdentifier, "a");
     EXPECT_EQ(uuidAt(byPath), tool);
-    const auto restarted = registry().knowledgeUUID();
-    start();
-    EXPECT_EQ(registry().knowledgeUUID(), restarted);
+    const auto knowledge = registry().knowledgeUUID();
     EXPECT_GE(registry().knowledgeSequenceNumber(), sequence);
+    start();
+    EXPECT_EQ(count(), 2U);
+    EXPECT_EQ(registry().knowledgeUUID(), knowledge);
 
     stop();
     fs::remove_all(byPath);
-    writeManifest(plugIn, plugInInfo("a", {{"key", "value"}}));
     start();
     EXPECT_EQ(count(), 1U);
-    EXPECT_NE(registry().knowledgeUUID(), restarted);
     EXPECT_NE(registry().knowledgeUUID(), knowledge);
-    EXPECT_EQ(uuidAt(plugIn), *before->uuid);
-    EXPECT_TRUE(at(plugIn)->plugInDictionary->dictionary("VKExtensionAttributes")->contains("key"));
+    settle();
     writeManifest(byPath, plugInInfo("tool"));
     EXPECT_EQ(settle(), Notices{"+tool"}) << "a registration outlives its bundle";
     EXPECT_EQ(uuidAt(byPath), tool);
+}
+
+TEST_F(RegistryOnDisk, FirstAnswerKnowsWhatChangedWhileStopped) {
+    const auto info = [](const char* version) { return plugInInfo("a", {}, {{"VBBundleVersion", version}}); };
+    const std::string moved = applications + "/Two.app";
+    UUID uuid;
+    const auto one = [&](const std::vector<PlugInProxyRef>& proxies) {
+        const auto found = std::ranges::find(proxies, "a", [](const auto& proxy) { return *proxy->plugInIdentifier; });
+        return found == proxies.end() ? PlugInProxyRef() : *found;
+    };
+    const auto all = [](const auto&, const auto&) { return true; };
+    const auto place = [&] { return fs::exists(moved) ? moved : app; };
+    // Each is the first question after a start.
+    const std::vector<std::function<PlugInProxyRef()>> questions{
+        [&] { return registry().plugInForUUID(uuid); }, [&] { return at(place() + "/PlugIns/a.appex"); },
+        [&] { return one(*registry().installedPlugIns()); },
+        [&] { return one(*registry().plugInsMatching({{"VKExtensionIdentifier", "a"}}, all)); },
+        [&] {
+            const auto around = registry().applicationForURL(URL::file(place()));
+            return around ? one(registry().plugInsOfApplication(*around)) : nullptr;
+        }};
+    struct Change {
+        std::string what;
+        std::function<void()> make;
+        std::string answer; // the version of "a" that is found
+    };
+    const std::vector<Change> changes{
+        {"nothing", [] {}, "1"},
+        {"deleted", [&] { fs::remove_all(plugIn); }, "none"},
+        {"without manifest", [&] { fs::remove(plugIn + "/Info.vlist"); }, "none"},
+        {"application deleted", [&] { fs::remove_all(app); }, "none"},
+        {"edited in place", [&] { writeManifest(plugIn, info("2")); }, "2"},
+        {"application moved", [&] { fs::rename(app, moved); }, "1"},
+        {"replaced", [&] { fs::rename(plugIn, scratch / "old"), writeManifest(plugIn, info("3")); }, "3"},
+        {"behind a link", [&] { fs::rename(app, scratch / "x"), fs::create_symlink(scratch / "x", app); }, "none"}};
+    for (const auto& [what, make, answer] : changes) {
+        for (std::size_t i = 0; i < questions.size(); ++i) {
+            for (const auto& leftover : {app, moved, scratch / "old", scratch / "x"}) fs::remove_all(leftover);
+            writeApplication(app, {"b"});
+            writeManifest(plugIn, info("1"));
+            start();
+            settle();
+            uuid = uuidAt(plugIn);
+            stop();
+            make();
+            start();
+            const auto found = questions[i]();
+            EXPECT_EQ(found ? found->bundleVersion : "none", answer) << what << ", question " << i;
+            EXPECT_TRUE(!found || fs::exists(found->bundleURL->path())) << what << ", question " << i;
+        }
+    }
+    stop();
+    writeApplication(applications + "/Three.app", {"n"});
+    start();
+    EXPECT_NE(at(applications + "/Three.app/PlugIns/n.appex"), nullptr) << "installed while stopped";
 }
 
 TEST_F(RegistryOnDisk, RegistrationByPath) {
@@ -260,13 +310,14 @@ TEST_F(RegistryOnDisk, RegistrationByPath) {
     EXPECT_EQ(settle(), Notices{}) << "nobody registered it";
 
     fs::create_directory_symlink(scratch / "work", scratch / "link");
-    const auto linked = URL::file(scratch / "link/Dev.app/deep/tool.plugin");
-    EXPECT_TRUE(registry().registerPlugIn(linked));
+    for (const char* other : {"link/Dev.app/deep/tool.plugin", "work/../work/Dev.app/deep/tool.plugin"})
+        EXPECT_FALSE(registry().registerPlugIn(URL::file(scratch / other))) << other;
+    EXPECT_TRUE(registry().registerPlugIn(URL::file(outside)));
     EXPECT_EQ(observer->take(), Notices{"+tool"});
-    EXPECT_TRUE(registry().registerPlugIn(linked)) << "again";
+    EXPECT_TRUE(registry().registerPlugIn(URL::file(outside))) << "again";
     EXPECT_EQ(observer->take(), Notices{});
-    ASSERT_NE(registry().plugInForURL(linked), nullptr);
-    EXPECT_EQ(registry().plugInForURL(linked)->bundleURL->path(), outside);
+    EXPECT_EQ(at(scratch / "link/Dev.app/deep/tool.plugin"), nullptr) << "whoever asks resolves links";
+    ASSERT_NE(at(outside), nullptr);
     EXPECT_EQ(at(outside)->containingBundle, nullptr) << "no manifest, no application";
     writeApplication(scratch / "work/Dev.app");
     EXPECT_EQ(settle(), Notices{});
@@ -279,9 +330,35 @@ TEST_F(RegistryOnDisk, RegistrationByPath) {
     EXPECT_EQ(registry().applicationForURL(URL::file(scratch / "work/Dev.app")), nullptr);
     fs::rename(scratch / "away", scratch / "work");
     EXPECT_EQ(settle(), Notices{"+tool"});
-    EXPECT_TRUE(registry().unregisterPlugIn(linked));
+    EXPECT_TRUE(registry().unregisterPlugIn(URL::file(outside)));
     EXPECT_EQ(observer->take(), Notices{"-tool"});
-    EXPECT_FALSE(registry().unregisterPlugIn(linked));
+    EXPECT_FALSE(registry().unregisterPlugIn(URL::file(outside)));
+}
+
+TEST_F(RegistryOnDisk, MayRegisterWhoMayReadTheManifest) {
+    if (geteuid() != 0) GTEST_SKIP() << "for root's daemon";
+    start();
+    const std::string bundle = scratch / "work/tool.plugin";
+    const std::string manifest = bundle + "/Info.vlist";
+    writeManifest(bundle, plugInInfo("tool"));
+    ASSERT_EQ(chmod(scratch.path().c_str(), 0711), 0);
+    fs::create_directory_symlink(bundle, scratch / "link");
+    const auto may = [&](uid_t user, const std::string& name = "work/tool.plugin") {
+        const auto process = linux_::LinuxPeerProcess::look(getpid());
+        return registry().mayRegister(URL::file(scratch / name), {getpid(), user, user, process});
+    };
+    constexpr uid_t other = 65534;
+    EXPECT_TRUE(may(other));
+    EXPECT_FALSE(may(other, "link"));
+    ASSERT_EQ(chmod(bundle.c_str(), 0711), 0);
+    EXPECT_TRUE(may(other)) << "to list the directory is another right";
+    ASSERT_EQ(chmod(manifest.c_str(), 0600), 0);
+    EXPECT_FALSE(may(other));
+    EXPECT_TRUE(may(0)) << "root's own rights again";
+    ASSERT_EQ(chmod(manifest.c_str(), 0644), 0);
+    ASSERT_EQ(chmod((scratch / "work").c_str(), 0700), 0);
+    EXPECT_FALSE(may(other));
+    EXPECT_FALSE(registry().mayRegister(URL::file(bundle), {getpid(), other, other, nullptr})) << "groups unknown";
 }
 
 TEST_F(RegistryOnDisk, UnregisteredStaysAwayUntilRegisteredOrReplaced) {
@@ -339,16 +416,12 @@ TEST_F(RegistryOnDisk, UnusableBundlesAreLeftOut) {
     EXPECT_EQ(settle(), (Notices{"+copying", "+text"}));
     writeFile(bad("text"), "broken again");
     EXPECT_EQ(settle(), Notices{"-text"});
-}
 
-TEST_F(RegistryOnDisk, ManifestsLargerThanTheLimitAreRefused) {
     // The bytes of padding decide; the limit itself is allowed.
-    const std::string text = *encodeXML(plugInInfo("a"));
-    writeApplication(app);
-    start();
+    const std::string text = *encodeXML(plugInInfo("text"));
     for (const bool isTooLarge : {false, true}) {
-        writeFile(plugIn + "/Info.vlist", text + std::string((1U << 20U) - text.size() + isTooLarge, '\n'));
-        EXPECT_EQ(settle(), isTooLarge ? Notices{"-a"} : Notices{"+a"});
+        writeFile(bad("text"), text + std::string((1U << 20U) - text.size() + isTooLarge, '\n'));
+        EXPECT_EQ(settle(), isTooLarge ? Notices{"-text"} : Notices{"+text"});
     }
 }
 
@@ -402,27 +475,60 @@ TEST_F(RegistryOnDisk, ContainersAreMadeForPlugInsWithCode) {
     EXPECT_TRUE(at(app + "/PlugIns/old")->plugInDictionary);
 }
 
+TEST_F(RegistryOnDisk, ContainersOfRewrittenIdentifiersDoNotPileUp) {
+    const auto write = [&](const std::string& bundle, const std::string& identifier) {
+        writeManifest(app + "/PlugIns/" + bundle,
+                      Dictionary{{"VBBundleIdentifier", identifier}, {"VKExtension", Dictionary()}});
+    };
+    const auto containers = [&] {
+        const fs::path folder = linux_::Root(scratch.path()).users() + "/" + std::to_string(geteuid()) + "/Containers";
+        Notices names;
+        if (fs::exists(folder))
+            for (const auto& entry : fs::directory_iterator(folder)) names.push_back(entry.path().filename());
+        std::ranges::sort(names);
+        return names;
+    };
+    writeApplication(app);
+    start();
+    write("a.appex", "first");
+    write("b.appex", "shared");
+    write("c.appex", "shared");
+    EXPECT_EQ(settle().size(), 3U);
+    EXPECT_EQ(containers(), Notices{}) << "nobody asked for them";
+    for (const char* identifier : {"second", "third", "used"}) {
+        EXPECT_EQ(count(), 3U);
+        write("a.appex", identifier);
+        settle();
+        EXPECT_EQ(containers(), Notices{"shared"}) << identifier;
+    }
+    fs::create_directory(at(app + "/PlugIns/a.appex")->dataContainerURL->path() + "/data");
+    fs::remove_all(app + "/PlugIns/a.appex");
+    fs::remove_all(app + "/PlugIns/b.appex");
+    settle();
+    EXPECT_EQ(containers(), (Notices{"shared", "used"})) << "another one's, and what is not empty, stay";
+    fs::remove_all(app);
+    settle();
+    EXPECT_EQ(containers(), Notices{"used"});
+}
+
 TEST_F(RegistryOnDisk, DamagedDatabaseIsMovedAside) {
     const std::string file = scratch / "var/db/Catalix.sqlite";
     writeApplication(app, {"a"});
-    std::string bytes(8192, 'x');
-    for (const bool isWhollyDamaged : {true, false}) {
+    for (const std::uintmax_t soundBytes : {0, 4096}) {
         start();
         EXPECT_EQ(count(), 1U);
         stop();
-        if (!isWhollyDamaged) {
-            std::ifstream stream(file, std::ios::binary);
-            bytes.assign(std::istreambuf_iterator<char>(stream), {});
-            for (std::size_t i = 4096; i < bytes.size(); ++i) bytes[i] = static_cast<char>(i * 7);
-        }
+        const auto size = fs::file_size(file);
+        fs::resize_file(file, soundBytes);
+        std::ofstream(file, std::ios::binary | std::ios::app) << std::string(size - soundBytes, 'x');
         fs::remove(file + "-wal");
-        writeFile(file, bytes);
         start();
         EXPECT_EQ(count(), 1U);
-        EXPECT_TRUE(fs::exists(file + ".damaged"));
+        EXPECT_TRUE(fs::exists(file + ".damaged")) << soundBytes;
         const UUID uuid = uuidAt(plugIn);
         start();
         EXPECT_EQ(uuidAt(plugIn), uuid) << "the new one keeps";
+        fs::remove(file + ".damaged");
     }
     stop();
     fs::remove(file);

@@ -94,7 +94,7 @@ std::vector<std::string> identifiers(const std::vector<PlugInProxyRef>& proxies)
     return names;
 }
 
-TEST_P(AnyRegistry, InstalledPlugInsAreOrderedByUUIDAndFoundByIt) {
+TEST_P(AnyRegistry, InstalledPlugInsAreOrderedAndFoundByUUID) {
     const auto installed = registry.installedPlugIns();
     ASSERT_TRUE(installed);
     ASSERT_EQ(installed->size(), 3U);
@@ -104,15 +104,23 @@ TEST_P(AnyRegistry, InstalledPlugInsAreOrderedByUUIDAndFoundByIt) {
         EXPECT_EQ(registry.plugInForUUID(*proxy->uuid)->plugInIdentifier, proxy->plugInIdentifier);
     }
     EXPECT_EQ(registry.plugInForUUID(UUID::random()), nullptr);
+
+    const auto kept =
+        registry.plugInsMatching({}, [](const auto& identifier, const auto&) { return identifier != "a"; });
+    ASSERT_TRUE(kept);
+    auto names = identifiers(*kept);
+    std::ranges::sort(names);
+    EXPECT_EQ(names, (std::vector<std::string>{"b", "system"})) << "what the filter keeps";
 }
 
 TEST_P(AnyRegistry, PlugInForURLTakesFileURLsOfPlugInsOnly) {
-    ASSERT_NE(registry.plugInForURL(URL::file(world->plugIn("a"))), nullptr);
-    EXPECT_EQ(registry.plugInForURL(URL::file(world->plugIn("a")))->plugInIdentifier, "a");
-    EXPECT_NE(registry.plugInForURL(URL::file(world->plugIn("a") + "/")), nullptr);
-    EXPECT_EQ(registry.plugInForURL(URL::file(world->plugIn("a") + "x")), nullptr);
-    EXPECT_EQ(registry.plugInForURL(URL::file(world->application())), nullptr);
-    EXPECT_EQ(registry.plugInForURL(*URL::parse("https://host" + world->plugIn("a"))), nullptr);
+    const std::string path = world->plugIn("a");
+    for (const auto& url : {URL::file(path), URL::file(path + "/")}) {
+        ASSERT_NE(registry.plugInForURL(url), nullptr) << url.absoluteString();
+        EXPECT_EQ(registry.plugInForURL(url)->plugInIdentifier, "a");
+    }
+    for (const auto& url : {URL::file(path + "x"), URL::file(world->application()), *URL::parse("https://host" + path)})
+        EXPECT_EQ(registry.plugInForURL(url), nullptr) << url.absoluteString();
 }
 
 TEST_P(AnyRegistry, ApplicationGivesItsPlugInsInTheOrderOfTheirPaths) {
@@ -120,27 +128,16 @@ TEST_P(AnyRegistry, ApplicationGivesItsPlugInsInTheOrderOfTheirPaths) {
     ASSERT_NE(application, nullptr);
     EXPECT_TRUE(application->isApplication);
     EXPECT_EQ(identifiers(registry.plugInsOfApplication(*application)), (std::vector<std::string>{"a", "b"}));
-    EXPECT_EQ(registry.plugInForURL(URL::file(world->plugIn("a")))->containingBundle->bundleURL,
-              application->bundleURL);
+    const auto inside = registry.plugInForURL(URL::file(world->plugIn("a")));
+    EXPECT_EQ(inside->containingBundle->bundleURL, application->bundleURL);
+    EXPECT_FALSE(inside->onSystemPartition);
     EXPECT_EQ(registry.applicationForURL(URL::file(world->application() + "x")), nullptr);
     EXPECT_TRUE(registry.plugInsOfApplication(ApplicationRecord{URL::file("/none.app"), {}, {}}).empty());
-}
 
-TEST_P(AnyRegistry, SystemPlugInsHaveNoApplication) {
-    const auto proxy = registry.plugInForURL(URL::file(world->systemPlugIn()));
-    ASSERT_NE(proxy, nullptr);
-    EXPECT_TRUE(proxy->onSystemPartition);
-    EXPECT_EQ(proxy->containingBundle, nullptr);
-    EXPECT_FALSE(registry.plugInForURL(URL::file(world->plugIn("a")))->onSystemPartition);
-}
-
-TEST_P(AnyRegistry, PlugInsMatchingAnswersWhatTheFilterKeeps) {
-    const auto kept =
-        registry.plugInsMatching({}, [](const auto& identifier, const auto&) { return identifier != "a"; });
-    ASSERT_TRUE(kept);
-    auto names = identifiers(*kept);
-    std::ranges::sort(names);
-    EXPECT_EQ(names, (std::vector<std::string>{"b", "system"}));
+    const auto outside = registry.plugInForURL(URL::file(world->systemPlugIn()));
+    ASSERT_NE(outside, nullptr);
+    EXPECT_TRUE(outside->onSystemPartition);
+    EXPECT_EQ(outside->containingBundle, nullptr);
 }
 
 TEST_P(AnyRegistry, KnowledgeChangesWithTheDataAndOnlyThen) {
@@ -155,17 +152,14 @@ TEST_P(AnyRegistry, KnowledgeChangesWithTheDataAndOnlyThen) {
     EXPECT_NE(registry.plugInForURL(URL::file(world->plugIn("c"))), nullptr);
 }
 
-TEST_P(AnyRegistry, UnregisteredPlugInIsGone) {
+TEST_P(AnyRegistry, RegistrationIsRefusedAndUnregisteredIsGone) {
+    EXPECT_FALSE(registry.registerPlugIn(URL::file("/nowhere.appex")));
+    EXPECT_FALSE(registry.unregisterPlugIn(URL::file("/nowhere.appex")));
     world->allowRegistration();
     const auto uuid = *registry.plugInForURL(URL::file(world->plugIn("a")))->uuid;
     EXPECT_TRUE(registry.unregisterPlugIn(URL::file(world->plugIn("a"))));
     EXPECT_EQ(registry.plugInForURL(URL::file(world->plugIn("a"))), nullptr);
     EXPECT_EQ(registry.plugInForUUID(uuid), nullptr);
-}
-
-TEST_P(AnyRegistry, RegistrationIsRefused) {
-    EXPECT_FALSE(registry.registerPlugIn(URL::file("/nowhere.appex")));
-    EXPECT_FALSE(registry.unregisterPlugIn(URL::file("/nowhere.appex")));
 }
 
 TEST_P(AnyRegistry, StringsAndSDKsAreFoundByName) {
@@ -176,29 +170,6 @@ TEST_P(AnyRegistry, StringsAndSDKsAreFoundByName) {
     ASSERT_TRUE(registry.sdkDictionary("point"));
     EXPECT_EQ(registry.sdkDictionary("point")->string("key"), "value");
     EXPECT_FALSE(registry.sdkDictionary("other"));
-}
-
-// The twin's own promises.
-
-TEST(FakeRegistry, RefusesUnlessTold) {
-    support::FakeRegistry registry;
-    const auto url = URL::file("/x.appex");
-    EXPECT_FALSE(registry.registerPlugIn(url));
-    registry.allowRegistration();
-    registry.onRegister([&](const URL& at) { registry.install({.path = at.path(), .info = {}}); });
-    EXPECT_TRUE(registry.registerPlugIn(url));
-    EXPECT_NE(registry.plugInForURL(url), nullptr);
-    EXPECT_EQ(registry.calls("registerPlugIn"), 2);
-}
-
-TEST(FakeRegistry, CanAnswerNothing) {
-    support::FakeRegistry registry;
-    const auto proxy = registry.install({.path = "/x.appex", .info = {}});
-    registry.answerNothing();
-    EXPECT_FALSE(registry.installedPlugIns());
-    EXPECT_FALSE(registry.plugInsMatching({}, [](const auto&, const auto&) { return true; }));
-    EXPECT_EQ(registry.plugInForUUID(*proxy->uuid), nullptr);
-    EXPECT_FALSE(registry.knowledgeUUID());
 }
 
 } // namespace
