@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/Error.h"
+#include "platform/Transport.h"
 
 #include <cstddef>
 #include <string>
@@ -38,9 +39,17 @@ public:
     /// `path` is followed. What exists and is no regular file is not replaced.
     virtual Failure writeAtomically(const std::string& path, std::string_view bytes) = 0;
 
+    /// Adds `suffix` to the name of the file, symbolic links followed; an earlier file of that name is replaced. What
+    /// is no regular file stays. Fails with `fileReadNoSuchFileCode` when there is none.
+    virtual Failure setAside(const std::string& path, std::string_view suffix) = 0;
+
     /// The canonical path, as realpath(3) gives it; an error for what does not exist and for results of `limit` bytes
     /// or more.
     virtual Result<std::string> realPath(const std::string& path, std::size_t limit) = 0;
+
+    /// The same for a path that `peer` named, as far as that peer may look: for a privileged process, everything else
+    /// is an error too.
+    virtual Result<std::string> realPath(const std::string& path, std::size_t limit, const AuditToken& peer) = 0;
 };
 
 } // namespace platform

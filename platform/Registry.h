@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/PropertyList.h"
+#include "platform/Transport.h"
 #include "platform/Url.h"
 
 #include <cstdint>
@@ -77,15 +78,19 @@ public:
                                                                        const Filter& filter) = 0;
 
     virtual PlugInProxyRef plugInForUUID(const UUID& uuid) = 0;
-    /// File URLs only; the location is compared after symbolic links are resolved.
+    /// File URLs only. Locations are compared as they are: whoever asks for somebody else resolves symbolic links
+    /// first, with that one's rights.
     virtual PlugInProxyRef plugInForURL(const URL& url) = 0;
 
     virtual std::shared_ptr<const ApplicationRecord> applicationForURL(const URL& url) = 0;
     /// In the order of their paths.
     virtual std::vector<PlugInProxyRef> plugInsOfApplication(const ApplicationRecord& application) = 0;
 
+    /// Whether `peer` may have the plug-in at the location registered: to read its manifest must be its own right, for
+    /// the answers to hosts show it. A location that can only be reached through symbolic links is refused.
+    virtual bool mayRegister(const URL& url, const AuditToken& peer) = 0;
     // These two return after the notices of what they changed, and must not be called inside a notice.
-    /// False when there is no usable plug-in bundle at the location.
+    /// False when there is no usable plug-in bundle at the location itself; symbolic links are not followed.
     virtual bool registerPlugIn(const URL& url) = 0;
     /// False when nothing is registered there.
     virtual bool unregisterPlugIn(const URL& url) = 0;

@@ -25,6 +25,9 @@ namespace {
 
 constexpr std::size_t maximumPath = 1024; // bytes of a resolved path with its NUL; longer ones count as unresolved
 
+/// Registering a path takes some tenths of a millisecond, and handing over to the next slice a hundredth of that.
+constexpr std::size_t pathsPerSlice = 16;
+
 struct RequestType {
     std::string_view name;
     void (Transaction::*handler)();
@@ -111,9 +114,13 @@ bool Transaction::marshalPaths(const PathCallback& callback) {
         fail(code::malformed, "invalid request format");
         return false;
     }
-    for (const Value& element : *paths) {
+    return walkPaths(*paths, 0, paths->size(), callback);
+}
+
+bool Transaction::walkPaths(const Array& paths, std::size_t first, std::size_t end, const PathCallback& callback) {
+    for (std::size_t i = first; i < end; ++i) {
         if (!_client->acceptWork()) return false; // nobody is left to answer
-        const auto text = element.string();
+        const auto text = paths[i].string();
         if (!text) {
             fail(code::malformed, "invalid request format");
             return false;
@@ -123,16 +130,39 @@ bool Transaction::marshalPaths(const PathCallback& callback) {
             fail(code::badPath, platform::format("absolute path required: %s", path));
             return false;
         }
-        const auto resolved = server()->platform().files.realPath(path, maximumPath);
-        if (!callback(resolved ? *resolved : path, static_cast<bool>(resolved))) return false;
+        const auto resolved = realPath(path);
+        if (!callback(resolved.value_or(path), resolved.has_value())) return false;
     }
     return true;
 }
 
-bool Transaction::processPaths(const PathCallback& callback) {
-    if (!marshalPaths(callback)) return false;
-    done();
-    return true;
+void Transaction::processPaths(PathCallback callback) {
+    const auto paths = _request.array(key::paths);
+    if (!paths) return fail(code::malformed, "invalid request format");
+    processSlice(*paths, 0, std::move(callback));
+}
+
+void Transaction::processSlice(const Array& paths, std::size_t first, PathCallback callback) {
+    const std::size_t end = std::min(first + pathsPerSlice, paths.size());
+    if (!walkPaths(paths, first, end, callback)) return;
+    if (end == paths.size()) return done();
+    _client->goOnLater([self = shared_from_this(), paths, end, callback = std::move(callback)] {
+        self->processSlice(paths, end, callback);
+    });
+}
+
+/// The path as the client's user may see it; none for what does not exist, and for what that user cannot reach.
+std::optional<std::string> Transaction::realPath(const std::string& path) const {
+    const auto peer = connection();
+    if (!peer) return std::nullopt;
+    const auto resolved = server()->platform().files.realPath(path, maximumPath, peer->peerAuditToken());
+    return resolved ? std::optional(*resolved) : std::nullopt;
+}
+
+ZBDPlugInRef Transaction::plugInAt(const platform::URL& url) {
+    if (auto plugIn = server()->findPlugInAtPath(url)) return plugIn;
+    const auto path = url.isFile() ? realPath(url.path()) : std::nullopt;
+    return path && *path != url.path() ? server()->findPlugInAtPath(platform::URL::file(*path)) : nullptr;
 }
 
 bool Transaction::processUuidList(const PlugInCallback& callback) {
@@ -179,7 +209,7 @@ ZBDPlugInRef Transaction::plugInOfList(const UUID& uuid, const Array* paths, std
     const auto path = (*paths)[index].string();
     if (!path) return nullptr;
     log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", uuid, *path);
-    return server()->findPlugInAtPath(platform::URL::file(*path));
+    return plugInAt(platform::URL::file(*path));
 }
 
 } // namespace zbd

@@ -7,8 +7,10 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace zbd {
 
@@ -37,9 +39,10 @@ public:
 
     // The walks over a request's plug-in list. One that returns false has answered, or has nobody to answer.
     bool marshalPaths(const PathCallback& callback);
-    /// As `marshalPaths`; when every path was processed the success reply has been sent.
-    bool processPaths(const PathCallback& callback);
     bool processUuidList(const PlugInCallback& callback);
+    /// As `marshalPaths`, and then sends the success reply. A long list is walked in slices, between which others are
+    /// served: when this returns, the walk may have only begun.
+    void processPaths(PathCallback callback);
 
     /// Sends the reply as it stands. The reply is not touched afterwards.
     void done();
@@ -74,6 +77,14 @@ private:
     Transaction(const platform::ReceivedMessage& message, std::shared_ptr<ZBDQmxClient> client);
     ZBDPlugInRef findPlugInByUUID(const platform::UUID& uuid);
     ZBDPlugInRef findPlugInByPathURL(std::string_view text);
+    void preferBundleRelativeForHost(std::vector<ZBDPlugInRef>& candidates);
+    void releaseHolds(const platform::Array& tokens);
+    bool collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugInRef>& plugIns);
+    bool mayRegister(const platform::URL& url) const;
+    ZBDPlugInRef plugInAt(const platform::URL& url);
+    std::optional<std::string> realPath(const std::string& path) const;
+    bool walkPaths(const platform::Array& paths, std::size_t first, std::size_t end, const PathCallback& callback);
+    void processSlice(const platform::Array& paths, std::size_t first, PathCallback callback);
     ZBDPlugInRef plugInOfList(const platform::UUID& uuid, const platform::Array* paths, std::size_t index);
 
     std::shared_ptr<ZBDQmxClient> _client;

@@ -16,7 +16,7 @@ ZBDPlugInRef Transaction::findPlugInByUUID(const UUID& uuid) { return server()->
 
 ZBDPlugInRef Transaction::findPlugInByPathURL(std::string_view text) {
     const auto url = URL::parse(text);
-    return url ? server()->findPlugInAtPath(*url) : nullptr;
+    return url ? plugInAt(*url) : nullptr;
 }
 
 void Transaction::findPlugIn() {

@@ -19,13 +19,18 @@ void Transaction::addPlugIns() {
             return false;
         }
         platform::trace::pluginAdd(path.c_str());
-        if (server()->addPlugIn(URL::file(path))) {
+        if (!mayRegister(URL::file(path)) || server()->addPlugIn(URL::file(path))) {
             log::ops().notice("failed to register plug-in at %@", path);
             fail(code::registrationFailed, platform::format("unable to register plug-in at %@", path));
             return false;
         }
         return true;
     });
+}
+
+bool Transaction::mayRegister(const URL& url) const {
+    const auto peer = connection();
+    return peer && server()->platform().registry.mayRegister(url, peer->peerAuditToken());
 }
 
 void Transaction::removePlugIns() {

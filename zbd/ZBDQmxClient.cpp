@@ -78,7 +78,7 @@ void ZBDQmxClient::handleRequest(const ReceivedMessage& message) {
         if (++self->_requestCount % requestCountInterval == 0) {
             log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
         }
-        transaction->dispatch();
+        self->serve(transaction);
     };
     if (isBrief) {
         _server->submitBriefWork(std::move(work));
@@ -87,12 +87,31 @@ void ZBDQmxClient::handleRequest(const ReceivedMessage& message) {
     }
 }
 
+void ZBDQmxClient::serve(const std::shared_ptr<Transaction>& transaction) {
+    if (_goesOn) return _behind.push_back(transaction);
+    transaction->dispatch();
+}
+
+void ZBDQmxClient::goOnLater(std::function<void()> rest) {
+    _goesOn = true;
+    _server->submitWork([self = shared_from_this(), rest = std::move(rest)] {
+        self->_goesOn = false;
+        rest();
+        if (self->_goesOn || self->_behind.empty()) return;
+        // Each in a turn of its own: there may be many.
+        self->goOnLater([next = std::move(self->_behind.front())] { next->dispatch(); });
+        self->_behind.pop_front();
+    });
+}
+
 void ZBDQmxClient::dying() { log::ops().debug("client %d termination imminent", pid()); }
 
 void ZBDQmxClient::dead() {
     _server->unholdClient(shared_from_this());
     log::ops().debug("client %d is dead", pid());
     _acceptWork.store(false, std::memory_order_relaxed);
+    // A request that is being served may have added a hold since; later ones see that nobody waits for them.
+    _server->unholdClient(shared_from_this());
     platform::trace::clientDone(pid());
 }
 

@@ -6,12 +6,15 @@
 
 #include <atomic>
 #include <cstdint>
+#include <deque>
+#include <functional>
 #include <memory>
 #include <string>
 #include <string_view>
 
 namespace zbd {
 
+class Transaction;
 class ZBDServer;
 
 /// One connected host: who it is, and what it asks. Kept alive by its connection, which it holds only weakly.
@@ -34,6 +37,10 @@ public:
     /// The connection is invalid: the holds end, and requests that still wait are dropped.
     void dead();
 
+    /// Runs `rest`, what remains of a request, in a later turn of the service queue: other clients are served between,
+    /// and this client's own later requests after it. On the service queue.
+    void goOnLater(std::function<void()> rest);
+
     std::string description() const;
 
     bool acceptWork() const { return _acceptWork.load(std::memory_order_relaxed); }
@@ -49,9 +56,12 @@ private:
     ZBDQmxClient(const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZBDServer> server);
     void handleEvent(const platform::ConnectionEvent& event);
     void handleRequest(const platform::ReceivedMessage& message);
+    void serve(const std::shared_ptr<Transaction>& transaction);
 
-    std::atomic<bool> _acceptWork{true}; // written on the delivery thread, read on the service queue
-    std::uint32_t _requestCount = 0;     // on the service queue only
+    std::atomic<bool> _acceptWork{true};              // written on the delivery thread, read on the service queue
+    std::uint32_t _requestCount = 0;                  // on the service queue only
+    bool _goesOn = false;                             // on the service queue only
+    std::deque<std::shared_ptr<Transaction>> _behind; // what waits meanwhile; on the service queue only
     std::weak_ptr<platform::Connection> _connection;
     std::shared_ptr<ZBDServer> _server;
     std::string _path;

@@ -7,8 +7,11 @@
 #include <climits>
 #include <dirent.h>
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <memory>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 namespace platform::linux_ {
 
@@ -43,6 +46,13 @@ Descriptor openDirectory(const std::string& path) {
     return directory;
 }
 
+Descriptor openReference(const std::string& path, std::uint64_t resolve) {
+    open_how how{};
+    how.flags = O_PATH | O_CLOEXEC;
+    how.resolve = resolve;
+    return Descriptor(static_cast<int>(syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
+}
+
 bool isShortage(int number) {
     return number == EMFILE || number == ENFILE || number == ENOMEM || number == EIO || number == EINTR;
 }
@@ -68,7 +78,8 @@ std::optional<DirectoryListing> listDirectory(int directory) {
     return listing;
 }
 
-Result<std::optional<std::string>> readFile(int directory, const std::string& name, std::size_t limit) {
+Result<std::optional<std::string>> readFile(int directory, const std::string& name, std::size_t limit,
+                                            int (*refusal)(int descriptor)) {
     Descriptor file(openat(directory, name.c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW | O_NOCTTY | O_CLOEXEC));
     if (!file) {
         if (errno == ENOENT) return std::optional<std::string>();
@@ -77,6 +88,7 @@ Result<std::optional<std::string>> readFile(int directory, const std::string& na
     struct stat status{};
     if (fstat(file.get(), &status) != 0) return systemError(errno, name);
     if (!S_ISREG(status.st_mode)) return Error{posixErrorDomain, EINVAL, name + ": not a regular file"};
+    if (const int number = refusal != nullptr ? refusal(file.get()) : 0) return systemError(number, name);
     const Error tooLarge{posixErrorDomain, EFBIG, name + ": larger than " + std::to_string(limit) + " bytes"};
     if (static_cast<std::uint64_t>(status.st_size) > limit) return tooLarge;
     // The size is a hint, for the file may be growing; one byte more shows the end without another round.

@@ -4,6 +4,7 @@
 #include "platform/linux/Descriptor.h"
 
 #include <cstddef>
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -18,6 +19,10 @@ Descriptor openDirectory(int parent, const std::string& name);
 /// An absolute path, none of whose components may be a symbolic link.
 Descriptor openDirectory(const std::string& path);
 
+/// What lies at `path`, as a mere reference (O_PATH): no right to the file itself is asked for, and no device acts.
+/// `resolve` says which links may not be passed (the RESOLVE_ flags of openat2). Not open, with errno set, on failure.
+Descriptor openReference(const std::string& path, std::uint64_t resolve);
+
 /// True for an errno value that says more of this process or machine than of the file: another time it may work.
 bool isShortage(int number);
 
@@ -29,8 +34,10 @@ struct DirectoryListing {
 };
 std::optional<DirectoryListing> listDirectory(int directory);
 
-/// The bytes of a regular file; none when there is no such name. Never blocks on pipes and devices.
-Result<std::optional<std::string>> readFile(int directory, const std::string& name, std::size_t limit);
+/// The bytes of a regular file; none when there is no such name. Never blocks on pipes and devices. `refusal` looks at
+/// the open file before it is read: zero, or the errno value to fail with.
+Result<std::optional<std::string>> readFile(int directory, const std::string& name, std::size_t limit,
+                                            int (*refusal)(int descriptor) = nullptr);
 
 /// Whether `name` can be one component of a path: no separator, not "." or "..", printable, of a bounded length.
 bool isFileName(std::string_view name);

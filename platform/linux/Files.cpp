@@ -1,15 +1,19 @@
 #include "platform/linux/Files.h"
 
+#include "platform/linux/ActingAsPeer.h"
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/DirectoryFiles.h"
 #include "platform/linux/ProcPath.h"
 
 #include <algorithm>
 #include <climits>
 #include <cstdlib>
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <memory>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace platform::linux_ {
 
@@ -187,11 +191,46 @@ Failure Files::writeAtomically(const std::string& path, std::string_view bytes) 
     return std::nullopt;
 }
 
+Failure Files::setAside(const std::string& path, std::string_view suffix) {
+    Target target;
+    if (int number = openTarget(path, target); number != 0 || !target.directory) return readError(number, path);
+    const int directory = target.directory.get();
+    struct stat status{};
+    if (fstatat(directory, target.name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) return readError(errno, path);
+    if (!S_ISREG(status.st_mode)) return Error{fileErrorDomain, fileWriteUnknownCode, path + ": not a regular file"};
+    const std::string aside = target.name + std::string(suffix);
+    if (renameat(directory, target.name.c_str(), directory, aside.c_str()) != 0) return writeError(errno, path);
+    return std::nullopt;
+}
+
 Result<std::string> Files::realPath(const std::string& path, std::size_t limit) {
     std::unique_ptr<char, decltype(&std::free)> resolved(realpath(path.c_str(), nullptr), &std::free);
     if (!resolved) return readError(errno, path);
     std::string result = resolved.get();
     if (result.size() >= limit) return readError(ENAMETOOLONG, path);
+    return result;
+}
+
+Result<std::string> Files::realPath(const std::string& path, std::size_t limit, const AuditToken& peer) {
+    if (geteuid() != 0) return realPath(path, limit);
+    Descriptor located;
+    {
+        const ActingAsPeer acting(rightsOfPeer(peer));
+        if (!acting.isReady()) return readError(EACCES, path);
+        located = openReference(path, RESOLVE_NO_MAGICLINKS);
+        if (!located) return readError(errno, path);
+    }
+    // The name of what the peer reached; going the way once more could lead elsewhere by now.
+    char name[PATH_MAX];
+    const ssize_t size = readlink(procPath(located.get()).c_str(), name, sizeof name);
+    if (size < 0) return readError(errno, path);
+    std::string result(name, static_cast<std::size_t>(size));
+    if (result.size() >= std::min(limit, sizeof name)) return readError(ENAMETOOLONG, path);
+    // What was deleted meanwhile, or has no name in this file tree, is shown with a name that is not its own.
+    struct stat reached{};
+    struct stat named{};
+    if (fstat(located.get(), &reached) != 0 || lstat(result.c_str(), &named) != 0) return readError(errno, path);
+    if (reached.st_dev != named.st_dev || reached.st_ino != named.st_ino) return readError(ENOENT, path);
     return result;
 }
 

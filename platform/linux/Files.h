@@ -16,7 +16,11 @@ public:
     /// So writers in any number of threads and processes take turns, and what a killed writer left is one file at the
     /// most, which the next save takes over.
     Failure writeAtomically(const std::string& path, std::string_view bytes) override;
+    Failure setAside(const std::string& path, std::string_view suffix) override;
     Result<std::string> realPath(const std::string& path, std::size_t limit) override;
+    /// Never leads through the links of /proc that stand for open files and directories of processes: to follow them is
+    /// the daemon's right, whoever it acts as.
+    Result<std::string> realPath(const std::string& path, std::size_t limit, const AuditToken& peer) override;
 
 private:
     Root _root;

@@ -21,11 +21,11 @@ ProgramIdentity ProgramIdentity::ofProcess(pid_t pid) {
     return {status.st_dev, status.st_ino};
 }
 
-std::shared_ptr<const LinuxPeerProcess> LinuxPeerProcess::look(pid_t pid, Descriptor pidfd) {
+std::shared_ptr<const LinuxPeerProcess> LinuxPeerProcess::look(pid_t pid, Descriptor pidfd, std::vector<gid_t> groups) {
     // Close-on-exec from birth.
     if (!pidfd) pidfd = Descriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
     if (!pidfd) return nullptr;
-    std::shared_ptr<LinuxPeerProcess> process(new LinuxPeerProcess(pid, std::move(pidfd)));
+    std::shared_ptr<LinuxPeerProcess> process(new LinuxPeerProcess(pid, std::move(pidfd), std::move(groups)));
     process->_program = ProgramIdentity::ofProcess(pid);
     std::array<char, PATH_MAX> path;
     const ssize_t length = ::readlink(executableLink(pid).c_str(), path.data(), path.size());

@@ -7,6 +7,7 @@
 #include <string>
 #include <sys/types.h>
 #include <utility>
+#include <vector>
 
 namespace platform::linux_ {
 
@@ -25,13 +26,16 @@ struct ProgramIdentity {
 /// passes for it, and neither does the same process after it ran another program.
 class LinuxPeerProcess final : public PeerProcess {
 public:
-    /// Looks at `pid` now. Without `pidfd` one is opened. None when there is no such process.
-    static std::shared_ptr<const LinuxPeerProcess> look(pid_t pid, Descriptor pidfd = Descriptor());
+    /// Looks at `pid` now. Without `pidfd` one is opened. None when there is no such process. `groups` are the
+    /// supplementary ones that it had when it connected.
+    static std::shared_ptr<const LinuxPeerProcess> look(pid_t pid, Descriptor pidfd = Descriptor(),
+                                                        std::vector<gid_t> groups = {});
 
     pid_t pid() const { return _pid; }
     /// Owned by this object; becomes readable when the process ends.
     int pidfd() const { return _pidfd.get(); }
     const ProgramIdentity& program() const { return _program; }
+    const std::vector<gid_t>& groups() const { return _groups; }
     /// The path of that program as the kernel named it then. Empty when it could not be read.
     const std::string& executablePath() const { return _executablePath; }
 
@@ -42,10 +46,12 @@ public:
     bool isUnchanged() const;
 
 private:
-    LinuxPeerProcess(pid_t pid, Descriptor pidfd) : _pid(pid), _pidfd(std::move(pidfd)) {}
+    LinuxPeerProcess(pid_t pid, Descriptor pidfd, std::vector<gid_t> groups)
+        : _pid(pid), _pidfd(std::move(pidfd)), _groups(std::move(groups)) {}
 
     pid_t _pid;
     Descriptor _pidfd;
+    std::vector<gid_t> _groups;
     ProgramIdentity _program;
     std::string _executablePath;
 };

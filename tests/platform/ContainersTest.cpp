@@ -22,16 +22,22 @@ protected:
     std::string own = root.users() + "/" + std::to_string(geteuid());
 };
 
-TEST_F(ContainersOnDisk, UserContainerIsMadePrivateWithItsParents) {
+TEST_F(ContainersOnDisk, UserContainerIsMadePrivateAndDiscardedWhileEmpty) {
     const auto path = containers.userContainer("com.example.a");
     ASSERT_TRUE(path);
     EXPECT_EQ(*path, own + "/Containers/com.example.a");
-    EXPECT_EQ(*containers.userContainer("com.example.a"), *path) << "found again";
     for (const std::string& directory : {own, own + "/Containers", *path}) {
         struct stat status{};
         ASSERT_EQ(stat(directory.c_str(), &status), 0);
         EXPECT_EQ(status.st_mode & 07777U, 0700U) << directory;
     }
+    std::filesystem::create_directory(*path + "/used");
+    for (const char* identifier : {"com.example.a", "missing", ".", "..", "com.example.a/used"})
+        containers.discardEmpty(identifier);
+    EXPECT_EQ(*containers.userContainer("com.example.a"), *path) << "found again";
+    EXPECT_TRUE(std::filesystem::remove(*path + "/used"));
+    containers.discardEmpty("com.example.a");
+    EXPECT_FALSE(std::filesystem::exists(*path));
 }
 
 TEST_F(ContainersOnDisk, UserContainerRefusesNamesThatAreNoNames) {
@@ -60,13 +66,9 @@ TEST_F(ContainersOnDisk, UserContainerRefusesWhatOthersCouldControl) {
     ASSERT_EQ(chmod(own.c_str(), 0700), 0);
     ASSERT_EQ(chmod(root.users().c_str(), 0777), 0);
     EXPECT_EQ(errorOf("new"), EACCES) << "anybody could exchange users' directories";
-}
-
-TEST_F(ContainersOnDisk, UserContainerRefusesAForeignOwner) {
+    ASSERT_EQ(chmod(root.users().c_str(), 0755), 0);
     platform::linux_::Containers others(root, geteuid() + 1); // everything that is made here belongs to us
-    const auto container = others.userContainer("a");
-    ASSERT_FALSE(container);
-    EXPECT_EQ(container.error().code, EPERM);
+    EXPECT_EQ(others.userContainer("a").error().code, EPERM);
 }
 
 TEST(FakeContainers, UserContainerRefusesUntilAllowed) {

@@ -16,6 +16,8 @@ public:
     int failure = 0;
     /// Every identifier asked for.
     std::vector<std::string> asked;
+    /// Every identifier whose container was not wanted any longer.
+    std::vector<std::string> discarded;
 
     void allow(const std::string& identifier, const std::string& path) { _paths[identifier] = path; }
 
@@ -25,6 +27,7 @@ public:
         if (failure == 0 && found != _paths.end()) return found->second;
         return platform::Error{platform::posixErrorDomain, failure != 0 ? failure : EACCES, "container refused"};
     }
+    void discardEmpty(const std::string& identifier) override { discarded.push_back(identifier); }
 
 private:
     std::map<std::string, std::string> _paths;

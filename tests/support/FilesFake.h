@@ -2,8 +2,10 @@
 
 #include "platform/Files.h"
 
+#include <cstdint>
 #include <map>
 #include <optional>
+#include <set>
 #include <string>
 
 namespace support {
@@ -19,10 +21,13 @@ public:
     /// Set: every call of the operation fails with it.
     std::optional<platform::Error> readFailure;
     std::optional<platform::Error> writeFailure;
+    std::optional<platform::Error> setAsideFailure;
     std::optional<platform::Error> realPathFailure;
     int writes = 0; // attempts, failed ones too
 
     void addDirectory(const std::string& path) { _directories[path] = true; }
+    /// From now on peers of that user reach everything here; others reach nothing.
+    void allowPeers(std::uint32_t user) { _users.insert(user); }
 
     std::string locate(const std::string& wellKnownPath) override { return wellKnownPath; }
 
@@ -47,6 +52,16 @@ public:
         return std::nullopt;
     }
 
+    platform::Failure setAside(const std::string& path, std::string_view suffix) override {
+        if (setAsideFailure) return setAsideFailure;
+        const std::string target = follow(path);
+        if (_directories.contains(target)) return error(platform::fileWriteUnknownCode, "not a regular file");
+        auto file = files.extract(target);
+        if (!file) return error(platform::fileReadNoSuchFileCode, "No such file or directory");
+        files[target + std::string(suffix)] = std::move(file.mapped());
+        return std::nullopt;
+    }
+
     platform::Result<std::string> realPath(const std::string& path, std::size_t limit) override {
         if (realPathFailure) return *realPathFailure;
         std::string target = follow(path);
@@ -54,6 +69,12 @@ public:
             return error(platform::fileReadNoSuchFileCode, "No such file or directory");
         if (target.size() >= limit) return error(platform::fileReadUnknownCode, "File name too long");
         return target;
+    }
+
+    platform::Result<std::string> realPath(const std::string& path, std::size_t limit,
+                                           const platform::AuditToken& peer) override {
+        if (!_users.contains(peer.uid)) return error(platform::fileReadNoPermissionCode, "Permission denied");
+        return realPath(path, limit);
     }
 
 private:
@@ -65,6 +86,7 @@ private:
     }
 
     std::map<std::string, bool> _directories;
+    std::set<std::uint32_t> _users;
 };
 
 } // namespace support

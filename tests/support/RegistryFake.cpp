@@ -143,6 +143,11 @@ std::vector<PlugInProxyRef> FakeRegistry::plugInsOfApplication(const platform::A
     return plugIns;
 }
 
+bool FakeRegistry::mayRegister(const platform::URL& url, const platform::AuditToken&) {
+    if (called("mayRegister")) return false;
+    return locked([&] { return _registrationAllowed && !_closed.contains(url.path()); });
+}
+
 bool FakeRegistry::registerPlugIn(const platform::URL& url) {
     if (called("registerPlugIn")) return false;
     auto [allowed, action] = locked([&] { return std::pair(_registrationAllowed, _onRegister); });

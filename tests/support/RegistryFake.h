@@ -45,6 +45,10 @@ public:
     void setSDKDictionary(const std::string& extensionPoint, platform::Dictionary dictionary);
 
     // What it does when asked.
+    /// No peer may have the plug-in at `path` registered. The others follow `allowRegistration`.
+    void close(const std::string& path) {
+        locked([&] { _closed.insert(path); });
+    }
     void allowRegistration(bool allow = true) {
         locked([&] { _registrationAllowed = allow; });
     }
@@ -86,6 +90,7 @@ public:
     platform::PlugInProxyRef plugInForURL(const platform::URL& url) override;
     std::shared_ptr<const platform::ApplicationRecord> applicationForURL(const platform::URL& url) override;
     std::vector<platform::PlugInProxyRef> plugInsOfApplication(const platform::ApplicationRecord& application) override;
+    bool mayRegister(const platform::URL& url, const platform::AuditToken& peer) override;
     bool registerPlugIn(const platform::URL& url) override;
     bool unregisterPlugIn(const platform::URL& url) override;
     void clearSchemaCaches() override { (void)called("clearSchemaCaches"); }
@@ -114,6 +119,7 @@ private:
     std::vector<std::weak_ptr<platform::RegistryObserver>> _observers;
     std::map<std::string, std::function<void()>> _before;
     std::map<std::string, int> _calls;
+    std::set<std::string> _closed;
     std::function<void(const platform::URL&)> _onRegister;
     std::function<void(const platform::URL&)> _onUnregister;
     std::optional<platform::UUID> _knowledge = platform::UUID::random();
