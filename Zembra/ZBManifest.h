@@ -14,6 +14,7 @@ inline constexpr std::string_view bundleName = "VBBundleName";
 inline constexpr std::string_view bundlePackageType = "VBBundlePackageType";
 inline constexpr std::string_view bundleShortVersionString = "VBBundleShortVersionString";
 inline constexpr std::string_view bundleVersion = "VBBundleVersion";
+inline constexpr std::string_view qmxService = "QMXService"; // describes the plug-in as a service; see `service`
 inline constexpr std::string_view bundleInfoVlistURL = "VBBundleInfoVlistURL";
 
 // Of the plug-in dictionary.
@@ -45,3 +46,13 @@ inline constexpr std::string_view dataProtocol = "#Data";      // a plug-in with
 inline constexpr std::string_view appExtensionSuffix = ".appex";
 
 } // namespace zembra::manifest
+
+/// The keys of a plug-in's service description.
+namespace zembra::service {
+
+inline constexpr std::string_view environmentVariables = "EnvironmentVariables";
+// Set by the daemon for the service manager.
+inline constexpr std::string_view sandboxProfile = "_SandboxProfile";
+inline constexpr std::string_view omitSandboxParameters = "_OmitSandboxParameters";
+
+} // namespace zembra::service

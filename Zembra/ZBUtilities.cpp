@@ -56,6 +56,21 @@ std::weak_ordering compareVersionString(std::string_view left, std::string_view 
     return left.size() <=> right.size();
 }
 
+std::string comparableVersion(std::string_view version) {
+    std::string text;
+    text.reserve(version.size());
+    while (!version.empty()) {
+        if (isDigit(version.front())) {
+            const std::string_view number = takeNumber(version);
+            text.append(number.empty() ? "0" : number);
+        } else {
+            text.push_back(version.front());
+            version.remove_prefix(1);
+        }
+    }
+    return text;
+}
+
 platform::Error errorWithCode(std::int64_t code, std::optional<std::string> description) {
     return {errorDomain, code, std::move(description)};
 }

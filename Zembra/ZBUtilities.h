@@ -39,6 +39,9 @@ template <class T> platform::Value valueOrAbsent(const std::optional<T>& value) 
 /// characters by their code. So "1.9" comes before "1.10", and "1.01" is as good as "1.1".
 std::weak_ordering compareVersionString(std::string_view left, std::string_view right);
 
+/// A text that is the same for exactly the versions that compare as equal: without the leading zeros of numbers.
+std::string comparableVersion(std::string_view version);
+
 /// An error of the system's own domain.
 platform::Error errorWithCode(std::int64_t code, std::optional<std::string> description = std::nullopt);
 

@@ -18,6 +18,7 @@ namespace {
 
 constexpr std::string_view versionKey = "version";
 constexpr std::string_view dataKey = "data";
+constexpr std::string_view damagedSuffix = ".damaged";
 
 platform::Result<std::string> encodedDatabase(const Dictionary& annotations) {
     auto bytes =
@@ -42,8 +43,11 @@ std::unique_ptr<ZBDAnnotationStore> ZBDAnnotationStore::initWithDatabase(platfor
     if (error.code != platform::fileReadNoSuchFileCode) {
         log::ops().error("unable to load annotation database:%{public}@ error:%{public}@ (resetting)",
                          store->_annotationsURL, error);
+        store->_isFileDamaged = true;
     }
-    if (store->loadDb(containerURL(platform), error)) {
+    const auto container = containerURL(platform);
+    if (!container) return nullptr;
+    if (store->loadDb(*container, error)) {
         log::ops().info("migrating shared annotations");
         if (!store->saveDb(error)) {
             log::ops().error("unable to save migrated annotations to %{public}@ error:%{public}@",
@@ -104,13 +108,18 @@ bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
     return false;
 }
 
-bool ZBDAnnotationStore::saveDb(Error& error) const {
-    const auto bytes = encodedDatabase(_annotations);
-    if (!bytes) {
-        error = bytes.error();
-        return false;
-    }
-    auto failure = _platform.files.writeAtomically(_annotationsURL.path(), *bytes);
+bool ZBDAnnotationStore::saveDb(Error& error) {
+    const auto save = [&]() -> platform::Failure {
+        const auto bytes = encodedDatabase(_annotations);
+        if (!bytes) return bytes.error();
+        if (_isFileDamaged) {
+            auto failure = _platform.files.setAside(_annotationsURL.path(), damagedSuffix);
+            if (failure && failure->code != platform::fileReadNoSuchFileCode) return failure;
+            _isFileDamaged = false;
+        }
+        return _platform.files.writeAtomically(_annotationsURL.path(), *bytes);
+    };
+    auto failure = save();
     if (!failure) return true;
     error = std::move(*failure);
     return false;
@@ -122,12 +131,14 @@ URL ZBDAnnotationStore::globalURL(platform::Platform& platform) {
     return URL::file(platform.files.locate("/var/db/Zembra-Annotations"));
 }
 
-URL ZBDAnnotationStore::containerURL(platform::Platform& platform) {
+std::optional<URL> ZBDAnnotationStore::containerURL(platform::Platform& platform) {
     auto path = platform.containers.userContainer("com.nordane.zbd");
     if (path) return URL::file(*path);
     const auto number = static_cast<std::uint64_t>(path.error().code);
     log::ops().error("failed to get storage container: error=%llu", number);
-    zembra::fatalInternalError(platform::format("unable to locate user container: error %llu", number));
+    log::ops().error("unable to locate user container: error %llu", number);
+    log::ops().error("annotations of earlier versions cannot be looked for: %{public}@", path.error());
+    return std::nullopt;
 }
 
 } // namespace zbd

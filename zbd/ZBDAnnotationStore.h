@@ -25,7 +25,7 @@ public:
     static constexpr std::size_t maximumFileSize = std::size_t{64} << 20U;
 
     /// A store with its table loaded, migrated or empty. `path` is taken as written; none means the default location.
-    /// Never writes unless it migrates. Ends the process when the container service fails.
+    /// Never writes unless it migrates. Null, with the reason logged, when the container service fails.
     static std::unique_ptr<ZBDAnnotationStore> initWithDatabase(platform::Platform& platform,
                                                                 const std::optional<std::string>& path);
 
@@ -39,14 +39,16 @@ public:
 
     /// False, with `error` set, when no table could be loaded; the present table then is as it was.
     bool loadDb(const platform::URL& url, platform::Error& error);
-    bool saveDb(platform::Error& error) const;
+    /// Replaces the file. One that could not be loaded holds what the user once chose, so it is kept beside the new one
+    /// with the suffix ".damaged"; while it cannot be, nothing is saved.
+    bool saveDb(platform::Error& error);
 
     const platform::URL& annotationsURL() const { return _annotationsURL; }
     const platform::MutableDictionary& annotations() const { return _annotations; }
 
     static platform::URL defaultDatabaseURL(platform::Platform& platform);
     static platform::URL globalURL(platform::Platform& platform);
-    static platform::URL containerURL(platform::Platform& platform);
+    static std::optional<platform::URL> containerURL(platform::Platform& platform);
 
 private:
     ZBDAnnotationStore(platform::Platform& platform, platform::URL url);
@@ -54,6 +56,7 @@ private:
     platform::Platform& _platform;
     platform::URL _annotationsURL;
     platform::MutableDictionary _annotations; // annotation key to annotation
+    bool _isFileDamaged = false;              // as long as the file that could not be loaded is in its place
 };
 
 } // namespace zbd

@@ -47,6 +47,12 @@ std::optional<Options> parse(int argc, char** argv) {
     return optind == argc ? std::optional(options) : std::nullopt;
 }
 
+/// Ends the process without exit handlers: those of libraries take away what other threads are still using.
+[[noreturn]] void end(platform::linux_::LinuxPlatform& services, int status) {
+    services.removeNames();
+    std::_Exit(status);
+}
+
 } // namespace
 
 int main(int argc, char** argv) {
@@ -62,14 +68,13 @@ int main(int argc, char** argv) {
     const auto server = zbd::ZBDServer::initForService(platform, options->service, options->database);
     if (!server) {
         log::ops().error("unable to construct server");
-        return exitNoServer;
+        end(services, exitNoServer);
     }
     server->setVerbose(options->verbose);
     server->setCacheLimit(options->cacheLimit);
     const auto terminate = platform.runLoop.makeSignalSource(SIGTERM, [&server] {
         server->stop();
-        // Without exit handlers: those of libraries take away what other threads are still using.
-        std::_Exit(EXIT_SUCCESS);
+        end(services, EXIT_SUCCESS);
     });
     terminate->activate();
     server->run();

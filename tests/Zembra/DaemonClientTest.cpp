@@ -7,31 +7,24 @@
 
 namespace {
 
-using platform::Array;
-using platform::Dictionary;
-using platform::Failure;
-using platform::ReplyOrError;
-using platform::UUID;
-using platform::Value;
+using namespace platform;
+using support::logged;
 using support::processLog;
 using zembra::ZBDaemonClient;
 
 /// A daemon that keeps what it is asked and answers `reply`.
-class DaemonClientTest : public testing::Test {
-protected:
-    void listen(const std::string& service) {
+struct DaemonClient : testing::Test {
+    void listen(const std::string& service = "com.nordane.zembra.zbd") {
         transport.allowService(service);
         listener = transport.createListener(service, queues.makeSerial("daemon"));
-        listener->setEventHandler([this](const platform::Listener::Event& event) {
-            daemonSide = std::get<std::shared_ptr<platform::Connection>>(event);
-            daemonSide->setEventHandler([this](const platform::ConnectionEvent& received) {
-                const auto* message = std::get_if<platform::ReceivedMessage>(&received);
-                if (!message) {
-                    hasClientGone = true;
-                    return;
-                }
+        listener->setEventHandler([this](const Listener::Event& event) {
+            daemonSide = std::get<std::shared_ptr<Connection>>(event);
+            daemonSide->setEventHandler([this](const ConnectionEvent& received) {
+                const auto* message = std::get_if<ReceivedMessage>(&received);
+                hasClientGone = message == nullptr;
+                if (hasClientGone) return;
                 requests.push_back(message->content);
-                platform::ReplyMessage answer = platform::createReply(*message);
+                ReplyMessage answer = createReply(*message);
                 answer.content.merge(reply);
                 daemonSide->send(answer);
             });
@@ -49,29 +42,15 @@ protected:
 
     support::FakeWorkQueues queues;
     support::FakeTransport transport;
-    std::shared_ptr<platform::Listener> listener;
-    std::shared_ptr<platform::Connection> daemonSide;
+    std::shared_ptr<Listener> listener;
+    std::shared_ptr<Connection> daemonSide;
     std::vector<Value> requests;
     Dictionary reply;
     bool hasClientGone = false;
 };
 
-TEST_F(DaemonClientTest, ConnectsToTheNamedService) {
-    const std::vector<std::pair<std::optional<std::string>, std::string>> cases = {
-        {std::nullopt, "com.nordane.zembra.zbd"}, {"org.example.other", "org.example.other"}};
-    for (const auto& [name, service] : cases) {
-        listen(service);
-        requests.clear();
-        const auto client = connect(name);
-        EXPECT_EQ(queues.made.back().label, "zbd_client");
-        client->bulkPlugins(0, [](const ReplyOrError&) {});
-        run();
-        EXPECT_EQ(requests.size(), 1U) << service;
-    }
-}
-
-TEST_F(DaemonClientTest, EachOperationSendsItsRequest) {
-    listen("com.nordane.zembra.zbd");
+TEST_F(DaemonClient, EachOperationSendsItsRequest) {
+    listen();
     const auto client = connect();
     const UUID one = UUID::random();
     const UUID two = UUID::random();
@@ -81,11 +60,7 @@ TEST_F(DaemonClientTest, EachOperationSendsItsRequest) {
     const Dictionary rules{{"VKExtensionPointIdentifier", "org.example.point"}};
     const auto ignore = [](const ReplyOrError&) {};
 
-    struct Case {
-        std::function<void()> operation;
-        Dictionary expected; // besides the version
-    };
-    const std::vector<Case> cases = {
+    const std::pair<std::function<void()>, Dictionary> cases[] = {
         {[&] { client->addPlugIns(paths, ignore); }, {{"request", "add"}, {"paths", pathArray}}},
         {[&] { client->removePlugIns(paths, ignore); }, {{"request", "remove"}, {"paths", pathArray}}},
         {[&] { client->bulkPlugins(5, ignore); }, {{"request", "bulk"}, {"flags", 5}}},
@@ -100,7 +75,7 @@ TEST_F(DaemonClientTest, EachOperationSendsItsRequest) {
         {[&] { client->accessPlugIns(plugIns, 2, ignore); },
          {{"request", "access"}, {"flags", 2}, {"uuids", Array{one, two}}, {"paths", Array{"/A", "/B"}}}},
         {[&] { client->findPlugInByUUID(one, ignore); }, {{"request", "find"}, {"uuids", one}}},
-        {[&] { client->findPlugInByPathURL(platform::URL::file("/A b"), ignore); },
+        {[&] { client->findPlugInByPathURL(URL::file("/A b"), ignore); },
          {{"request", "find"}, {"paths", "file:///A%20b"}}},
         {[&] { client->matchPlugIns(rules, 0x200, ignore); },
          {{"request", "match"}, {"rules", rules}, {"flags", 0x200}}},
@@ -112,68 +87,55 @@ TEST_F(DaemonClientTest, EachOperationSendsItsRequest) {
         {[&] { client->holdPlugins(paths, 7, ignore); }, {{"request", "lock"}, {"paths", pathArray}, {"flags", 7}}},
         {[&] { client->releaseHold(one, ignore); }, {{"request", "lock"}, {"uuids", Array{one}}}},
     };
-    for (const Case& each : cases) {
+    for (const auto& [operation, expected] : cases) {
         requests.clear();
-        each.operation();
+        operation();
         run();
-        auto expected = platform::MutableDictionary::copyOf(each.expected);
-        expected.set("version", 3);
-        ASSERT_EQ(requests.size(), 1U);
-        EXPECT_EQ(requests.front(), Value(expected)) << requests.front().description();
+        auto message = MutableDictionary::copyOf(expected);
+        message.set("version", 3);
+        EXPECT_EQ(requests, std::vector<Value>{message}) << Value(message).description();
     }
-    EXPECT_TRUE(processLog.contains(platform::LogLevel::standard, "ops", "findPlugInByUUID " + one.text()));
-    EXPECT_TRUE(processLog.contains(platform::LogLevel::standard, "ops", "findPlugInByPathURL file:///A%20b"));
+    EXPECT_TRUE(logged(LogLevel::standard, "findPlugInByUUID " + one.text()));
+    EXPECT_TRUE(logged(LogLevel::standard, "findPlugInByPathURL file:///A%20b"));
 }
 
-TEST_F(DaemonClientTest, RepliesArriveOnItsQueueAndAreTraced) {
-    listen("com.nordane.zembra.zbd");
-    const auto client = connect();
+TEST_F(DaemonClient, RepliesArriveOnItsQueueAndAreTraced) {
+    listen("org.example.other");
+    auto client = connect("org.example.other");
+    EXPECT_EQ(queues.made.back().label, "zbd_client");
     std::vector<Failure> errors;
-    const auto note = [&](const ReplyOrError& received) {
-        client->replyQueue()->assertCurrent();
-        errors.push_back(ZBDaemonClient::errorInReply(received));
-    };
     processLog.clear();
     reply = {{"errorcode", 11U}, {"error", "no"}};
-    client->bulkPlugins(0, note);
+    client->bulkPlugins(0, [&](const ReplyOrError& received) {
+        client->replyQueue()->assertCurrent();
+        errors.push_back(ZBDaemonClient::errorInReply(received));
+    });
     EXPECT_TRUE(errors.empty());
     run();
-    EXPECT_EQ(errors, std::vector<Failure>{platform::Error("Zembra", 11, "no")});
-    EXPECT_EQ(processLog.messages("traffic"), (std::vector<std::string>{"request: " + requests.front().description(),
-                                                                        "reply: " + Value(reply).description()}));
-    EXPECT_EQ(processLog.lines().front().level, platform::LogLevel::debug);
+    EXPECT_EQ(errors, std::vector<Failure>{Error("Zembra", 11, "no")});
+    EXPECT_TRUE(logged(LogLevel::debug, "request: " + requests.front().description(), "traffic"));
+    EXPECT_TRUE(logged(LogLevel::debug, "reply: " + Value(reply).description(), "traffic"));
+
+    client.reset();
+    run();
+    EXPECT_TRUE(hasClientGone);
+    EXPECT_TRUE(processLog.messages("ops").empty()) << "its own end is no communications error";
 }
 
-TEST_F(DaemonClientTest, AnAbsentDaemonShowsInReplyAndLog) {
+TEST_F(DaemonClient, AnAbsentDaemonShowsInReplyAndLog) {
     transport.refuseConnections();
-    const auto client = connect();
     Failure error;
-    processLog.clear();
+    const auto client = connect();
     client->bulkPlugins(0, [&](const ReplyOrError& received) { error = ZBDaemonClient::errorInReply(received); });
     run();
     ASSERT_TRUE(error);
     EXPECT_EQ(error->domain, "Zembra");
     EXPECT_EQ(error->code, 4);
-    EXPECT_EQ(processLog.messages("traffic").back(), "reply: " + *error->description);
-    EXPECT_TRUE(processLog.contains(platform::LogLevel::error, "ops", "Communications error: " + *error->description));
-}
-
-TEST_F(DaemonClientTest, ItsOwnEndIsNoCommunicationsError) {
-    listen("com.nordane.zembra.zbd");
-    auto client = connect();
-    client->bulkPlugins(0, [](const ReplyOrError&) {});
-    run();
-    processLog.clear();
-    client.reset();
-    run();
-    EXPECT_TRUE(hasClientGone);
-    EXPECT_TRUE(processLog.messages("ops").empty());
+    EXPECT_TRUE(logged(LogLevel::error, "Communications error: " + *error->description));
 }
 
 TEST(ErrorInReply, FollowsCodeAndText) {
-    const auto error = [](std::int64_t code, const char* text) {
-        return Failure(platform::Error{"Zembra", code, text});
-    };
+    const auto error = [](std::int64_t code, const char* text) { return Failure(Error{"Zembra", code, text}); };
     const std::vector<std::pair<Dictionary, Failure>> cases = {
         {{}, std::nullopt},
         {{{"extensions", Array()}}, std::nullopt},
@@ -188,12 +150,12 @@ TEST(ErrorInReply, FollowsCodeAndText) {
 }
 
 TEST(ErrorInReplyDeathTest, ATextWithoutACodeStopsTheProcess) {
-    support::processLog.print();
+    processLog.print();
     EXPECT_DEATH((void)ZBDaemonClient::errorInReply(Dictionary{{"error", "odd"}}),
                  "zbd reported error without a code: odd");
 }
 
-TEST_F(DaemonClientTest, MatchesTravelInVersion3Only) {
+TEST_F(DaemonClient, MatchesTravelInVersion3Only) {
     const auto client = connect();
     const Value forms = Array{Dictionary{{"identifier", "org.example.share"}, {"lastmodified", -1}}};
     const auto encoded = ZBDaemonClient::convertToQMX(forms, 3);

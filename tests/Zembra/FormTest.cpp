@@ -1,20 +1,13 @@
 #include "Zembra/ZBPlugInCore.h"
-#include "Zembra/ZBProtocol.h"
+#include "Zembra/ZBUtilities.h"
 #include "tests/support/SystemLogFake.h"
 
 #include <gtest/gtest.h>
 
 namespace {
 
-using platform::Array;
-using platform::Dictionary;
-using platform::Failure;
-using platform::MutableDictionary;
-using platform::URL;
-using platform::UUID;
-using platform::Value;
+using namespace platform;
 using zembra::ZBPlugInCore;
-namespace formKey = zembra::formKey;
 
 const UUID uuid = *UUID::parse("0A1B2C3D-4E5F-4A6B-8C7D-9E0F1A2B3C4D");
 
@@ -36,29 +29,30 @@ std::shared_ptr<ZBPlugInCore> record() {
     return plugIn;
 }
 
+/// What a form makes in which `value` stands under `key`, or nothing when it is absent.
+std::shared_ptr<ZBPlugInCore> restored(std::string_view key, const Value& value) {
+    return ZBPlugInCore::initWithForm(*zembra::dictionaryChanging(record()->exportForm(nullptr), key, value));
+}
+
 TEST(ExportForm, HoldsTheRequiredValuesAndNoOthers) {
-    auto plugIn = record();
+    const auto plugIn = record();
     Failure error;
     const MutableDictionary form = plugIn->exportForm(&error);
     EXPECT_EQ(error, std::nullopt);
-
-    MutableDictionary shownInfo = MutableDictionary::copyOf(bundleInfo());
-    shownInfo.remove("VBBundleInfoVlistURL");
     const Dictionary expected{{"hubProtocolVersion", 2},
                               {"path", "/Applications/App.app/PlugIns/Share.appex"},
                               {"systemResident", false},
                               {"identifier", "org.example.app.share"},
                               {"original-identifier", "org.example.app.share.first"},
                               {"version", "1.2"},
-                              {"bundleInfo", shownInfo},
+                              {"bundleInfo", *zembra::dictionaryChanging(bundleInfo(), "VBBundleInfoVlistURL", {})},
                               {"info", *bundleInfo().dictionary("VKExtension")},
                               {"uuid", "0A1B2C3D-4E5F-4A6B-8C7D-9E0F1A2B3C4D"},
                               {"lastmodified", -7},
                               {"annotations", Dictionary()}};
     EXPECT_EQ(form, expected) << Value(form).description();
-    EXPECT_EQ(form["systemResident"].kind(), platform::Kind::boolean);
+    EXPECT_EQ(form["systemResident"].kind(), Kind::boolean);
     EXPECT_TRUE(form.dictionary("info")->sharesStorageWith(*plugIn->plugInDictionary()));
-
     plugIn->setPlugInDictionary(Dictionary());
     EXPECT_EQ(plugIn->exportForm(nullptr).string("version"), "<none>");
 }
@@ -73,12 +67,7 @@ TEST(ExportForm, AddsWhatTheRecordHas) {
     plugIn->setLocalizedName("Teilen");
     plugIn->setLocalizedShortName("T.");
     plugIn->setLocalizedFilevaneActionNames(Dictionary());
-    support::processLog.clear();
     const Dictionary form = plugIn->exportForm(nullptr);
-    EXPECT_EQ(support::processLog.messages("cx"),
-              (std::vector<std::string>{"export BundleInfo[BundleDisplayName] was Share",
-                                        "export BundleInfo[BundleDisplayName] is Teilen"}));
-
     const Dictionary expected{{"systemResident", true},
                               {"annotations", Dictionary{{"election", 1}}},
                               {"entitlements", Dictionary{{"an.entitlement", true}}},
@@ -106,9 +95,7 @@ TEST(ExportForm, LeavesOutWhatIsMissingAndReportsTheFirst) {
     const Dictionary form = plugIn.exportForm(&error);
     ASSERT_TRUE(error);
     EXPECT_NE(error->description->find("original-identifier"), std::string::npos) << *error->description;
-    for (const auto key : {formKey::originalIdentifier, formKey::bundleInfo, formKey::info}) {
-        EXPECT_FALSE(form.contains(key)) << key;
-    }
+    for (const char* key : {"original-identifier", "bundleInfo", "info"}) EXPECT_FALSE(form.contains(key)) << key;
     EXPECT_EQ(form.string("uuid"), uuid.text());
     EXPECT_EQ(form.string("localizedDisplayName"), "Weg");
 }
@@ -121,109 +108,76 @@ TEST(InitWithForm, RestoresWhatExportWrote) {
     original->setCdhash(Value::data("twenty bytes of hash"));
     original->setHubProtocolVersion(~std::uint64_t{0});
     const auto form = original->exportForm(nullptr);
-
-    const auto restored = ZBPlugInCore::initWithForm(form);
-    ASSERT_TRUE(restored);
-    EXPECT_EQ(*restored, *original);
-    EXPECT_EQ(restored->attributes(), original->attributes());
-    EXPECT_EQ(restored->hubProtocolVersion(), ~std::uint64_t{0});
-    EXPECT_FALSE(restored->cdhash());
-    EXPECT_EQ(restored->exportForm(nullptr), form);
+    const auto copy = ZBPlugInCore::initWithForm(form);
+    ASSERT_TRUE(copy);
+    EXPECT_EQ(*copy, *original);
+    EXPECT_EQ(copy->attributes(), original->attributes());
+    EXPECT_FALSE(copy->cdhash());
+    EXPECT_EQ(copy->exportForm(nullptr), form);
 }
 
 TEST(InitWithForm, ReadsWhatIsThere) {
-    const auto with = [](std::string_view key, const Value& value) {
-        MutableDictionary form = record()->exportForm(nullptr);
-        value ? form.set(key, value) : form.remove(key);
-        return ZBPlugInCore::initWithForm(form);
-    };
-    EXPECT_EQ(with("hubProtocolVersion", Value())->hubProtocolVersion(), 1U);
-    EXPECT_EQ(with("hubProtocolVersion", 0)->hubProtocolVersion(), 0U);
-    EXPECT_EQ(with("lastmodified", Value())->lastModified(), 0);
-    EXPECT_FALSE(with("containingPath", Value())->containingUrl());
-    EXPECT_EQ(with("hash", Value::data("h"))->cdhash().data(), "h");
-    EXPECT_EQ(with("requirement", "identifier x")->requirement().string(), "identifier x");
-    EXPECT_FALSE(with("annotations", Value())->annotations());
-    EXPECT_EQ(with("uuid", "0a1b2c3d-4e5f-4a6b-8c7d-9e0f1a2b3c4d")->uuidText().string(), uuid.text());
+    EXPECT_EQ(restored("hubProtocolVersion", Value())->hubProtocolVersion(), 1U);
+    EXPECT_EQ(restored("hubProtocolVersion", 0)->hubProtocolVersion(), 0U);
+    EXPECT_EQ(restored("lastmodified", Value())->lastModified(), 0);
+    EXPECT_FALSE(restored("containingPath", Value())->containingUrl());
+    EXPECT_EQ(restored("hash", Value::data("h"))->cdhash().data(), "h");
+    EXPECT_EQ(restored("requirement", "identifier x")->requirement().string(), "identifier x");
+    EXPECT_FALSE(restored("annotations", Value())->annotations());
+    EXPECT_EQ(restored("uuid", "0a1b2c3d-4e5f-4a6b-8c7d-9e0f1a2b3c4d")->uuidText().string(), uuid.text());
     for (const Value& unusable : {Value(), Value("no uuid"), Value(5)}) {
-        const auto first = with("uuid", unusable);
-        const auto second = with("uuid", unusable);
-        EXPECT_NE(*first, *second);
+        EXPECT_NE(*restored("uuid", unusable), *restored("uuid", unusable)) << "each has one of its own";
     }
     // Optional values of another kind are neither checked nor lost.
-    EXPECT_EQ(with("entitlements", "odd")->exportForm(nullptr)["entitlements"], Value("odd"));
-    EXPECT_EQ(with("localizedShortName", 5)->exportForm(nullptr)["localizedShortName"], Value(5));
+    for (const char* key : {"entitlements", "localizedShortName", "localizedFilevaneActionNames"}) {
+        EXPECT_EQ(restored(key, 5)->exportForm(nullptr)[key], Value(5)) << key;
+    }
+    const auto bare = restored("bundleInfo", Value());
+    ASSERT_TRUE(bare);
+    EXPECT_FALSE(bare->bundleInfoDictionary());
+    EXPECT_FALSE(bare->plugInDictionary());
 }
 
 TEST(InitWithForm, RefusesAFormThatMakesNoRecord) {
-    const std::vector<std::pair<std::string_view, Value>> unusable = {
-        {"path", {}},
-        {"path", 5},
-        {"identifier", {}},
-        {"identifier", 5},
-        {"bundleInfo", "x"},
-        {"bundleInfo", Dictionary()},
-        {"bundleInfo", Dictionary{{"VKExtension", Array()}}}};
+    const std::pair<const char*, Value> unusable[] = {{"path", {}},
+                                                      {"path", 5},
+                                                      {"identifier", {}},
+                                                      {"identifier", 5},
+                                                      {"bundleInfo", "x"},
+                                                      {"bundleInfo", Dictionary()},
+                                                      {"bundleInfo", Dictionary{{"VKExtension", Array()}}}};
     for (const auto& [key, value] : unusable) {
-        MutableDictionary form = record()->exportForm(nullptr);
-        value ? form.set(key, value) : form.remove(key);
-        EXPECT_EQ(ZBPlugInCore::initWithForm(form), nullptr) << key << " = " << value.description();
+        EXPECT_EQ(restored(key, value), nullptr) << key << " = " << value.description();
     }
-    MutableDictionary withoutInfo = record()->exportForm(nullptr);
-    withoutInfo.remove("bundleInfo");
-    const auto plugIn = ZBPlugInCore::initWithForm(withoutInfo);
-    ASSERT_TRUE(plugIn);
-    EXPECT_FALSE(plugIn->bundleInfoDictionary());
-    EXPECT_FALSE(plugIn->plugInDictionary());
 }
 
-struct LocalizedInfo {
-    int calls = 0;
-    std::optional<Dictionary> values;
-    Failure error;
+/// The values, or the error's text; exactly one answer comes.
+Value localizedInfo(const ZBPlugInCore& plugIn, const Array& keys) {
+    std::vector<Value> answers;
+    plugIn.localizedInfoDictionaryForKeys(keys, [&](const auto& values, const Failure& error) {
+        EXPECT_NE(values.has_value(), error.has_value());
+        if (values) return answers.emplace_back(*values), void();
+        EXPECT_EQ(*error, (Error{"Zembra", -1, error->description}));
+        answers.emplace_back(error->text());
+    });
+    return answers.size() == 1 ? answers.front() : Value();
+}
 
-    LocalizedInfo(const ZBPlugInCore& plugIn, const Array& keys) {
-        plugIn.localizedInfoDictionaryForKeys(keys, [this](const auto& foundValues, const Failure& foundError) {
-            ++calls;
-            values = foundValues;
-            error = foundError;
-        });
-    }
-};
-
-TEST(LocalizedInfo, PrefersTheLocalizedNames) {
+TEST(LocalizedInfo, PrefersTheLocalizedNamesAndRefusesForeignValues) {
     const auto plugIn = record();
-    const Array keys{"VBBundleDisplayName", "VBBundleName", "VBBundleIdentifier", "Unknown"};
-    const LocalizedInfo plain(*plugIn, keys);
-    EXPECT_EQ(plain.values,
-              (Dictionary{{"VBBundleDisplayName", "Share"}, {"VBBundleIdentifier", "org.example.app.share"}}));
-    EXPECT_EQ(plain.calls, 1);
+    const Array keys{"VBBundleDisplayName", "VBBundleName", "Unknown"};
+    EXPECT_EQ(localizedInfo(*plugIn, keys), Value(Dictionary{{"VBBundleDisplayName", "Share"}}));
     plugIn->setLocalizedName("Teilen");
     plugIn->setLocalizedShortName("T.");
-    const LocalizedInfo localized(*plugIn, keys);
-    EXPECT_EQ(localized.values, (Dictionary{{"VBBundleDisplayName", "Teilen"},
-                                            {"VBBundleName", "T."},
-                                            {"VBBundleIdentifier", "org.example.app.share"}}));
-    EXPECT_EQ(localized.error, std::nullopt);
-}
+    EXPECT_EQ(localizedInfo(*plugIn, keys),
+              Value(Dictionary{{"VBBundleDisplayName", "Teilen"}, {"VBBundleName", "T."}}));
 
-TEST(LocalizedInfo, FailsWithoutBundleInfoOfItsOwnOrForAForeignValue) {
+    plugIn->setBundleInfoDictionary(*zembra::dictionaryChanging(bundleInfo(), "Odd", uuid));
+    EXPECT_EQ(localizedInfo(*plugIn, {"VBBundleIdentifier", "Odd"}),
+              Value("Value of info dictionary key \"Odd\" for plugin org.example.app.share does not conform to secure "
+                    "coding!"));
     const auto bare = ZBPlugInCore::initWithName("org.example.bare", URL::file("/Bare"), Value(), Dictionary(), uuid);
-    const LocalizedInfo unresolved(*bare, {"VBBundleName"});
-    EXPECT_EQ(unresolved.values, std::nullopt);
-    EXPECT_EQ(unresolved.error, (platform::Error{"Zembra", -1, "Unable to resolve plugin for org.example.bare"}));
-    EXPECT_EQ(unresolved.calls, 1);
-
-    const auto foreign = record();
-    MutableDictionary info = MutableDictionary::copyOf(bundleInfo());
-    info.set("Odd", uuid);
-    foreign->setBundleInfoDictionary(info);
-    const LocalizedInfo refused(*foreign, {"VBBundleIdentifier", "Odd"});
-    EXPECT_EQ(refused.values, std::nullopt);
-    EXPECT_EQ(
-        refused.error->description,
-        "Value of info dictionary key \"Odd\" for plugin org.example.app.share does not conform to secure coding!");
-    EXPECT_EQ(refused.calls, 1);
+    EXPECT_EQ(localizedInfo(*bare, keys), Value("Unable to resolve plugin for org.example.bare"));
 }
 
 } // namespace

@@ -7,14 +7,8 @@
 
 namespace {
 
-using platform::Array;
-using platform::Dictionary;
-using platform::Failure;
-using platform::LogLevel;
-using platform::MutableDictionary;
-using platform::URL;
-using platform::UUID;
-using platform::Value;
+using namespace platform;
+using support::logged;
 using support::processLog;
 using zembra::ZBPlugInCore;
 
@@ -30,19 +24,15 @@ TEST(InitWithName, RefusesUnusableBundleInfo) {
     for (const Value& info :
          {Value(Array()), Value("text"), Value(Dictionary()), Value(Dictionary{{"VKExtension", "text"}}),
           Value(Dictionary{{"VKExtension", Array()}})}) {
-        processLog.clear();
-        EXPECT_EQ(ZBPlugInCore::initWithName("org.example.share", extensionURL, info, Dictionary(), std::nullopt),
-                  nullptr);
-        EXPECT_TRUE(processLog.contains(LogLevel::standard, "ops",
-                                        "malformed plug-in dictionary in plug-in org.example.share at " +
-                                            extensionURL.absoluteString() + ": " + info.description()))
-            << info.description();
+        EXPECT_FALSE(ZBPlugInCore::initWithName("org.example.share", extensionURL, info, Dictionary(), std::nullopt));
+        EXPECT_TRUE(logged(LogLevel::standard, "malformed plug-in dictionary in plug-in org.example.share at " +
+                                                   extensionURL.absoluteString() + ": " + info.description()));
     }
     processLog.clear();
     EXPECT_EQ(ZBPlugInCore::initWithName(Value(), std::nullopt, Value(), Value(), std::nullopt), nullptr);
     EXPECT_TRUE(processLog.lines().empty());
     EXPECT_EQ(ZBPlugInCore::initWithName(Value(), extensionURL, Value(), Value(), std::nullopt), nullptr);
-    EXPECT_TRUE(processLog.contains(LogLevel::error, "ops", "missing identifier in plug-in at " + extensionURL.path()));
+    EXPECT_TRUE(logged(LogLevel::error, "missing identifier in plug-in at " + extensionURL.path()));
 }
 
 TEST(SetDictionaries, StoresWhatItAccepted) {
@@ -56,18 +46,14 @@ TEST(SetDictionaries, StoresWhatItAccepted) {
     const Dictionary extension{{"Multiple", false}};
     EXPECT_TRUE(plugIn.setDictionaries(Dictionary{{"VKExtension", extension}}));
     EXPECT_TRUE(plugIn.plugInDictionary()->sharesStorageWith(extension));
-    EXPECT_TRUE(
-        processLog.contains(LogLevel::standard, "ops", "multiplexed plug-ins (Multiple key) obsolete and ignored"));
-}
+    EXPECT_TRUE(logged(LogLevel::standard, "multiplexed plug-ins (Multiple key) obsolete and ignored"));
 
-TEST(InitWithName, TakesInfoOnlyWhereBundleInfoLeavesNoPlugInDictionary) {
-    const Dictionary info{{"Dedicated", true}};
-    const auto bare = ZBPlugInCore::initWithName("org.example.share", extensionURL, Value(), info, std::nullopt);
-    EXPECT_TRUE(bare->plugInDictionary()->sharesStorageWith(info));
-    EXPECT_FALSE(bare->bundleInfoDictionary());
-    const auto full = ZBPlugInCore::initWithName("org.example.share", extensionURL,
-                                                 Dictionary{{"VKExtension", Dictionary()}}, info, std::nullopt);
-    EXPECT_EQ(full->plugInDictionary(), Dictionary());
+    // The plug-in dictionary that is given along counts only where bundle info leaves none.
+    for (const Value& info : {Value(), Value(Dictionary{{"VKExtension", extension}})}) {
+        const auto made = ZBPlugInCore::initWithName("a", extensionURL, info, withoutExtension, std::nullopt);
+        EXPECT_TRUE(made->plugInDictionary()->sharesStorageWith(info ? extension : withoutExtension));
+        EXPECT_EQ(made->bundleInfoDictionary().has_value(), static_cast<bool>(info));
+    }
 }
 
 TEST(Equality, IsByUuid) {
@@ -87,10 +73,10 @@ TEST(Equality, IsByUuid) {
 }
 
 TEST(EqualityDeathTest, WithoutUuidStopsTheProcess) {
-    const auto with = ZBPlugInCore::initWithName("org.example.a", extensionURL, Value(), Value(), std::nullopt);
+    const auto with = recordAt(extensionURL, {});
     const ZBPlugInCore without;
     EXPECT_FALSE(*with == without);
-    support::processLog.print();
+    processLog.print();
     EXPECT_DEATH((void)without.isEqual(*with), "self.uuid");
     EXPECT_DEATH((void)without.hash(), "self.uuid");
 }
@@ -102,27 +88,17 @@ TEST(OldStyleDeathTest, FollowsTheManifestDictionary) {
     plugIn.setBundleInfoDictionary(Dictionary{{"Zembra", Dictionary()}});
     EXPECT_TRUE(plugIn.oldStyle());
     plugIn.setBundleInfoDictionary(Dictionary());
-    support::processLog.print();
+    processLog.print();
     EXPECT_DEATH((void)plugIn.oldStyle(), "unknown plug-in configuration style");
-}
-
-TEST(InfoKey, IsTraced) {
-    const auto plugIn = ZBPlugInCore::initWithName("org.example.share", extensionURL,
-                                                   Dictionary{{"VKExtension", Dictionary()}, {"VBBundleName", "Share"}},
-                                                   Value(), std::nullopt);
-    processLog.clear();
-    EXPECT_EQ(plugIn->infoKey("VBBundleName").string(), "Share");
-    EXPECT_FALSE(plugIn->infoKey("Other"));
-    EXPECT_EQ(processLog.messages("cx"),
-              (std::vector<std::string>{"infoKey VBBundleName => Share", "infoKey Other => (null)"}));
 }
 
 TEST(DerivedProperties, AppExtensionsHaveDefaults) {
     const auto extension = recordAt(extensionURL, {});
     EXPECT_TRUE(extension->isAppExtension());
-    EXPECT_EQ(extension->protocolSpec().string(), "VKObject");
-    EXPECT_EQ(extension->principalSpec().string(), "VKObject");
-    EXPECT_EQ(extension->embeddedProtocolSpec().string(), "VKObject");
+    for (const Value& spec :
+         {extension->protocolSpec(), extension->principalSpec(), extension->embeddedProtocolSpec()}) {
+        EXPECT_EQ(spec, Value("VKObject"));
+    }
     const auto other = recordAt(otherURL, {});
     EXPECT_FALSE(other->isAppExtension());
     EXPECT_FALSE(other->protocolSpec());
@@ -146,32 +122,30 @@ TEST(DerivedProperties, ReadTheManifest) {
 }
 
 TEST(Diagnose, AnswersTheFirstFault) {
-    struct Case {
+    const auto fault = [](const char* text) { return Error{"Zembra", 12, text}; };
+    const auto attributed = [](const Dictionary& more) {
+        MutableDictionary plugIn{{"VKExtensionAttributes", Dictionary()}};
+        plugIn.merge(more);
+        return plugIn;
+    };
+    const char* const unproxied = "the \"PassProxy\" key is not supported on this platform";
+    const struct {
         URL url;
         Dictionary plugIn;
         Failure expected;
-    };
-    const auto fault = [](const char* text) { return platform::Error{"Zembra", 12, text}; };
-    const Value attributes = Dictionary();
-    const std::vector<Case> cases = {
-        {extensionURL, {{"VKExtensionAttributes", attributes}}, std::nullopt},
-        {otherURL,
-         {{"VKExtensionAttributes", attributes}, {"VKExtensionProtocol", "P"}, {"PrincipalClass", "C"}},
-         std::nullopt},
-        {extensionURL, {{"VKExtensionAttributes", attributes}, {"PrincipalClass", "VKObject"}}, std::nullopt},
+    } cases[] = {
+        {extensionURL, attributed({}), std::nullopt},
+        {extensionURL, attributed({{"PrincipalClass", "VKObject"}}), std::nullopt},
+        {otherURL, attributed({{"VKExtensionProtocol", "P"}, {"PrincipalClass", "C"}}), std::nullopt},
         {otherURL, {{"PassProxy", true}}, fault("missing \"VKExtensionProtocol\" key in Info.vlist or SDK")},
         {extensionURL, {{"PassProxy", true}}, fault("missing \"VKExtensionAttributes\" key in Info.vlist or SDK")},
-        {extensionURL,
-         {{"VKExtensionAttributes", attributes}, {"PrincipalClass", "C"}, {"PassProxy", true}},
+        {extensionURL, attributed({{"PrincipalClass", "C"}, {"PassProxy", true}}),
          fault("Application Extensions may not use the \"PrincipalClass\" key")},
-        {extensionURL,
-         {{"VKExtensionAttributes", attributes}, {"PassProxy", false}, {"EmbeddedCode", true}},
-         fault("the \"PassProxy\" key is not supported on this platform")},
-        {extensionURL,
-         {{"VKExtensionAttributes", attributes}, {"EmbeddedCode", false}},
+        {extensionURL, attributed({{"PassProxy", false}, {"EmbeddedCode", true}}), fault(unproxied)},
+        {extensionURL, attributed({{"EmbeddedCode", false}}),
          fault("hybrid plug-ins are not supported on this platform")},
     };
-    for (const Case& each : cases) {
+    for (const auto& each : cases) {
         EXPECT_EQ(recordAt(each.url, each.plugIn)->diagnose(), each.expected) << Value(each.plugIn).description();
     }
     EXPECT_EQ(ZBPlugInCore().diagnose(),
@@ -187,12 +161,11 @@ TEST(Canonicalize, FillsInAttributesAndVersion) {
     EXPECT_EQ(bare, (Dictionary{{"Dedicated", true}})); // the manifest itself is not touched
 
     plugIn->setPlugInDictionary(Dictionary());
-    plugIn->setBundleInfoDictionary(Dictionary{{"VBBundleShortVersionString", "2.5"}});
-    plugIn->canonicalize();
-    EXPECT_EQ(plugIn->version().string(), "2.5");
-    plugIn->setBundleInfoDictionary(Dictionary{{"VBBundleShortVersionString", "3"}});
-    plugIn->canonicalize();
-    EXPECT_EQ(plugIn->version().string(), "2.5");
+    for (const char* version : {"2.5", "3"}) { // the second comes too late
+        plugIn->setBundleInfoDictionary(Dictionary{{"VBBundleShortVersionString", version}});
+        plugIn->canonicalize();
+        EXPECT_EQ(plugIn->version().string(), "2.5");
+    }
 }
 
 TEST(Annotations, ChangeInANewDictionary) {
@@ -217,30 +190,28 @@ TEST(Annotations, ChangeInANewDictionary) {
 }
 
 TEST(MergeDictionary, PlugInWinsExceptForTheRules) {
-    const Dictionary sdk{{"CleanTimeout", 9},
-                         {"Shared", Array{"Fonts", "Sounds"}},
-                         {"New", "sdk"},
-                         {"Text", "sdk"},
-                         {"Nested", Dictionary{{"CleanTimeout", 8}, {"Text", "sdk"}, {"New", "sdk"}}},
-                         {"Mixed", Dictionary{{"a", 1}}}};
-    const Dictionary plugIn{{"CleanTimeout", 1},
-                            {"Shared", Array{"Icons", "Fonts"}},
-                            {"Text", "own"},
-                            {"Nested", Dictionary{{"CleanTimeout", 2}, {"Text", "own"}}},
-                            {"Mixed", "own"}};
-    const Dictionary sdkBefore = MutableDictionary::copyOf(sdk);
-    const Dictionary plugInBefore = MutableDictionary::copyOf(plugIn);
-    EXPECT_EQ(ZBPlugInCore::mergeDictionary(sdk, plugIn),
-              (Dictionary{{"CleanTimeout", 9},
-                          {"Shared", Array{"Icons", "Fonts", "Sounds"}},
-                          {"New", "sdk"},
-                          {"Text", "own"},
-                          {"Nested", Dictionary{{"CleanTimeout", 8}, {"Text", "own"}, {"New", "sdk"}}},
-                          {"Mixed", "own"}}));
-    EXPECT_EQ(sdk, sdkBefore);
-    EXPECT_EQ(plugIn, plugInBefore);
-    EXPECT_EQ(ZBPlugInCore::mergeDictionary({{"Shared", Array{"Fonts"}}}, {{"Shared", "."}}),
-              (Dictionary{{"Shared", "."}}));
+    const struct {
+        const char* key;
+        Value sdk, plugIn, merged;
+    } cases[] = {
+        {"CleanTimeout", 9, 1, 9},
+        {"Shared", Array{"Fonts", "Sounds"}, Array{"Icons", "Fonts"}, Array{"Icons", "Fonts", "Sounds"}},
+        {"Shared", Array{"Fonts"}, ".", "."},
+        {"New", "sdk", {}, "sdk"},
+        {"Text", "sdk", "own", "own"},
+        {"Mixed", Dictionary{{"a", 1}}, "own", "own"},
+    };
+    for (const auto& each : cases) {
+        MutableDictionary sdk{{each.key, each.sdk}};
+        MutableDictionary plugIn;
+        if (each.plugIn) plugIn.set(each.key, each.plugIn);
+        const Dictionary merged{{each.key, each.merged}};
+        EXPECT_EQ(ZBPlugInCore::mergeDictionary(sdk, plugIn), merged) << each.key;
+        EXPECT_EQ(ZBPlugInCore::mergeDictionary({{"Nested", sdk}}, {{"Nested", plugIn}}),
+                  (Dictionary{{"Nested", merged}}));
+        EXPECT_EQ(sdk[each.key], each.sdk);
+        EXPECT_EQ(plugIn[each.key], each.plugIn);
+    }
 }
 
 TEST(ResolveSDK, MergesAndCanonicalizes) {
@@ -254,14 +225,13 @@ TEST(ResolveSDK, MergesAndCanonicalizes) {
     EXPECT_EQ(known->version().string(), "1");
 
     const auto unknown = recordAt(otherURL, {{"VKExtensionPointIdentifier", "org.example.unknown"}});
-    processLog.clear();
     unknown->resolveSDK(registry);
-    EXPECT_TRUE(processLog.contains(LogLevel::standard, "ops", "plug-in sdk \"org.example.unknown\" not registered"));
+    EXPECT_TRUE(logged(LogLevel::standard, "plug-in sdk \"org.example.unknown\" not registered"));
     EXPECT_EQ(unknown->version().string(), "1");
     const auto odd = recordAt(otherURL, {{"VKExtensionPointIdentifier", 5}});
     odd->resolveSDK(registry);
     EXPECT_FALSE(odd->attributes());
-    EXPECT_TRUE(processLog.contains(LogLevel::error, "ops", "invalid SDK key:5"));
+    EXPECT_TRUE(logged(LogLevel::error, "invalid SDK key:5"));
     const int asked = registry.calls("sdkDictionary");
     recordAt(otherURL, {})->resolveSDK(registry);
     EXPECT_EQ(registry.calls("sdkDictionary"), asked);

@@ -12,19 +12,17 @@
 namespace {
 
 TEST(Log, ConcurrentFirstUsesGetTheHandleOfTheCategory) {
-    struct Case {
-        platform::LogHandle& (*channel)();
-        const char* category;
-    };
-    for (const Case& each : {Case{zembra::log::ops, "ops"}, Case{zembra::log::traffic, "traffic"},
-                             Case{zembra::log::extension, "extension"}, Case{zembra::log::cx, "cx"},
-                             Case{zembra::log::sandbox, "sandbox"}}) {
+    for (const auto& [channel, category] : {std::pair(&zembra::log::ops, "ops"),
+                                            {zembra::log::traffic, "traffic"},
+                                            {zembra::log::extension, "extension"},
+                                            {zembra::log::cx, "cx"},
+                                            {zembra::log::sandbox, "sandbox"}}) {
         std::vector<platform::LogHandle*> handles(4);
         std::vector<std::thread> threads;
-        for (auto& handle : handles) threads.emplace_back([&] { handle = &each.channel(); });
+        for (auto& handle : handles) threads.emplace_back([&, made = channel] { handle = &made(); });
         for (std::thread& thread : threads) thread.join();
         for (const platform::LogHandle* handle : handles) EXPECT_EQ(handle, handles[0]);
-        EXPECT_EQ(handles[0]->category(), each.category);
+        EXPECT_EQ(handles[0]->category(), category);
         EXPECT_EQ(handles[0]->subsystem(), "com.nordane.Zembra");
     }
 }

@@ -1,7 +1,8 @@
 #!/usr/bin/env python3
-"""What the daemon makes of damaged state: annotation files and manifests of every bad kind."""
+"""What the daemon makes of damaged state: annotation files, directories and manifests of every bad kind."""
 
 import os
+import subprocess
 import unittest
 
 import bundles
@@ -45,15 +46,14 @@ class StateTest(unittest.TestCase):
         self.elect(path)
         return path
 
-    def assert_saved(self, path, elected):
-        """The file holds the election of `elected` in the one format."""
+    def assert_saved(self, path):
+        """The file holds the election of the elected plug-in in the one format."""
         with open(path, encoding="utf-8") as file:
             text = file.read()
         self.assertIn("<integer>16</integer>", text)
         self.assertIn("<key>com.example.elected</key>", text)
-        self.assertTrue(elected)
 
-    def test_bad_annotation_files_are_reset_and_replaced_by_the_first_change(self):
+    def test_bad_annotation_files_are_reset_and_set_aside_by_the_first_change(self):
         file = self.platform.path("var/db/Zembra-Annotations")
         kept = bundles.vlist({"version": 16, "data": {"com.example.kept": {"election": 2}}})
         cases = {
@@ -79,7 +79,12 @@ class StateTest(unittest.TestCase):
                     self.assertIn("unable to load annotation database:", log)
                 if name == "of version 15":
                     self.assertIn("found database version 15 needed version 16", log)
-                self.assert_saved(file, elected)
+                self.assert_saved(file)
+                if name != "wrong data":
+                    with open(file + ".damaged", "rb") as damaged:
+                        self.assertEqual(damaged.read(), content)
+                    os.unlink(file + ".damaged")
+                self.assertNotIn("Zembra-Annotations.damaged", os.listdir(os.path.dirname(file)))
                 os.unlink(self.platform.log_path)
 
     def test_a_missing_annotation_file_is_silent(self):
@@ -114,13 +119,17 @@ class StateTest(unittest.TestCase):
         self.assertTrue(os.path.isdir(self.platform.path("var/db/Zembra-Annotations/inside")))
 
     @unittest.skipIf(os.geteuid() == 0, "nothing is unreadable for root")
-    def test_an_unreadable_file_is_reset(self):
+    def test_an_unreadable_file_is_reset_and_set_aside(self):
         file = self.platform.path("var/db/Zembra-Annotations")
         bundles.write(file, {"version": 16, "data": {}})
+        before = os.stat(file).st_ino
         os.chmod(file, 0)
+        elected = self.prepare_elected()
         self.platform.start()
-        self.assert_serves()
+        self.find(elected)
         self.assertIn("(resetting)", self.platform.stop())
+        self.assert_saved(file)
+        self.assertEqual(os.stat(file + ".damaged").st_ino, before)
 
     def test_a_full_disk_keeps_the_old_file_and_the_change_in_memory(self):
         # A limit on the size of files stands in for the disk: writing fails at the same place, with EFBIG.
@@ -141,6 +150,36 @@ class StateTest(unittest.TestCase):
         with open(file, "rb") as after:
             self.assertEqual(after.read(), content)
         self.assertEqual(sorted(n for n in os.listdir(os.path.dirname(file)) if "Annotations" in n), ["Zembra-Annotations"])
+
+    # The start and the end.
+
+    def assert_start_fails(self, *reasons):
+        done = subprocess.run([os.path.join(scratch.BUILD, "bin", "zbd")], env=self.platform.environment,
+                              stdin=subprocess.DEVNULL, capture_output=True, text=True, timeout=scratch.DEADLINE, check=False)
+        self.assertEqual(done.returncode, 1, done.stderr)
+        for reason in (*reasons, "error [ops] unable to construct server"):
+            self.assertIn(reason, done.stderr)
+
+    def test_a_start_in_vain_ends_with_the_reason(self):
+        self.platform.start()
+        self.assert_start_fails(f"unable to listen for {scratch.SERVICE}: service name taken")
+        self.assert_serves()  # the daemon that has the name
+        self.platform.stop()
+        os.rename(self.platform.path("run/nordane"), self.platform.path("run/other"))
+        bundles.write(self.platform.path("run/nordane"), b"")
+        self.assert_start_fails(f"unable to listen for {scratch.SERVICE}: ", "Not a directory")
+        users = self.platform.path("var/db/users")
+        os.rename(users, users + ".other")
+        bundles.write(users, b"")
+        self.assert_start_fails("failed to get storage container: error=20", "unable to locate user container: error 20",
+                                users + ": Not a directory")
+
+    def test_stopping_leaves_no_socket(self):
+        self.platform.start()
+        self.assertIn("com.nordane.sandbox", os.listdir(self.platform.path("run/nordane")))
+        self.platform.stop()
+        for name in ("com.nordane.sandbox", scratch.SERVICE):
+            self.assertFalse(os.path.lexists(self.platform.path("run/nordane/" + name)), name)
 
     # Manifests.
 
@@ -250,7 +289,7 @@ class StateTest(unittest.TestCase):
                 process.kill()
             process.wait()
             if os.path.exists(file):
-                self.assert_saved(file, elected)
+                self.assert_saved(file)
 
 
 if __name__ == "__main__":

@@ -19,12 +19,18 @@ struct FakeDaemon {
         server = zbd::ZBDServer::initForService(fake.platform, zembra::serviceName, std::nullopt);
         server->service()->resume();
         fake.transport.setPeer(peer);
+        fake.files.allowPeers(peer.uid);
         processLog.clear();
     }
 
+    /// The record of a data plug-in that is installed now.
+    zbd::ZBDPlugInRef plugIn(const std::string& name) {
+        return server->findPlugIn(*fake.registry.install(dataPlugIn(name))->uuid);
+    }
+
     /// A host's end of a new connection.
-    std::shared_ptr<platform::Connection> connect() {
-        auto connection = fake.transport.connect(zembra::serviceName, fake.queues.makeSerial("host"));
+    std::shared_ptr<platform::Connection> connect(const std::string& service = zembra::serviceName) {
+        auto connection = fake.transport.connect(service, fake.queues.makeSerial("host"));
         connection->setEventHandler([](const platform::ConnectionEvent&) {});
         connection->resume();
         fake.transport.deliver();

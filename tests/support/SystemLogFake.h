@@ -14,22 +14,19 @@
 
 namespace support {
 
-/// A log that keeps its lines for the test to look at. It keeps every level and shows private arguments, unless told
-/// otherwise. Any thread.
+/// A log that keeps its lines for the test to look at. It keeps every level, unless told otherwise, and shows private
+/// arguments. Any thread.
 class FakeSystemLog final : public platform::SystemLog, private platform::LogSink {
 public:
     struct Line {
         std::string category; // empty for the default handle
         platform::LogLevel level;
         std::string message;
-        std::string format;
-
-        friend bool operator==(const Line&, const Line&) = default;
     };
 
     FakeSystemLog() : _default(*this, "", "") {
         _default.setMinimumLevel(_level);
-        _default.setPrivateArguments(_privacy);
+        _default.setPrivateArguments(platform::PrivateArguments::shown);
     }
 
     /// The log of every test program that includes this header, installed before `main`: handles are taken once per
@@ -47,7 +44,7 @@ public:
         platform::LogSink& sink = *this;
         platform::LogHandle& handle = _handles.emplace_back(sink, subsystem, category);
         handle.setMinimumLevel(levelOf(category));
-        handle.setPrivateArguments(_privacy);
+        handle.setPrivateArguments(platform::PrivateArguments::shown);
         return &handle;
     }
     platform::LogHandle& defaultHandle() override { return _default; }
@@ -67,12 +64,6 @@ public:
     void refuse(const std::string& category) {
         const std::lock_guard guard(_lock);
         _refused.insert(category);
-    }
-    void setPrivateArguments(platform::PrivateArguments privacy) {
-        const std::lock_guard guard(_lock);
-        _privacy = privacy;
-        for (platform::LogHandle& handle : _handles) handle.setPrivateArguments(privacy);
-        _default.setPrivateArguments(privacy);
     }
 
     /// All lines since the last `clear`, oldest first.
@@ -110,8 +101,7 @@ private:
     void write(const platform::LogRecord& record) noexcept override {
         if (_isPrinting) std::fprintf(stderr, "%s\n", std::string(record.message).c_str());
         const std::lock_guard guard(_lock);
-        _lines.push_back(
-            {std::string(record.category), record.level, std::string(record.message), std::string(record.format)});
+        _lines.push_back({std::string(record.category), record.level, std::string(record.message)});
     }
 
     std::atomic<bool> _isPrinting = false;
@@ -120,7 +110,6 @@ private:
     std::set<std::string> _refused;
     platform::LogLevel _level = platform::LogLevel::debug;
     std::map<std::string, platform::LogLevel> _levels;
-    platform::PrivateArguments _privacy = platform::PrivateArguments::shown;
     std::vector<Line> _lines;
     platform::LogHandle _default;
 };
@@ -130,5 +119,12 @@ inline FakeSystemLog& processLog = []() -> FakeSystemLog& {
     platform::setSystemLog(FakeSystemLog::ofProcess());
     return FakeSystemLog::ofProcess();
 }();
+
+/// True when a line of the process's log begins with `start`.
+inline bool logged(platform::LogLevel level, std::string_view start, std::string_view category = "ops") {
+    for (const auto& line : processLog.lines())
+        if (line.level == level && line.category == category && line.message.starts_with(start)) return true;
+    return false;
+}
 
 } // namespace support
