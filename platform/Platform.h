@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/ActivationRules.h"
 #include "platform/Bundles.h"
 #include "platform/CodeSigning.h"
 #include "platform/Containers.h"
@@ -8,12 +9,15 @@
 #include "platform/Locale.h"
 #include "platform/Notifications.h"
 #include "platform/Preferences.h"
+#include "platform/PrivacyConsent.h"
+#include "platform/ProcessAssertions.h"
 #include "platform/Processes.h"
 #include "platform/Registry.h"
 #include "platform/RunLoop.h"
 #include "platform/Sandbox.h"
 #include "platform/ServiceManager.h"
 #include "platform/Transport.h"
+#include "platform/TypeConformance.h"
 #include "platform/WorkQueue.h"
 
 namespace platform {
@@ -36,6 +40,10 @@ struct Platform {
     Locale& locale;
     Processes& processes;
     Files& files;
+    TypeConformance& typeConformance;
+    ActivationRules& activationRules;
+    PrivacyConsent& privacyConsent;
+    ProcessAssertions& processAssertions;
 };
 
 } // namespace platform

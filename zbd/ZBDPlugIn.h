@@ -4,15 +4,19 @@
 #include "Zembra/ZBPlugInCore.h"
 #include "platform/Platform.h"
 #include "platform/Registry.h"
+#include "zbd/RuleMismatch.h"
 
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <utility>
 
 namespace zbd {
+
+class ZBDQmxClient;
 
 /// The daemon's record of one plug-in, built from the registry's description of it. Its facts are fixed when it is
 /// made; its manifest follows the registry. May be read from any queue.
@@ -85,10 +89,43 @@ public:
     /// written. `resources` is a string or an array; elements of another kind are skipped.
     platform::MutableDictionary issueResourceExtensions(const platform::Value& resources) const;
 
+    // ZBDPlugInMatch.cpp. Not to be called on the database queue: elections are read there.
+
+    /// Whether the plug-in fulfils every rule; it does when there are none.
+    bool match(const std::optional<platform::Dictionary>& rules) const;
+    /// The first rule that it does not fulfil.
+    std::optional<RuleMismatch> mismatch(const std::optional<platform::Dictionary>& rules) const;
+    bool matchKey(std::string_view key, const platform::Value& pattern) const;
+    /// `patterns` is a string or an array of strings, of which one has to fit; nothing fits anything else.
+    bool matchValue(std::string_view value, const platform::Value& patterns) const;
+    bool matchValue(std::string_view value, std::string_view pattern) const;
+    bool matchDictionary(const platform::Value& value, const platform::Dictionary& pattern) const;
+
+    // ZBDPlugInAuthorization.cpp
+
+    /// Why the host may not use the plug-in; none when it may.
+    std::optional<std::string> allowForClient(const ZBDQmxClient& host) const;
+    /// The privacy services that the user granted to the containing application. Empty when that cannot be learnt.
+    std::set<std::string> allowedPVCServices() const;
+
+    // ZBDPlugInActivation.cpp
+
+    /// Registers the plug-in's executable with the service manager for this host alone. `environment` is what the host
+    /// wants the plug-in to receive; whether it may, and may use the plug-in at all, is the caller's to check.
+    platform::Failure enableForClient(const ZBDQmxClient& host,
+                                      const std::optional<platform::Dictionary>& environment) const;
+    /// One busy instance of the plug-in, by its bundle identifier; none when no instance is busy.
+    std::optional<platform::Dictionary> checkBusy() const;
+
 private:
     explicit ZBDPlugIn(platform::Platform& platform) : _platform(platform) {}
     bool setupWithProxy(const platform::PlugInProxyRef& proxy);
     platform::Value currentInfo() const;
+    platform::Value valueForRule(std::string_view key) const;
+    std::string userElection() const;
+    const char* sandboxProfile() const;
+    bool matchElements(const platform::Array& elements, const platform::Value& patterns) const;
+    bool accepts(std::string_view key, const platform::Value& value, const platform::Value& pattern) const;
     void setLocalized(zembra::AtomicField<platform::Value>& field, platform::Value value);
 
     platform::Platform& _platform;

@@ -31,6 +31,10 @@ std::shared_ptr<ZBDServer> ZBDServer::initForService(platform::Platform& platfor
     self->_mainQueue = platform.queues.makeSerial("service", platform::QualityOfService::userInitiated);
     self->_syncQueue = platform.queues.makeSerial("serverSync");
     self->_service = platform.transport.createListener(serviceName, self->_qmxQueue);
+    if (const auto refusal = self->_service->refusal()) {
+        log::ops().error("unable to listen for %{public}s: %{public}s", serviceName, *refusal);
+        return nullptr;
+    }
     self->_holds.clear();
     singleton() = self;
     self->setDelegate(self);

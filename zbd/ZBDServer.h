@@ -9,6 +9,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 namespace zbd {
@@ -21,8 +22,8 @@ class ZBDServer final : public ZBDatabase, public ZBDatabaseDelegate {
 public:
     using Holds = std::vector<std::shared_ptr<ZBDPlugInHold>>;
 
-    /// A server whose listener is suspended until `run`; null when the database cannot work. Main thread. The platform
-    /// must outlive the process's other threads.
+    /// A server whose listener is suspended until `run`. Null, with the reason logged, when the database cannot work or
+    /// the service's name cannot be had. Main thread. The platform must outlive the process's other threads.
     static std::shared_ptr<ZBDServer> initForService(platform::Platform& platform, const std::string& serviceName,
                                                      const std::optional<std::string>& annotationDatabasePath);
 
@@ -76,7 +77,11 @@ private:
     std::shared_ptr<platform::WorkQueue> _mainQueue;
     std::shared_ptr<platform::Listener> _service;
     std::unique_ptr<ZBDUserPrefs> _userPrefs;
-    Holds _holds; // on _syncQueue only
+    void uncountHold(const ZBDPlugInHold& hold);
+
+    // On _syncQueue only.
+    Holds _holds;
+    std::unordered_map<ZBDPlugInRef, std::size_t, zembra::ZBPlugInHash, zembra::ZBPlugInEqual> _holdCounts;
     std::shared_ptr<platform::WorkQueue> _syncQueue;
 };
 

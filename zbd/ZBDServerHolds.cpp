@@ -16,15 +16,22 @@ ZBDServer::Holds ZBDServer::holds() const {
 }
 
 bool ZBDServer::holdOnPlugIn(const ZBDPlugInRef& plugIn) {
-    return _syncQueue->sync([&] {
-        return std::any_of(_holds.begin(), _holds.end(),
-                           [&](const auto& hold) { return hold->blocked().contains(plugIn); });
-    });
+    return _syncQueue->sync([&] { return _holdCounts.contains(plugIn); });
 }
 
 void ZBDServer::addHold(const std::shared_ptr<ZBDPlugInHold>& hold) {
-    _syncQueue->sync([&] { _holds.push_back(hold); });
+    _syncQueue->sync([&] {
+        _holds.push_back(hold);
+        for (const ZBDPlugInRef& plugIn : hold->blocked()) ++_holdCounts[plugIn];
+    });
     notifyAnnotationChange();
+}
+
+void ZBDServer::uncountHold(const ZBDPlugInHold& hold) {
+    for (const ZBDPlugInRef& plugIn : hold.blocked()) {
+        const auto count = _holdCounts.find(plugIn);
+        if (--count->second == 0) _holdCounts.erase(count);
+    }
 }
 
 void ZBDServer::unholdToken(const UUID& token) {
@@ -33,21 +40,30 @@ void ZBDServer::unholdToken(const UUID& token) {
             std::find_if(_holds.begin(), _holds.end(), [&](const auto& hold) { return hold->uuid() == token; });
         if (found == _holds.end()) return;
         log::ops().debug("releasing plug-in hold %{public}@ at client's request", token);
+        uncountHold(**found);
         _holds.erase(found);
         notifyAnnotationChange();
     });
 }
 
 void ZBDServer::unholdClient(const std::shared_ptr<ZBDQmxClient>& client) {
-    // One pass, so that ten thousand holds of one client end in a moment; each has its line and its notification.
-    _syncQueue->sync([&] {
-        const std::size_t released = std::erase_if(_holds, [&](const auto& hold) {
-            if (hold->client() != client) return false;
-            log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(), client->pid());
-            return true;
+    // In slices, so that other requests get to the queue while ten thousand holds end.
+    constexpr std::size_t slice = 64;
+    std::size_t released = slice;
+    while (released == slice) {
+        released = 0;
+        _syncQueue->sync([&] {
+            std::erase_if(_holds, [&](const auto& hold) {
+                if (released == slice || hold->client() != client) return false;
+                log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(),
+                                 client->pid());
+                uncountHold(*hold);
+                ++released;
+                return true;
+            });
+            for (std::size_t i = 0; i < released; ++i) notifyAnnotationChange();
         });
-        for (std::size_t i = 0; i < released; ++i) notifyAnnotationChange();
-    });
+    }
 }
 
 void ZBDServer::releaseAllHolds() {
@@ -56,6 +72,7 @@ void ZBDServer::releaseAllHolds() {
             log::ops().debug("releasing plug-in hold %{public}@ because server is stopping", hold->uuid());
         }
         _holds.clear();
+        _holdCounts.clear();
     });
 }
 

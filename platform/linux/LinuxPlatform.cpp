@@ -1,5 +1,6 @@
 #include "platform/linux/LinuxPlatform.h"
 
+#include "platform/linux/ActivationRules.h"
 #include "platform/linux/Bundles.h"
 #include "platform/linux/CodeSigning.h"
 #include "platform/linux/Containers.h"
@@ -8,6 +9,8 @@
 #include "platform/linux/Locale.h"
 #include "platform/linux/Notifications.h"
 #include "platform/linux/Preferences.h"
+#include "platform/linux/PrivacyConsent.h"
+#include "platform/linux/ProcessAssertions.h"
 #include "platform/linux/Processes.h"
 #include "platform/linux/Registry.h"
 #include "platform/linux/Root.h"
@@ -16,6 +19,7 @@
 #include "platform/linux/ServiceManager.h"
 #include "platform/linux/SystemLog.h"
 #include "platform/linux/Transport.h"
+#include "platform/linux/TypeConformance.h"
 #include "platform/linux/WorkQueue.h"
 
 #include <csignal>
@@ -43,9 +47,13 @@ struct LinuxPlatform::Services {
     ServiceManager serviceManager{root, files};
     Registry registry{root, locale, containers};
     Transport transport{root};
-    Platform platform{queues,     runLoop,       transport, registry,   serviceManager,
-                      sandbox,    codeSigning,   bundles,   interfaces, preferences,
-                      containers, notifications, locale,    processes,  files};
+    TypeConformance typeConformance{root};
+    ActivationRules activationRules;
+    PrivacyConsent privacyConsent{root};
+    ProcessAssertions processAssertions{root};
+    Platform platform{queues,  runLoop,         transport,       registry,       serviceManager,   sandbox, codeSigning,
+                      bundles, interfaces,      preferences,     containers,     notifications,    locale,  processes,
+                      files,   typeConformance, activationRules, privacyConsent, processAssertions};
 };
 
 namespace {
@@ -86,7 +94,16 @@ Platform& LinuxPlatform::start() {
         // Hosts then get tokens that they cannot consume; everything else works.
         systemLog().defaultHandle().error("sandbox broker unavailable: %{public}@", *failure);
     }
+    if (const auto failure = _services->serviceManager.startServing()) {
+        // Plug-ins are then made ready but cannot be launched; everything else works.
+        systemLog().defaultHandle().error("service manager unavailable: %{public}@", *failure);
+    }
     return _services->platform;
+}
+
+void LinuxPlatform::removeNames() {
+    _services->sandbox.removeBrokerName();
+    _services->serviceManager.removeName();
 }
 
 } // namespace platform::linux_

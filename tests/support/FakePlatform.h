@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/Platform.h"
+#include "tests/support/ActivationRulesFake.h"
 #include "tests/support/BundlesFake.h"
 #include "tests/support/CodeSigningFake.h"
 #include "tests/support/ContainersFake.h"
@@ -9,6 +10,8 @@
 #include "tests/support/LocaleFake.h"
 #include "tests/support/NotificationsFake.h"
 #include "tests/support/PreferencesFake.h"
+#include "tests/support/PrivacyConsentFake.h"
+#include "tests/support/ProcessAssertionsFake.h"
 #include "tests/support/ProcessesFake.h"
 #include "tests/support/RegistryFake.h"
 #include "tests/support/RunLoopFake.h"
@@ -16,6 +19,7 @@
 #include "tests/support/ServiceManagerFake.h"
 #include "tests/support/SystemLogFake.h"
 #include "tests/support/TransportFake.h"
+#include "tests/support/TypeConformanceFake.h"
 #include "tests/support/WorkQueueFake.h"
 
 namespace support {
@@ -39,9 +43,14 @@ struct FakePlatform {
     FakeLocale locale;
     FakeProcesses processes;
     FakeFiles files;
-    platform::Platform platform{queues,     runLoop,       transport, registry,   serviceManager,
-                                sandbox,    codeSigning,   bundles,   interfaces, preferences,
-                                containers, notifications, locale,    processes,  files};
+    FakeTypeConformance typeConformance;
+    FakeActivationRules activationRules;
+    FakePrivacyConsent privacyConsent;
+    FakeProcessAssertions processAssertions;
+    platform::Platform platform{queues,          runLoop,         transport,      registry,         serviceManager,
+                                sandbox,         codeSigning,     bundles,        interfaces,       preferences,
+                                containers,      notifications,   locale,         processes,        files,
+                                typeConformance, activationRules, privacyConsent, processAssertions};
 
     FakePlatform() {
         files.addDirectory("/var/db");

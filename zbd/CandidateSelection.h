@@ -1,0 +1,50 @@
+#pragma once
+
+#include "platform/PropertyList.h"
+#include "zbd/ZBDatabase.h"
+
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace zbd {
+
+class ZBDQmxClient;
+class ZBDServer;
+
+/// What one discovery asks of its candidates.
+struct Selection {
+    ZBDServer& server;
+    const ZBDQmxClient& client;
+    std::uint64_t flags = 0; // DiscoveryFlags
+    std::optional<platform::Dictionary> rules;
+    std::vector<platform::Dictionary> exclusions; // the user's, as read for this request
+};
+
+/// Why a candidate is dropped.
+struct Rejection {
+    std::string reason;                     // for people
+    std::optional<RuleMismatch> mismatch{}; // when rules decided
+};
+
+/// One test that a candidate has to pass.
+struct SelectionTest {
+    std::string_view name;
+    bool hostSide; // skipped by a host that asks for everything
+    /// None when the candidate passes. Logs the lines that the log has for the case.
+    std::optional<Rejection> (*reject)(const Selection& selection, const ZBDPlugInRef& candidate);
+};
+
+/// In the order in which they are made.
+std::span<const SelectionTest> selectionTests();
+
+/// The first test that drops the candidate, or none.
+std::optional<Rejection> rejectionOf(const Selection& selection, const ZBDPlugInRef& candidate);
+
+/// The dictionaries in the user's exclusions; whatever else is stored there is ignored.
+std::vector<platform::Dictionary> readExclusions(const platform::Value& stored);
+
+} // namespace zbd
