@@ -3,7 +3,8 @@
 set -euo pipefail
 
 build=(cmake ninja-build g++ make pkg-config ccache python3 libexpat1-dev libsqlite3-dev libssl-dev libsystemd-dev
-       systemtap-sdt-dev libcli11-dev nlohmann-json3-dev libgtest-dev libgmock-dev libbenchmark-dev strace binutils)
+       libseccomp-dev systemtap-sdt-dev libcli11-dev nlohmann-json3-dev libgtest-dev libgmock-dev libbenchmark-dev
+       strace binutils)
 check=(clang-19 clang-tidy-19 clang-format-19 libclang-rt-19-dev valgrind)
 
 packages=("${build[@]}")

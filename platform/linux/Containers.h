@@ -15,6 +15,7 @@ public:
     explicit Containers(Root root, uid_t user = ::geteuid());
 
     Result<std::string> userContainer(const std::string& identifier) override;
+    void discardEmpty(const std::string& identifier) override;
 
 private:
     const Root _root;

@@ -1,6 +1,7 @@
 #include "platform/linux/Sandbox.h"
 
 #include "platform/linux/Confinement.h"
+#include "platform/linux/RequestSocket.h"
 #include "platform/linux/SandboxBroker.h"
 #include "platform/linux/SandboxToken.h"
 #include "platform/linux/SystemError.h"
@@ -8,9 +9,7 @@
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
-#include <cstring>
 #include <fcntl.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 
 namespace platform::linux_ {
@@ -43,31 +42,6 @@ bool isWithin(const std::string& path, const std::string& directory) {
     return path.size() == directory.size() || directory == "/" || path[directory.size()] == '/';
 }
 
-/// Receives the broker's answer. Zero, or an errno value.
-int receiveAnswer(int connection, Descriptor& opened) {
-    std::int32_t number = 0;
-    iovec part{&number, sizeof number};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    msghdr message{};
-    message.msg_iov = &part;
-    message.msg_iovlen = 1;
-    message.msg_control = control;
-    message.msg_controllen = sizeof control;
-    ssize_t size = 0;
-    do size = recvmsg(connection, &message, MSG_CMSG_CLOEXEC);
-    while (size < 0 && errno == EINTR);
-    if (size < 0) return errno == EAGAIN ? ETIMEDOUT : errno;
-    const cmsghdr* header = CMSG_FIRSTHDR(&message);
-    if (header != nullptr && header->cmsg_level == SOL_SOCKET && header->cmsg_type == SCM_RIGHTS) {
-        int descriptor = -1;
-        std::memcpy(&descriptor, CMSG_DATA(header), sizeof descriptor);
-        opened = Descriptor(descriptor);
-    }
-    // An answer whose descriptor did not fit into this process any more is no success.
-    if (size != static_cast<ssize_t>(sizeof number)) return ECONNRESET;
-    return (message.msg_flags & MSG_CTRUNC) != 0 ? EMFILE : number;
-}
-
 } // namespace
 
 Sandbox::Sandbox(Root root, SandboxRole role) : _root(std::move(root)) {
@@ -82,6 +56,10 @@ Failure Sandbox::startBroker() {
     if (!broker) return broker.error();
     _broker = *std::move(broker);
     return std::nullopt;
+}
+
+void Sandbox::removeBrokerName() {
+    if (_broker) _broker->removeName();
 }
 
 std::string Sandbox::resolutionKey(const std::string& path, const std::string& within) {
@@ -167,23 +145,37 @@ std::int64_t Sandbox::consume(const std::string& token, int& errorNumber) {
         errorNumber = EINVAL;
         return -1;
     }
-    auto connection = SandboxBroker::connect(_root);
-    if (!connection) {
-        errorNumber = static_cast<int>(connection.error().code);
-        return -1;
-    }
     Descriptor opened;
-    // A failed send leaves its mark in what is received: nothing, or the answer that came first.
-    ssize_t sent = 0;
-    do sent = send(connection->get(), token.data(), token.size(), MSG_NOSIGNAL);
-    while (sent < 0 && errno == EINTR);
-    if (int number = receiveAnswer(connection->get(), opened)) {
+    if (int number = ask(token, opened)) {
         errorNumber = number;
         return -1;
     }
     std::lock_guard lock(_mutex);
-    _handles.emplace(_nextHandle, std::move(opened));
+    _handles.emplace(_nextHandle, Right{token, std::move(opened)});
     return _nextHandle++;
+}
+
+/// Zero, or an errno value.
+int Sandbox::ask(std::string_view request, Descriptor& opened) const {
+    auto connection = SandboxBroker::connect(_root);
+    if (!connection) return static_cast<int>(connection.error().code);
+    return exchangeRequest(connection->get(), request, opened);
+}
+
+Result<Descriptor> Sandbox::open(std::int64_t handle, const std::string& path) const {
+    std::string request;
+    {
+        std::lock_guard lock(_mutex);
+        const auto entry = _handles.find(handle);
+        if (entry == _handles.end() || path.empty() || path.find('\0') != std::string::npos) {
+            return systemError(EINVAL, path);
+        }
+        request = entry->second.token + '\0' + path;
+    }
+    Descriptor opened;
+    if (const int number = ask(request, opened)) return systemError(number, path);
+    if (!opened) return systemError(ENOTDIR, path);
+    return opened;
 }
 
 int Sandbox::release(std::int64_t handle, int& errorNumber) {
@@ -198,7 +190,7 @@ bool Sandbox::isSandboxed(std::int32_t pid) { return isConfined(pid); }
 int Sandbox::descriptor(std::int64_t handle) const {
     std::lock_guard lock(_mutex);
     auto entry = _handles.find(handle);
-    return entry == _handles.end() ? -1 : entry->second.get();
+    return entry == _handles.end() ? -1 : entry->second.opened.get();
 }
 
 } // namespace platform::linux_

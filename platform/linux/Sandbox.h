@@ -9,6 +9,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <string_view>
 #include <unordered_map>
 
 namespace platform::linux_ {
@@ -32,6 +33,8 @@ public:
 
     /// Listens under the root's runtime directory from now on, on a thread of its own, until destruction. Issuers only.
     Failure startBroker();
+    /// Removes the broker's socket, for a process that ends without destroying this object.
+    void removeBrokerName();
 
     /// Regular files and directories only (else EINVAL). The token is for what lies at the path now: once that is
     /// replaced, the token yields nothing.
@@ -49,7 +52,18 @@ public:
     /// service tokens and unknown handles. Belongs to this object and is good until `release`.
     int descriptor(std::int64_t handle) const;
 
+    /// Has the broker open a regular file below the directory of a consumed token, by its path from there. A process
+    /// under Landlock cannot do it itself: its rules follow files to wherever a descriptor came from. Errors as those
+    /// of `consume`, and EXDEV for a path that leaves the directory, EISDIR, EINVAL and ENOTDIR for what is no file.
+    Result<Descriptor> open(std::int64_t handle, const std::string& path) const;
+
 private:
+    struct Right {
+        std::string token;
+        Descriptor opened; // not open for services
+    };
+    int ask(std::string_view request, Descriptor& opened) const;
+
     /// Where a path led at `checked`, and whether that was within the directory asked for.
     struct Resolution {
         std::string canonicalPath;
@@ -72,7 +86,7 @@ private:
     mutable std::mutex _mutex;
     std::unordered_map<std::string, Resolution> _resolutions;    // guarded by _mutex; by path, NUL, directory
     std::unordered_map<std::string, std::string> _serviceTokens; // guarded by _mutex; by class, NUL, name
-    std::map<std::int64_t, Descriptor> _handles;                 // guarded by _mutex; none for services
+    std::map<std::int64_t, Right> _handles;                      // guarded by _mutex
     std::int64_t _nextHandle = 1;                                // guarded by _mutex
 };
 

@@ -2,51 +2,38 @@
 
 #include "platform/Error.h"
 #include "platform/linux/Descriptor.h"
-#include "platform/linux/FileStatus.h"
+#include "platform/linux/RequestSocket.h"
 #include "platform/linux/Root.h"
 #include "platform/linux/SandboxToken.h"
 
-#include <deque>
 #include <memory>
-#include <thread>
+#include <string>
+#include <string_view>
 
 namespace platform::linux_ {
 
-/// Connections that have not yet sent their token. One more drops the oldest, so silent peers only hurt each other:
-/// who sends at once, as every consumer does, is served when accepted.
-inline constexpr std::size_t maximumSilentConnections = 64;
-
-/// The socket at which the daemon exchanges tokens for descriptors. One packet each way per connection: the token's
-/// text; then an errno value (32 bits, native order), zero on success and with the descriptor for a file token.
+/// The socket at which the daemon exchanges tokens for descriptors. A request is the token's text, for a file below the
+/// token's directory followed by NUL and the relative path. The answer of a file token has a descriptor.
 class SandboxBroker {
 public:
     /// Starts listening. `signer` must outlive the broker.
     static Result<std::unique_ptr<SandboxBroker>> start(const Root& root, TokenSigner& signer);
-    /// Stops the thread and removes the socket.
-    ~SandboxBroker();
-    SandboxBroker(const SandboxBroker&) = delete;
-    SandboxBroker& operator=(const SandboxBroker&) = delete;
+
+    /// Removes the socket, for a process that ends without destroying this object.
+    void removeName() const { _socket->removeName(); }
 
     /// A connection to the broker of `root`. Waiting on it is bounded.
     static Result<Descriptor> connect(const Root& root);
 
 private:
     explicit SandboxBroker(TokenSigner& signer) : _signer(signer) {}
-    Failure listen(const Root& root);
-    void run();
-    void acceptWaiting();
-    /// False while the peer has not sent its token.
+    /// False while the peer has not sent its request.
     bool serve(int connection);
-    int open(const SandboxGrant& grant, int connection, Descriptor& opened) const;
+    /// Zero, or an errno value. `below` is empty for what the token itself names.
+    static int open(const SandboxGrant& grant, const std::string& below, int connection, Descriptor& opened);
 
     TokenSigner& _signer;
-    Descriptor _directory;
-    Descriptor _listener;
-    Descriptor _stop;
-    Descriptor _reserve; // given up to accept and close a connection when the process has no descriptor left
-    FileIdentity _socket;
-    std::deque<Descriptor> _silent; // oldest first; used on the thread only
-    std::thread _thread;
+    std::unique_ptr<RequestSocket> _socket; // last, for its thread uses the others
 };
 
 } // namespace platform::linux_

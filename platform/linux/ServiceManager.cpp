@@ -1,12 +1,14 @@
 #include "platform/linux/ServiceManager.h"
 
+#include "platform/linux/DirectoryFiles.h"
+#include "platform/linux/FileTrust.h"
 #include "platform/linux/ServiceThread.h"
 #include "platform/linux/SystemError.h"
 #include "platform/linux/UserDirectory.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
+#include <climits>
 #include <csignal>
 #include <dirent.h>
 #include <fcntl.h>
@@ -17,25 +19,18 @@
 #include <unistd.h>
 #include <utility>
 
+#ifndef SO_PEERPIDFD
+#define SO_PEERPIDFD 77 // newer than the C library's headers
+#endif
+
 namespace platform::linux_ {
 
 namespace {
 
-constexpr std::size_t maximumRecordSize = 32; // a 64-bit number
-constexpr std::size_t maximumStatSize = 4096; // of /proc/<pid>/stat
-constexpr char separator = '@';               // between bundle identifier and version
+constexpr char separator = '@'; // between bundle identifier and version
 
-// Called directly: the C library declares its own wrappers for C alone.
-Descriptor openProcess(pid_t pid) { return Descriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0))); }
 int signalProcess(const Descriptor& process, int signal) {
     return static_cast<int>(::syscall(SYS_pidfd_send_signal, process.get(), signal, nullptr, 0));
-}
-
-template <class Number> std::optional<Number> numberOf(std::string_view text) {
-    Number number{};
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
-    if (error != std::errc() || end != text.data() + text.size()) return std::nullopt;
-    return number;
 }
 
 /// The name of a service's directory; an errno value for names that give none. The identifier holds no separator, so
@@ -50,44 +45,30 @@ Result<std::string> directoryName(const std::string& bundleIdentifier, const std
     return name;
 }
 
-/// Field 22 of /proc/<pid>/stat (proc(5)), as text. None when there is no such process.
-std::optional<std::string> startTime(pid_t pid) {
-    const Descriptor file(::open(("/proc/" + std::to_string(pid) + "/stat").c_str(), O_RDONLY | O_CLOEXEC));
-    if (!file) return std::nullopt;
-    std::string text(maximumStatSize, '\0');
-    ssize_t size = 0;
-    do size = ::read(file.get(), text.data(), text.size());
-    while (size < 0 && errno == EINTR);
-    if (size <= 0) return std::nullopt;
-    text.resize(static_cast<std::size_t>(size));
-
-    // The second field is the program's name in parentheses, which may hold anything, blanks and parentheses too.
-    std::size_t at = text.rfind(')');
-    for (int field = 2; field < 22 && at != std::string::npos; ++field) at = text.find(' ', at + 1);
-    if (at == std::string::npos) return std::nullopt;
-    return text.substr(at + 1, text.find(' ', at + 1) - at - 1);
-}
-
-/// Zero when the directory's files can be believed, else an errno value.
-int directoryError(const std::string& path) {
-    struct stat status{};
-    if (::lstat(path.c_str(), &status) != 0) return errno;
-    if (!S_ISDIR(status.st_mode)) return ENOTDIR;
-    if (status.st_uid != 0 && status.st_uid != ::geteuid()) return EPERM;
-    return (status.st_mode & 022) != 0 ? EACCES : 0;
-}
-
-bool hasEnded(const Descriptor& process) {
-    pollfd descriptor{process.get(), POLLIN, 0};
-    return ::poll(&descriptor, 1, 0) > 0;
+/// The process that connected. None when it has ended.
+std::optional<ProcessIdentity> peerOf(int connection) {
+    ucred peer{};
+    socklen_t size = sizeof peer;
+    if (::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return std::nullopt;
+    int pidfd = -1;
+    size = sizeof pidfd;
+    const bool isKnown = ::getsockopt(connection, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) == 0;
+    const Descriptor process = isKnown ? Descriptor(pidfd) : openProcess(peer.pid);
+    auto identity = ProcessIdentity::of(peer.pid);
+    return process && !hasEnded(process) ? identity : std::nullopt;
 }
 
 } // namespace
 
 ServiceManager::ServiceManager(const Root& root, platform::Files& files, std::chrono::milliseconds grace)
-    : _directory(root.runtime() + "/ignitd"), _files(files), _grace(grace) {}
+    : _root(root),
+      _directory(root.runtime() + "/ignitd"),
+      _files(files),
+      _grace(grace),
+      _registrations(_directory + "/hosts", _watch) {}
 
 ServiceManager::~ServiceManager() {
+    _launchSocket.reset(); // first, for its thread uses everything
     if (!_thread) return;
     {
         const std::lock_guard lock(_mutex);
@@ -97,9 +78,98 @@ ServiceManager::~ServiceManager() {
     _thread->join();
 }
 
+Failure ServiceManager::startServing() {
+    if (auto failure = makeDirectory()) return failure;
+    {
+        const std::lock_guard lock(_mutex);
+        if (!startThread()) return systemError(EAGAIN, "ignitd");
+    }
+    if (const int number = _registrations.load()) return systemError(number, _directory);
+    loadInstances();
+    auto socket = RequestSocket::start(_root, launchSocketAddress, "ignitd-launch",
+                                       [this](int connection) { return serveLaunch(connection); });
+    if (!socket) return socket.error();
+    _launchSocket = *std::move(socket);
+    return std::nullopt;
+}
+
+void ServiceManager::removeName() const {
+    if (_launchSocket) _launchSocket->removeName();
+}
+
+/// An error unless the directory can be believed then.
+Failure ServiceManager::makeDirectory() {
+    for (std::size_t end = _directory.find('/', 1); end != std::string::npos; end = _directory.find('/', end + 1)) {
+        static_cast<void>(::mkdir(_directory.substr(0, end).c_str(), 0755)); // shows below
+    }
+    if (::mkdir(_directory.c_str(), 0755) != 0 && errno != EEXIST) return systemError(errno, _directory);
+    const auto directory = openTrustedDirectory(_directory);
+    return directory ? Failure() : directory.error();
+}
+
+void ServiceManager::loadInstances() {
+    const Descriptor directory = openDirectory(AT_FDCWD, _directory);
+    const auto services = directory ? listDirectory(directory.get()) : std::nullopt;
+    if (!services) return; // what is recorded stays, and is looked at when it is removed
+    for (const auto& service : services->directories) {
+        if (service.find(separator) == std::string::npos) continue;
+        const Descriptor records = openDirectory(directory.get(), service);
+        const auto instances = records ? listDirectory(records.get()) : std::nullopt;
+        if (!instances) continue;
+        for (const auto& name : instances->others) {
+            const auto identity = ProcessIdentity::named(name);
+            Descriptor process = identity ? openProcess(*identity) : Descriptor();
+            if (process) {
+                static_cast<void>(_watch.add(std::move(process), _directory + '/' + service + '/' + name));
+            } else if (!identity || errno == ESRCH) {
+                ::unlinkat(records.get(), name.c_str(), 0);
+            }
+        }
+        ::unlinkat(directory.get(), service.c_str(), AT_REMOVEDIR); // when it is empty
+    }
+}
+
+int ServiceManager::addExternalServiceForHost(pid_t host, const std::string& executablePath,
+                                              const Dictionary& overlay) {
+    const auto code = [](const Error& error) { return static_cast<int>(error.code); };
+    const auto registration = registrationOf(_files, executablePath, overlay);
+    if (!registration) return code(registration.error());
+    const auto& service = registration->service;
+    if (const auto name = directoryName(service.identifier, service.version); !name) return code(name.error());
+    if (const auto failure = makeDirectory()) return code(*failure);
+    {
+        const std::lock_guard lock(_mutex);
+        if (!startThread()) return EAGAIN;
+    }
+    return _registrations.add(host, *registration);
+}
+
+bool ServiceManager::serveLaunch(int connection) {
+    const auto name = receiveRequest(connection, PATH_MAX);
+    if (!name) return false;
+    if (name->empty()) return true; // hung up
+    Descriptor registration;
+    const int number = name->size() > PATH_MAX ? ENAMETOOLONG : launch(*name, connection, registration);
+    sendAnswer(connection, number, registration);
+    return true;
+}
+
+int ServiceManager::launch(const std::string& name, int connection, Descriptor& registration) {
+    const auto process = peerOf(connection);
+    const auto host = process ? parentOf(*process) : std::nullopt;
+    if (!host) return ESRCH;
+    const std::lock_guard lock(_launching);
+    auto found = _registrations.find(*host, name);
+    if (!found) return static_cast<int>(found.error().code);
+    if (const auto failure = noteInstance(found->service, *process)) return static_cast<int>(failure->code);
+    registration = std::move((*found).file);
+    return 0;
+}
+
 void ServiceManager::removeExternalService(const std::string& bundleIdentifier, const std::string& version,
                                            std::shared_ptr<WorkQueue> queue, std::function<void(int)> completion) {
     Removal removal;
+    removal.service = {bundleIdentifier, version};
     removal.queue = std::move(queue);
     removal.completion = std::move(completion);
     const auto name = directoryName(bundleIdentifier, version);
@@ -136,13 +206,14 @@ void ServiceManager::run() {
                 return;
             }
         }
+        forgetEnded();
         for (auto& removal : submitted) {
             begin(removal);
             removals.push_back(std::move(removal));
         }
         std::erase_if(removals, [this](Removal& removal) { return advance(removal); });
 
-        descriptors.assign(1, pollfd{_wakeUp.get(), POLLIN, 0});
+        descriptors.assign({{_wakeUp.get(), POLLIN, 0}, {_watch.descriptor(), POLLIN, 0}});
         auto timeout = std::chrono::milliseconds(-1);
         const auto now = std::chrono::steady_clock::now();
         for (const auto& removal : removals) {
@@ -160,15 +231,23 @@ void ServiceManager::run() {
     }
 }
 
+void ServiceManager::forgetEnded() {
+    for (const auto& path : _watch.takeEnded()) {
+        if (!_registrations.end(path)) ::unlink(path.c_str());
+    }
+}
+
 void ServiceManager::begin(Removal& removal) {
     removal.deadline = std::chrono::steady_clock::now() + _grace;
-    for (const auto& directory : {_directory, removal.directory}) {
-        const int number = directoryError(directory);
-        if (number == ENOENT) return;
-        if (number != 0) {
-            removal.firstError = number;
-            return;
-        }
+    {
+        const std::lock_guard lock(_launching);
+        _registrations.remove(removal.service);
+    }
+    for (const auto& path : {_directory, removal.directory}) {
+        const auto directory = openTrustedDirectory(path);
+        if (directory) continue;
+        removal.firstError = directory.error().code == ENOENT ? 0 : static_cast<int>(directory.error().code);
+        return;
     }
     const std::unique_ptr<DIR, int (*)(DIR*)> directory(::opendir(removal.directory.c_str()), ::closedir);
     if (!directory) {
@@ -179,23 +258,14 @@ void ServiceManager::begin(Removal& removal) {
 }
 
 void ServiceManager::terminate(Removal& removal, const std::string& name) {
-    const auto pid = numberOf<pid_t>(name);
-    if (!pid || *pid <= 0) return; // no record of an instance
-    Instance instance{openProcess(*pid), removal.directory + '/' + name};
+    const auto identity = ProcessIdentity::named(name);
+    if (!identity) return; // no record of an instance
+    Instance instance{openProcess(*identity), removal.directory + '/' + name};
     const auto note = [&removal](int number) {
         if (removal.firstError == 0) removal.firstError = number;
     };
     if (!instance.process && errno != ESRCH) return note(errno);
-
-    // The start time is read after the process was opened: if it is the recorded one now, the pid has been that
-    // process's all the time, and it is the one that is open.
-    const auto record = _files.read(instance.path, maximumRecordSize);
-    if (!record) {
-        if (record.error().code != fileReadNoSuchFileCode) note(EIO);
-        return;
-    }
-    const bool isInstance = instance.process && startTime(*pid) == *record && !hasEnded(instance.process);
-    if (!isInstance) {
+    if (!instance.process) {
         ::unlink(instance.path.c_str());
         return;
     }
@@ -226,27 +296,39 @@ bool ServiceManager::advance(Removal& removal) {
 }
 
 Failure ServiceManager::noteInstance(const std::string& bundleIdentifier, const std::string& version, pid_t pid) {
-    const auto name = directoryName(bundleIdentifier, version);
-    if (!name) return name.error();
-    const auto time = startTime(pid);
-    if (!time) return systemError(ESRCH, "process " + std::to_string(pid));
-
-    const std::string directory = _directory + '/' + *name;
-    const std::string path = directory + '/' + std::to_string(pid);
-    Failure failure;
-    // A removal may take the empty directory away between its making and the writing.
-    for (int tries = 0; tries < 3; ++tries) {
-        for (std::size_t end = directory.find('/', 1); end != std::string::npos; end = directory.find('/', end + 1)) {
-            static_cast<void>(::mkdir(directory.substr(0, end).c_str(), 0755)); // shows below
-        }
-        if (::mkdir(directory.c_str(), 0755) != 0 && errno != EEXIST) return systemError(errno, directory);
-        if (const int number = directoryError(directory); number != 0 && number != ENOENT) {
-            return systemError(number, directory);
-        }
-        failure = _files.writeAtomically(path, *time);
-        if (!failure) break;
+    const auto process = ProcessIdentity::of(pid);
+    if (!process) return systemError(ESRCH, "process " + std::to_string(pid));
+    {
+        const std::lock_guard lock(_mutex);
+        if (!startThread()) return systemError(EAGAIN, "ignitd");
     }
-    return failure;
+    return noteInstance({bundleIdentifier, version}, *process);
+}
+
+Failure ServiceManager::noteInstance(const ServiceName& service, const ProcessIdentity& process) {
+    const auto name = directoryName(service.identifier, service.version);
+    if (!name) return name.error();
+    const std::string directory = _directory + '/' + *name;
+    const std::string path = directory + '/' + process.name();
+    Descriptor pidfd = openProcess(process);
+    if (!pidfd) return systemError(errno, path);
+    if (auto failure = makeDirectory()) return failure;
+    // A removal may take the empty directory away between its making and the recording.
+    Descriptor record;
+    for (int tries = 0; tries < 3 && !record; ++tries) {
+        if (::mkdir(directory.c_str(), 0755) != 0 && errno != EEXIST) return systemError(errno, directory);
+        const auto trusted = openTrustedDirectory(directory);
+        if (!trusted && trusted.error().code != ENOENT) return trusted.error();
+        record = Descriptor(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
+        // It is watched already. One that asks again and again costs one descriptor.
+        if (!record && errno == EEXIST) return std::nullopt;
+    }
+    if (!record) return systemError(errno, path);
+    if (const int number = _watch.add(std::move(pidfd), path)) {
+        ::unlink(path.c_str());
+        return systemError(number, path);
+    }
+    return std::nullopt;
 }
 
 } // namespace platform::linux_

@@ -4,7 +4,11 @@
 #include "platform/Files.h"
 #include "platform/ServiceManager.h"
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/ProcessIdentity.h"
+#include "platform/linux/ProcessWatch.h"
+#include "platform/linux/RequestSocket.h"
 #include "platform/linux/Root.h"
+#include "platform/linux/ServiceRegistrations.h"
 
 #include <chrono>
 #include <functional>
@@ -12,6 +16,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <sys/socket.h>
 #include <sys/types.h>
 #include <thread>
 #include <vector>
@@ -21,20 +26,35 @@ namespace platform::linux_ {
 /// How long instances have to end by themselves: long enough to save a document, short enough for a person who waits.
 inline constexpr std::chrono::milliseconds terminationGrace{5000};
 
-/// The part of "ignitd" that ends services. Each running instance is a file
-/// `<root>/run/nordane/ignitd/<bundle identifier>@<version>/<pid>` that holds the process's start time in clock ticks
-/// since boot, so that a process which got a recycled pid is never taken for the instance. The directories must belong
-/// to the superuser or to the caller's user and be writable by their owner alone: whoever can add a file there has a
-/// process ended. Callable from any thread; a thread of its own begins with the first removal.
+/// Where launchers ask (see ServiceLaunch.h). A stream, which the services' own confinement keeps them from: no service
+/// launches another one in the name of its host.
+inline constexpr RequestSocketAddress launchSocketAddress{"com.nordane.ignitd", SOCK_STREAM};
+
+/// "ignitd": which host may start which services, and which instances run. All of it is files in
+/// `<root>/run/nordane/ignitd`, so that it outlives the daemon: the registrations of ServiceRegistrations in `hosts`,
+/// and an empty file `<bundle identifier>@<version>/<process>` for each running instance. Processes are named with
+/// their start time, so that one which got a recycled pid inherits nothing and is never ended. The directories must
+/// belong to the superuser or to the caller's user and be writable by their owner alone: whoever can add a file there
+/// has programs started and processes ended. Callable from any thread; a thread of its own begins with the first use,
+/// another one serves launchers.
 class ServiceManager final : public platform::ServiceManager {
 public:
     ServiceManager(const Root& root, platform::Files& files, std::chrono::milliseconds grace = terminationGrace);
     /// Removals that still wait are answered with ECANCELED; their instances have got SIGTERM or run on.
     ~ServiceManager() override;
 
-    /// SIGTERM to each instance, SIGKILL to those that live on after the grace period. Errors: EINVAL and ENAMETOOLONG
-    /// for names that cannot be part of a path, EPERM and EACCES for directories of others and processes that may not
-    /// be signalled, else what the system gave. One failing instance does not keep the others from being ended.
+    /// Takes up what an earlier daemon left of processes that still run, and serves launchers from now on. Once.
+    Failure startServing();
+    /// Removes the launchers' socket, for a process that ends without destroying this object.
+    void removeName() const;
+
+    /// Errors: EINVAL for what is no bundle's executable and for names as below, ESRCH when there is no such process,
+    /// E2BIG for a huge overlay, EPERM and EACCES for directories of others, else what the system gave.
+    int addExternalServiceForHost(pid_t host, const std::string& executablePath, const Dictionary& overlay) override;
+    /// Takes the registrations of the service from all hosts; then SIGTERM to each instance, SIGKILL to those that live
+    /// on after the grace period. Errors: EINVAL and ENAMETOOLONG for names that cannot be part of a path, EPERM and
+    /// EACCES for directories of others and processes that may not be signalled, else what the system gave. One failing
+    /// instance does not keep the others from being ended.
     void removeExternalService(const std::string& bundleIdentifier, const std::string& version,
                                std::shared_ptr<WorkQueue> queue, std::function<void(int)> completion) override;
 
@@ -48,6 +68,7 @@ private:
         std::string path;   // of its file
     };
     struct Removal {
+        ServiceName service;
         std::string directory;
         std::shared_ptr<WorkQueue> queue;
         std::function<void(int)> completion;
@@ -58,6 +79,12 @@ private:
         int firstError = 0;
     };
 
+    Failure makeDirectory();
+    void loadInstances();
+    void forgetEnded();
+    Failure noteInstance(const ServiceName& service, const ProcessIdentity& process);
+    bool serveLaunch(int connection);
+    int launch(const std::string& name, int connection, Descriptor& registration);
     bool startThread();
     void run();
     void begin(Removal& removal);
@@ -65,15 +92,22 @@ private:
     bool advance(Removal& removal);
     static void answer(Removal& removal, int result);
 
+    const Root _root;
     const std::string _directory;
     platform::Files& _files;
     const std::chrono::milliseconds _grace;
+    ProcessWatch _watch; // hosts and instances, by their paths
+    ServiceRegistrations _registrations;
+    // Held from finding a registration to recording the instance, and while a service's registrations are removed: a
+    // removal sees every instance that it has not prevented.
+    std::mutex _launching;
 
     std::mutex _mutex;
     Descriptor _wakeUp; // an eventfd: new removals, or the end
     std::vector<Removal> _submitted;
     bool _isStopping = false;
     std::optional<std::thread> _thread;
+    std::unique_ptr<RequestSocket> _launchSocket;
 };
 
 } // namespace platform::linux_

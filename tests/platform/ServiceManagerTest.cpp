@@ -127,11 +127,17 @@ TEST(FakeServiceManager, RefusesUntilAllowedAndFailsWhenTold) {
     std::vector<int> results;
     {
         support::FakeServiceManager manager;
+        EXPECT_EQ(manager.addExternalServiceForHost(7, "/program", {}), EPERM);
         const auto remove = [&](const char* version) {
             manager.removeExternalService(identifier, version, queue, [&](int result) { results.push_back(result); });
         };
         remove("1");
         manager.allow();
+        manager.failAdditions(EIO);
+        EXPECT_EQ(manager.addExternalServiceForHost(7, "/program", {}), EIO);
+        manager.failAdditions(0);
+        EXPECT_EQ(manager.addExternalServiceForHost(7, "/program", {}), 0);
+        EXPECT_EQ(manager.additions().size(), 1U);
         manager.fail(identifier, "2", EIO);
         remove("2");
         manager.holdAnswers();
@@ -171,14 +177,11 @@ TEST_F(ServiceManagerOnLinux, RemoveKillsWhatLivesOnAfterTheGracePeriod) {
 TEST_F(ServiceManagerOnLinux, RemoveNeverSignalsARecycledPid) {
     LinuxServices world;
     const Sleeper innocent;
-    const std::string record = world.directory("1") + "/" + std::to_string(innocent.pid());
-    ASSERT_FALSE(world.manager->noteInstance(identifier, "1", innocent.pid()));
-    for (const char* content : {"1", "", "not a number"}) {
-        std::filesystem::create_directories(world.directory("1"));
-        std::ofstream(record) << content;
-        EXPECT_EQ(remove(*world.manager, "1").get(), platform::serviceHasNoInstances) << content;
-        EXPECT_FALSE(std::filesystem::exists(record)) << "stale";
-    }
+    std::filesystem::create_directories(world.directory("1"));
+    const std::string record = world.directory("1") + "/" + std::to_string(innocent.pid()) + "-1";
+    std::ofstream(record).flush();
+    EXPECT_EQ(remove(*world.manager, "1").get(), platform::serviceHasNoInstances);
+    EXPECT_FALSE(std::filesystem::exists(record)) << "stale";
     EXPECT_TRUE(innocent.isRunning());
 }
 

@@ -14,13 +14,19 @@
 
 namespace support {
 
-/// A service manager whose services are entries in a table. Refuses every removal with EPERM until removals are
-/// allowed. Callable from any thread.
+/// A service manager whose services are entries in a table. Refuses everything with EPERM until told to allow. Callable
+/// from any thread.
 class FakeServiceManager final : public platform::ServiceManager {
 public:
     using Service = std::pair<std::string, std::string>; // bundle identifier and version
 
-    /// From now on removals are done: they end the instances of `addInstance`.
+    struct ExternalService {
+        pid_t host;
+        std::string executablePath;
+        platform::Dictionary overlay;
+    };
+
+    /// From now on services are added, and removals are done: they end the instances of `addInstance`.
     void allow() {
         const std::lock_guard lock(_mutex);
         _isAllowed = true;
@@ -28,6 +34,16 @@ public:
     void addInstance(const std::string& bundleIdentifier, const std::string& version) {
         const std::lock_guard lock(_mutex);
         ++_instances[{bundleIdentifier, version}];
+    }
+    /// Answers additions with `number`, and nothing is added; 0 ends it.
+    void failAdditions(int number) {
+        const std::lock_guard lock(_mutex);
+        _additionFailure = number;
+    }
+    /// Every service that was added, in order.
+    std::vector<ExternalService> additions() const {
+        const std::lock_guard lock(_mutex);
+        return _additions;
     }
     /// Answers removals of this service with `result`, and nothing is ended.
     void fail(const std::string& bundleIdentifier, const std::string& version, int result) {
@@ -58,6 +74,14 @@ public:
         for (const auto& answer : _held) answer.send(ECANCELED);
     }
 
+    int addExternalServiceForHost(pid_t host, const std::string& executablePath,
+                                  const platform::Dictionary& overlay) override {
+        const std::lock_guard lock(_mutex);
+        if (_additionFailure != 0) return _additionFailure;
+        if (!_isAllowed) return EPERM;
+        _additions.push_back({host, executablePath, overlay});
+        return 0;
+    }
     void removeExternalService(const std::string& bundleIdentifier, const std::string& version,
                                std::shared_ptr<platform::WorkQueue> queue,
                                std::function<void(int)> completion) override {
@@ -92,6 +116,8 @@ private:
     mutable std::recursive_mutex _mutex; // a queue may run answers in place, and they may ask again
     bool _isAllowed = false;
     bool _isHolding = false;
+    int _additionFailure = 0;
+    std::vector<ExternalService> _additions;
     std::map<Service, int> _instances;
     std::map<Service, int> _failures;
     std::vector<Service> _removals;
