@@ -1,24 +1,17 @@
 """Writes property lists and bundles for tests, without the project's own code."""
 
-import base64
 import os
 from xml.sax.saxutils import escape
 
 
 def _element(value):
-    if value is True:
-        return "<true/>"
-    if value is False:
-        return "<false/>"
+    if isinstance(value, bool):
+        return "<true/>" if value else "<false/>"
     if isinstance(value, int):
         return f"<integer>{value}</integer>"
-    if isinstance(value, float):
-        return f"<real>{value}</real>"
     if isinstance(value, str):
         return f"<string>{escape(value)}</string>"
-    if isinstance(value, bytes):
-        return f"<data>{base64.b64encode(value).decode()}</data>"
-    if isinstance(value, (list, tuple)):
+    if isinstance(value, list):
         return "<array>" + "".join(_element(element) for element in value) + "</array>"
     if isinstance(value, dict):
         entries = "".join(f"<key>{escape(key)}</key>{_element(element)}" for key, element in value.items())
@@ -53,7 +46,7 @@ def write(path, content):
     os.rename(temporary, path)
 
 
-def application(root, name, plugins, identifier=None):
+def application(root, name, plugins):
     """Lays out an application: `plugins` maps a bundle name to a manifest, as bytes or as a dictionary. Answers its path.
 
     The application appears as a whole: it is made aside and moved in."""
@@ -61,7 +54,7 @@ def application(root, name, plugins, identifier=None):
     for plugin, content in plugins.items():
         write(os.path.join(aside, "PlugIns", plugin, "Info.vlist"), content)
     write(os.path.join(aside, "Info.vlist"),
-          {"VBBundleIdentifier": identifier or "com.example." + name, "VBBundleDisplayName": name, "VBBundleVersion": "1"})
+          {"VBBundleIdentifier": "com.example." + name, "VBBundleDisplayName": name, "VBBundleVersion": "1"})
     path = os.path.join(root, "Applications", name + ".app")
     os.rename(aside, path)
     return path

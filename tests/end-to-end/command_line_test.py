@@ -4,7 +4,6 @@
 import os
 import re
 import select
-import subprocess
 import unittest
 
 import bundles
@@ -55,9 +54,8 @@ class CommandLineTest(unittest.TestCase):
         ):
             with self.subTest(arguments):
                 # The program's own name stands before getopt's complaints, so it is called by nothing but that.
-                result = subprocess.run(["zbd", *arguments], executable=os.path.join(scratch.BUILD, "bin", "zbd"),
-                                        env=self.platform.environment, stdin=subprocess.DEVNULL, capture_output=True,
-                                        text=True, timeout=scratch.DEADLINE, check=False)
+                result = self.platform.zbctl(*arguments, program="zbd", env=self.platform.environment,
+                                             executable=os.path.join(scratch.BUILD, "bin", "zbd"))
                 self.assertEqual((result.returncode, result.stdout), (2, ""))
                 self.assertEqual([without_time(line) for line in result.stderr.splitlines()],
                                  [LAUNCHING, *complaints, USAGE])

@@ -17,36 +17,49 @@ def _text(value):
     return struct.pack("<I", len(encoded)) + encoded
 
 
+def _container(tag, items):
+    content = b"".join(items)
+    return struct.pack("<BII", tag, len(content), len(items)) + content
+
+
+def _integer(value):
+    return b"\x03" + struct.pack("<q", value) if value < 2**63 else b"\x04" + struct.pack("<Q", value)
+
+
+_ENCODERS = (  # in the order asked: a boolean is an integer too
+    (bool, lambda value: b"\x02" if value else b"\x01"),
+    (int, _integer),
+    (float, lambda value: b"\x05" + struct.pack("<d", value)),
+    (datetime.datetime, lambda value: b"\x06" + struct.pack("<d", (value - _EPOCH).total_seconds())),
+    (str, lambda value: b"\x07" + _text(value)),
+    (bytes, lambda value: b"\x08" + struct.pack("<I", len(value)) + value),
+    (uuid.UUID, lambda value: b"\x09" + value.bytes),
+    (list, lambda value: _container(10, [encode(item) for item in value])),
+    (dict, lambda value: _container(11, [_text(key) + encode(item) for key, item in value.items()])),
+)
+
+
 def encode(value):
-    if value is False:
-        return b"\x01"
-    if value is True:
-        return b"\x02"
-    if isinstance(value, int):
-        return b"\x03" + struct.pack("<q", value) if value < 2**63 else b"\x04" + struct.pack("<Q", value)
-    if isinstance(value, float):
-        return b"\x05" + struct.pack("<d", value)
-    if isinstance(value, datetime.datetime):
-        return b"\x06" + struct.pack("<d", (value - _EPOCH).total_seconds())
-    if isinstance(value, str):
-        return b"\x07" + _text(value)
-    if isinstance(value, (bytes, bytearray)):
-        return b"\x08" + struct.pack("<I", len(value)) + bytes(value)
-    if isinstance(value, uuid.UUID):
-        return b"\x09" + value.bytes
-    if isinstance(value, (list, tuple)):
-        items = b"".join(encode(item) for item in value)
-        return b"\x0a" + struct.pack("<II", len(items), len(value)) + items
-    if isinstance(value, dict):
-        items = b"".join(_text(key) + encode(item) for key, item in value.items())
-        return b"\x0b" + struct.pack("<II", len(items), len(value)) + items
-    raise TypeError(f"no encoding for {type(value)}")
+    return next(encoder for kind, encoder in _ENCODERS if isinstance(value, kind))(value)
 
 
 class _Reader:
     def __init__(self, data):
         self._data = data
         self._at = 0
+        self._decoders = {
+            1: lambda: False,
+            2: lambda: True,
+            3: lambda: self.number("q"),
+            4: lambda: self.number("Q"),
+            5: lambda: self.number("d"),
+            6: lambda: _EPOCH + datetime.timedelta(seconds=self.number("d")),
+            7: self.text,
+            8: lambda: bytes(self.take(self.number("I"))),
+            9: lambda: uuid.UUID(bytes=bytes(self.take(16))),
+            10: lambda: self.items(self.value),
+            11: lambda: self.dictionary(self.items(lambda: (self.text(), self.value()))),
+        }
 
     def take(self, count):
         if count > len(self._data) - self._at:
@@ -60,42 +73,22 @@ class _Reader:
     def text(self):
         return bytes(self.take(self.number("I"))).decode()
 
+    def items(self, read):
+        size, count = self.number("I"), self.number("I")
+        end = self._at + size
+        result = [read() for _ in range(count)]
+        if self._at != end:
+            raise ValueError("wrong size")
+        return result
+
+    def dictionary(self, entries):
+        result = dict(entries)
+        if len(result) != len(entries):
+            raise ValueError("key occurs twice")
+        return result
+
     def value(self):
-        tag = self.number("B")
-        if tag == 1:
-            return False
-        if tag == 2:
-            return True
-        if tag == 3:
-            return self.number("q")
-        if tag == 4:
-            return self.number("Q")
-        if tag == 5:
-            return self.number("d")
-        if tag == 6:
-            return _EPOCH + datetime.timedelta(seconds=self.number("d"))
-        if tag == 7:
-            return self.text()
-        if tag == 8:
-            return bytes(self.take(self.number("I")))
-        if tag == 9:
-            return uuid.UUID(bytes=bytes(self.take(16)))
-        if tag in (10, 11):
-            size, count = self.number("I"), self.number("I")
-            end = self._at + size
-            if tag == 10:
-                result = [self.value() for _ in range(count)]
-            else:
-                result = {}
-                for _ in range(count):
-                    key = self.text()
-                    if key in result:
-                        raise ValueError("key occurs twice")
-                    result[key] = self.value()
-            if self._at != end:
-                raise ValueError("wrong size")
-            return result
-        raise ValueError(f"unknown tag {tag}")
+        return self._decoders[self.number("B")]()
 
     def is_at_end(self):
         return self._at == len(self._data)
@@ -121,18 +114,14 @@ def frame(kind, number, body):
 def connect_socket(path):
     """A connected socket, however long the path is."""
     connection = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+    directory = os.open(os.path.dirname(path), os.O_PATH | os.O_DIRECTORY)
     try:
-        if len(path.encode()) <= 107:
-            connection.connect(path)
-        else:
-            directory = os.open(os.path.dirname(path), os.O_PATH | os.O_DIRECTORY)
-            try:
-                connection.connect(f"/proc/self/fd/{directory}/{os.path.basename(path)}")
-            finally:
-                os.close(directory)
+        connection.connect(f"/proc/self/fd/{directory}/{os.path.basename(path)}")
     except OSError:
         connection.close()
         raise
+    finally:
+        os.close(directory)
     return connection
 
 

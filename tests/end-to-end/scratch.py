@@ -8,19 +8,19 @@
 The build directory comes from the environment variable ZBD_BUILD.
 """
 
+import contextlib
 import ctypes
-import errno
 import os
 import re
 import select
 import shutil
 import signal
-import socket
 import stat
 import subprocess
-import sys
 import tempfile
 import time
+
+import qmx
 
 SOURCE = os.path.dirname(os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
 BUILD = os.path.abspath(os.environ.get("ZBD_BUILD", os.path.join(SOURCE, "build", "release")))
@@ -31,24 +31,22 @@ _IN_MODIFY, _IN_CREATE, _IN_MOVED_TO = 0x2, 0x100, 0x80
 _libc = ctypes.CDLL(None, use_errno=True)
 
 
-class _Watch:
-    """inotify on one directory, so that waiting costs no polling interval."""
+@contextlib.contextmanager
+def _changes(directory):
+    """Gives what waits for a change in `directory`, for some seconds at the most."""
+    descriptor = _libc.inotify_init1(os.O_CLOEXEC | os.O_NONBLOCK)
+    mask = _IN_MODIFY | _IN_CREATE | _IN_MOVED_TO
+    if descriptor < 0 or _libc.inotify_add_watch(descriptor, os.fsencode(directory), mask) < 0:
+        raise OSError(ctypes.get_errno(), "inotify on " + directory)
 
-    def __init__(self, directory):
-        self.descriptor = _libc.inotify_init1(os.O_CLOEXEC | os.O_NONBLOCK)
-        mask = _IN_MODIFY | _IN_CREATE | _IN_MOVED_TO
-        if self.descriptor < 0 or _libc.inotify_add_watch(self.descriptor, os.fsencode(directory), mask) < 0:
-            raise OSError(ctypes.get_errno(), "inotify on " + directory)
+    def wait(seconds):
+        if select.select([descriptor], [], [], seconds)[0]:
+            os.read(descriptor, 65536)
 
-    def wait(self, seconds):
-        if select.select([self.descriptor], [], [], seconds)[0]:
-            try:
-                os.read(self.descriptor, 65536)
-            except BlockingIOError:
-                pass
-
-    def close(self):
-        os.close(self.descriptor)
+    try:
+        yield wait
+    finally:
+        os.close(descriptor)
 
 
 class Platform:
@@ -96,38 +94,31 @@ class Platform:
     def start(self, *options, service=SERVICE, wrapper=()):
         """Starts zbd and returns when a connection to its socket is accepted by the system."""
         assert self.process is None or self.process.poll() is not None, "one daemon at a time"
-        watch = _Watch(self.path("run/nordane"))
-        try:
+        with _changes(self.path("run/nordane")) as wait:
             with open(self.log_path, "ab") as log:
                 self.process = subprocess.Popen([*wrapper, os.path.join(BUILD, "bin", "zbd"), *options],
                                                 env=self.environment, stdin=subprocess.DEVNULL,
                                                 stdout=log, stderr=log)
-            deadline = time.monotonic() + DEADLINE
-            while not self._listens(self.path("run/nordane/" + service)):
-                if self.process.poll() is not None:
-                    raise AssertionError(f"zbd ended with {self.process.returncode}:\n{self.log()}")
-                if time.monotonic() > deadline:
-                    raise AssertionError("zbd does not listen:\n" + self.log())
-                watch.wait(0.05)  # the event of the name; listening follows it without an event of its own
-        finally:
-            watch.close()
+            # The event of the name; listening follows it without an event of its own.
+            self._until(lambda: self._listens(self.path("run/nordane/" + service)), lambda: wait(0.05), "zbd listens")
         return self.process
+
+    def _until(self, ask, wait, what):
+        """What `ask` answers once that is true; fails when zbd has ended or after a long time."""
+        deadline = time.monotonic() + DEADLINE
+        while not (answer := ask()):
+            if self.process.poll() is not None or time.monotonic() > deadline:
+                raise AssertionError(f"not seen: {what}; zbd's status is {self.process.returncode}:\n{self.log()}")
+            wait()
+        return answer
 
     @staticmethod
     def _listens(path):
-        # A path below a long temporary directory may not fit a socket address; the directory's descriptor does.
-        directory = os.open(os.path.dirname(path), os.O_PATH | os.O_DIRECTORY | os.O_CLOEXEC)
-        probe = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
         try:
-            probe.connect(f"/proc/self/fd/{directory}/{os.path.basename(path)}")
+            qmx.connect_socket(path).close()
             return True
-        except OSError as error:
-            if error.errno in (errno.ENOENT, errno.ECONNREFUSED):
-                return False
-            raise
-        finally:
-            probe.close()
-            os.close(directory)
+        except (FileNotFoundError, ConnectionRefusedError):
+            return False
 
     def stop(self):
         """SIGTERM, exit status 0, and the whole log."""
@@ -149,28 +140,20 @@ class Platform:
 
     def wait_for_log(self, pattern, count=1):
         """Returns the matches once the log holds `count` of the regular expression; fails after a long time."""
-        watch = _Watch(self.directory)
-        try:
-            deadline = time.monotonic() + DEADLINE
-            while True:
-                text = self.log()
-                found = re.findall(pattern, text)
-                if len(found) >= count:
-                    return found
-                if self.process.poll() is not None or time.monotonic() > deadline:
-                    raise AssertionError(f"the log never showed {pattern!r} {count} times:\n{text}")
-                watch.wait(1)
-        finally:
-            watch.close()
+        def found():
+            matches = re.findall(pattern, self.log())
+            return matches if len(matches) >= count else None
 
-    def run(self, *command, text=True, **options):
-        """Runs a client program on this platform; its output is captured."""
+        with _changes(self.directory) as wait:
+            return self._until(found, lambda: wait(1), f"{pattern!r} {count} times in the log")
+
+    def run(self, *command, **options):
+        """Runs a client program on this platform; its output is captured as text."""
+        options = {"env": self.client_environment, "stdout": subprocess.PIPE, **options}
         if "input" not in options:
-            options.setdefault("stdin", subprocess.DEVNULL)
-        if text:
-            options.setdefault("errors", "backslashreplace")
-        return subprocess.run(command, env=self.client_environment, stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=text,
-                              timeout=DEADLINE, check=False, **options)
+            options["stdin"] = subprocess.DEVNULL
+        return subprocess.run(command, stderr=subprocess.PIPE, text=True, errors="backslashreplace", timeout=DEADLINE,
+                              check=False, **options)
 
     def zbctl(self, *arguments, program=None, **options):
         return self.run(program or os.path.join(BUILD, "bin", "zbctl"), *arguments, **options)
@@ -179,7 +162,3 @@ class Platform:
         """For a verb that runs on: the process, its outputs as text in pipes."""
         return subprocess.Popen([os.path.join(BUILD, "bin", "zbctl"), *arguments], env=self.client_environment,
                                 stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
-
-
-if __name__ == "__main__":
-    sys.exit("a module for the tests beside it")

@@ -3,26 +3,11 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
-#include <cstdint>
 #include <limits>
-#include <memory>
-#include <optional>
-#include <string>
-#include <string_view>
-#include <vector>
 
 namespace {
 
-using platform::Array;
-using platform::Error;
-using platform::format;
-using platform::FormatArgument;
-using platform::FormatFault;
-using platform::formatFault;
-using platform::PrivateArguments;
-using platform::URL;
-using platform::UUID;
-using platform::Value;
+using namespace platform;
 
 struct Described {
     mutable int asked = 0;
@@ -79,8 +64,7 @@ TEST(Format, TextsAndObjectsPrintThemselves) {
               "01234567-89AB-CDEF-0123-456789ABCDEF 01234567-89AB-CDEF-0123-456789ABCDEF "
               "01234567-89AB-CDEF-0123-456789ABCDEF");
     EXPECT_EQ(format("%@ %@", URL::file("/a b"), Error{"Domain", 4}), "file:///a%20b Domain error 4");
-    EXPECT_EQ(format("%@ %@ %@", Value("string"), Value(), platform::Failure(Error{"D", 1, "failed"})),
-              "string (null) failed");
+    EXPECT_EQ(format("%@ %@ %@", Value("string"), Value(), Failure(Error{"D", 1, "failed"})), "string (null) failed");
     const Array array{Value(1), Value("two")};
     EXPECT_EQ(format("%@", array), Value(array).description());
 
@@ -106,10 +90,10 @@ TEST(Format, AddressesAreThoseOfTheObjects) {
 TEST(Format, LongListsAreCut) {
     const std::vector<std::string> list(100'000, "an element");
     const std::string text = format("%@", list);
-    EXPECT_LT(text.size(), platform::maximumListDescription + 100);
+    EXPECT_LT(text.size(), maximumListDescription + 100);
     EXPECT_TRUE(text.ends_with(", ...)"));
     // An earlier argument does not use up the room of a later one, and texts are never cut here.
-    const std::string large(2 * platform::maximumListDescription, 'x');
+    const std::string large(2 * maximumListDescription, 'x');
     EXPECT_EQ(format("%@%@", large, std::vector<std::string>{"a", "b"}), large + "(a, b)");
 }
 

@@ -3,7 +3,6 @@
 #include "platform/linux/Entitlements.h"
 #include "platform/linux/PeerProcess.h"
 #include "tests/support/ChildProcess.h"
-#include "tests/support/CodeSigningFake.h"
 #include "tests/support/ProcessesFake.h"
 #include "tests/support/ScratchDirectory.h"
 
@@ -26,35 +25,41 @@ std::string ownPath() { return fs::read_symlink("/proc/self/exe").string(); }
 /// A token as the transport makes it for a peer that connects now.
 AuditToken tokenOf(pid_t pid) { return {pid, getuid(), getgid(), linux_::LinuxPeerProcess::look(pid)}; }
 
-class ProgramTest : public testing::Test {
+class LinuxProcesses : public testing::Test {
 protected:
-    ProgramTest() {
+    LinuxProcesses() {
         chmod(scratch.path().c_str(), 0755);
-        fs::copy_file("/bin/cat", program);
-        chmod(program.c_str(), 0755);
+        install(program);
     }
-    /// Replaces as an installer does: by another file at the same path.
-    void replaceProgram() {
+    /// As an installer does: replaces by another file at the same path.
+    void install(const std::string& path) {
         fs::copy_file("/bin/cat", scratch / "next");
-        fs::rename(scratch / "next", program);
+        chmod((scratch / "next").c_str(), 0755);
+        fs::rename(scratch / "next", path);
+    }
+    /// errno for the path of a process, 0 when it has one.
+    template <class Process> std::int64_t pathError(const Process& process) {
+        const auto path = processes.executablePath(process, anySize);
+        return path ? 0 : path.error().code;
     }
 
     support::ScratchDirectory scratch;
     std::string program = scratch / "program";
-};
-
-class LinuxProcesses : public ProgramTest {
-protected:
-    std::int64_t errorOf(const Result<std::string>& result) { return result ? 0 : result.error().code; }
     linux_::Processes processes;
 };
 
-class LinuxCodeSigning : public ProgramTest {
+class LinuxCodeSigning : public LinuxProcesses {
 protected:
-    void sign(const Dictionary& entitlements) {
-        auto failure = linux_::writeEntitlements(program, entitlements);
+    void SetUp() override {
+        auto failure = linux_::writeEntitlements(program, manager);
         if (failure) GTEST_SKIP() << failure->text(); // no privilege, or no attributes here
     }
+    std::shared_ptr<SecTask> taskOf(pid_t pid) { return codeSigning.taskFromAuditToken(tokenOf(pid)); }
+    bool isBelieved(const std::string& path) {
+        auto entitlements = linux_::readEntitlements(path);
+        return entitlements && entitlements->has_value();
+    }
+
     linux_::CodeSigning codeSigning;
     const Dictionary manager{{"manager", true}, {"name", "any"}};
 };
@@ -98,17 +103,16 @@ TEST_F(LinuxProcesses, PathOfAProcessThatIsGoneIsNobodys) {
     kill(pid, SIGKILL);
     siginfo_t ended{};
     ASSERT_EQ(waitid(P_PID, static_cast<id_t>(pid), &ended, WEXITED | WNOWAIT), 0); // a zombie has no program either
-    EXPECT_EQ(errorOf(processes.executablePath(pid, anySize)), ESRCH);
-    EXPECT_EQ(errorOf(processes.executablePath(token, anySize)), ESRCH);
+    EXPECT_EQ(pathError(pid), ESRCH);
+    EXPECT_EQ(pathError(token), ESRCH);
     child.end();
-    EXPECT_EQ(errorOf(processes.executablePath(pid, anySize)), ESRCH);
-    EXPECT_EQ(errorOf(processes.executablePath(token, anySize)), ESRCH);
+    EXPECT_EQ(pathError(pid), ESRCH);
+    EXPECT_EQ(pathError(token), ESRCH);
 }
 
 TEST_F(LinuxProcesses, TokenDoesNotFitAnotherPid) {
     support::WaitingProgram gone(program);
     support::WaitingProgram other(program);
-    ASSERT_TRUE(gone.runs() && other.runs());
     // As if the pid had been used again: the number of a living process, the handle of one that has ended.
     int handle = static_cast<int>(syscall(SYS_pidfd_open, gone.pid(), 0));
     gone.end();
@@ -117,67 +121,48 @@ TEST_F(LinuxProcesses, TokenDoesNotFitAnotherPid) {
 
 TEST_F(LinuxProcesses, DeletedAndReplacedProgramsHaveNoPath) {
     support::WaitingProgram child(program);
-    ASSERT_TRUE(child.runs());
     fs::remove(program);
-    EXPECT_EQ(errorOf(processes.executablePath(child.pid(), anySize)), ENOENT);
-    fs::copy_file("/bin/cat", program + " (deleted)"); // the text that the kernel gives names this file now
-    EXPECT_EQ(errorOf(processes.executablePath(child.pid(), anySize)), ENOENT);
-    support::WaitingProgram oddlyNamed(program + " (deleted)");
-    ASSERT_TRUE(oddlyNamed.runs());
-    EXPECT_EQ(*processes.executablePath(oddlyNamed.pid(), anySize), program + " (deleted)");
-
-    fs::copy_file("/bin/cat", program);
-    support::WaitingProgram outdated(program);
-    ASSERT_TRUE(outdated.runs());
-    replaceProgram();
-    EXPECT_EQ(errorOf(processes.executablePath(outdated.pid(), anySize)), ENOENT);
-    EXPECT_EQ(errorOf(processes.executablePath(tokenOf(outdated.pid()), anySize)), ENOENT);
+    EXPECT_EQ(pathError(child.pid()), ENOENT);
+    const std::string odd = program + " (deleted)"; // the text that the kernel gives names this file now
+    install(odd);
+    EXPECT_EQ(pathError(child.pid()), ENOENT);
+    support::WaitingProgram oddlyNamed(odd);
+    EXPECT_EQ(*processes.executablePath(oddlyNamed.pid(), anySize), odd);
+    install(odd);
+    EXPECT_EQ(pathError(oddlyNamed.pid()), ENOENT);
+    EXPECT_EQ(pathError(tokenOf(oddlyNamed.pid())), ENOENT);
 }
 
 TEST_F(LinuxProcesses, MountNamespaceOfItsOwnLendsNoPath) {
     const std::string own = scratch / "own";
-    fs::copy_file("/bin/cat", own);
+    install(own);
     support::WaitingProgram child(program, [&] {
         return unshare(CLONE_NEWNS) == 0 && mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
                mount(own.c_str(), program.c_str(), nullptr, MS_BIND, nullptr) == 0;
     });
     if (!child.runs()) GTEST_SKIP() << "may not mount";
     ASSERT_EQ(fs::read_symlink("/proc/" + std::to_string(child.pid()) + "/exe"), program);
-    EXPECT_EQ(errorOf(processes.executablePath(child.pid(), anySize)), ENOENT);
+    EXPECT_EQ(pathError(child.pid()), ENOENT);
 }
 
 TEST_F(LinuxCodeSigning, EntitlementsAreThoseOfTheProgramThatConnected) {
-    sign(manager);
-    if (IsSkipped()) return;
     support::WaitingProgram child(program);
-    ASSERT_TRUE(child.runs());
-    auto task = codeSigning.taskFromAuditToken(tokenOf(child.pid()));
-    ASSERT_TRUE(task);
-    replaceProgram(); // without entitlements; what runs has them
+    auto task = taskOf(child.pid());
+    auto unasked = taskOf(child.pid());
+    install(program); // without entitlements; what runs has them
     EXPECT_EQ(codeSigning.copyEntitlement(task, "manager").value, Value(true));
     auto absent = codeSigning.copyEntitlement(task, "other");
     EXPECT_FALSE(absent.value || absent.error);
     child.end();
     EXPECT_EQ(codeSigning.copyEntitlement(task, "name").value, Value("any")) << "read once";
-}
-
-TEST_F(LinuxCodeSigning, ProcessGoneBeforeTheFirstQueryIsAnError) {
-    sign(manager);
-    if (IsSkipped()) return;
-    support::WaitingProgram child(program);
-    ASSERT_TRUE(child.runs());
-    auto task = codeSigning.taskFromAuditToken(tokenOf(child.pid()));
-    child.end();
-    auto result = codeSigning.copyEntitlement(task, "manager");
-    EXPECT_FALSE(result.value);
-    ASSERT_TRUE(result.error);
-    EXPECT_EQ(result.error->code, ESRCH);
+    EXPECT_EQ(codeSigning.copyEntitlement(unasked, "name").error->code, ESRCH);
+    support::WaitingProgram unsignedChild(program);
+    absent = codeSigning.copyEntitlement(taskOf(unsignedChild.pid()), "manager");
+    EXPECT_FALSE(absent.value || absent.error);
 }
 
 // The trick of connecting as oneself and then becoming a program that has entitlements.
 TEST_F(LinuxCodeSigning, AnotherProgramInTheSameProcessLendsNothing) {
-    sign(manager);
-    if (IsSkipped()) return;
     int go[2];
     int became[2]; // closed by the exec
     ASSERT_TRUE(pipe2(go, O_CLOEXEC) == 0 && pipe2(became, O_CLOEXEC) == 0);
@@ -196,107 +181,68 @@ TEST_F(LinuxCodeSigning, AnotherProgramInTheSameProcessLendsNothing) {
     close(became[1]);
     char none = 0;
     ASSERT_EQ(read(became[0], &none, 1), 0);
-    close(became[0]);
     auto result = codeSigning.copyEntitlement(task, "manager");
-    EXPECT_FALSE(result.value);
-    EXPECT_TRUE(result.error);
-    EXPECT_EQ(linux_::Processes().executablePath(token, anySize).error().code, ESRCH);
-    // A connection of its own has them.
-    EXPECT_TRUE(codeSigning.copyEntitlement(codeSigning.taskFromAuditToken(tokenOf(child)), "manager").value);
-    close(go[0]);
-    close(go[1]);
+    EXPECT_TRUE(result.error && !result.value);
+    EXPECT_EQ(pathError(token), ESRCH);
+    EXPECT_TRUE(codeSigning.copyEntitlement(taskOf(child), "manager").value) << "a connection of its own has them";
+    for (int descriptor : {go[0], go[1], became[0]}) close(descriptor);
     kill(child, SIGKILL);
     waitpid(child, nullptr, 0);
 }
 
-TEST_F(LinuxCodeSigning, NoEntitlementsIsNoErrorButBrokenOnesAre) {
+TEST_F(LinuxCodeSigning, BrokenEntitlementsAndUnknownProcessesAreErrors) {
     support::WaitingProgram child(program);
-    ASSERT_TRUE(child.runs());
-    auto plain = codeSigning.copyEntitlement(codeSigning.taskFromAuditToken(tokenOf(child.pid())), "manager");
-    EXPECT_FALSE(plain.value || plain.error);
-    sign(manager);
-    if (IsSkipped()) return;
     const char* name = geteuid() == 0 ? linux_::entitlementsAttribute : linux_::userEntitlementsAttribute;
     for (std::string_view broken : {"", "garbage", "<vlist version=\"1.0\"><array/></vlist>"}) {
         ASSERT_EQ(setxattr(program.c_str(), name, broken.data(), broken.size(), 0), 0);
-        auto result = codeSigning.copyEntitlement(codeSigning.taskFromAuditToken(tokenOf(child.pid())), "manager");
-        EXPECT_FALSE(result.value) << broken;
-        EXPECT_TRUE(result.error) << broken;
+        auto result = codeSigning.copyEntitlement(taskOf(child.pid()), "manager");
+        EXPECT_TRUE(result.error && !result.value) << broken;
     }
-}
-
-TEST_F(LinuxCodeSigning, WithoutAnIdentifiedProcessThereIsNoTask) {
     EXPECT_FALSE(codeSigning.taskFromAuditToken({getpid(), getuid(), getgid(), nullptr}));
-    auto result = codeSigning.copyEntitlement(nullptr, "manager");
-    EXPECT_FALSE(result.value);
-    EXPECT_TRUE(result.error);
-    support::FakeCodeSigning fake;
-    auto task = fake.taskFromAuditToken({1, 0, 0, nullptr});
-    EXPECT_FALSE(fake.copyEntitlement(task, "manager").value) << "the twin grants nothing by itself";
+    EXPECT_TRUE(codeSigning.copyEntitlement(nullptr, "manager").error);
 }
 
 TEST_F(LinuxCodeSigning, AttributeIsBelievedOnlyWhereItsSignerVouchesForTheBytes) {
-    sign(manager);
-    if (IsSkipped()) return;
-    const uid_t self = geteuid();
-    const struct {
-        mode_t mode;
-        bool believed;
-    } modes[] = {{0755, true}, {0511, true}, {0700, true}, {0775, false}, {0757, false}, {0722, false}};
+    const bool isRoot = geteuid() == 0;
+    const std::pair<mode_t, bool> modes[] = {{0511, true}, {0775, false}, {0757, false}, {0722, false}, {0755, true}};
     for (const auto& [mode, believed] : modes) {
         ASSERT_EQ(chmod(program.c_str(), mode), 0);
-        auto result = linux_::readEntitlements(program);
-        ASSERT_TRUE(result) << result.error().text();
-        EXPECT_EQ(result->has_value(), believed) << std::oct << mode;
-        if (mode == 0511 && self != 0) continue; // to be read, not to be signed anew
+        EXPECT_EQ(isBelieved(program), believed) << std::oct << mode;
+        if (mode == 0511 && !isRoot) continue; // to be read, not to be signed anew
         EXPECT_EQ(!linux_::writeEntitlements(program, manager), believed) << std::oct << mode;
     }
-    chmod(program.c_str(), 0755);
     // Copies, as anybody can make them, carry nothing.
-    fs::copy_file(program, scratch / "copy");
-    EXPECT_FALSE(linux_::readEntitlements(scratch / "copy")->has_value());
-    if (self != 0) return;
-
-    // root's daemon: not another user's file, not the attribute that its owner can write.
-    ASSERT_EQ(chown(program.c_str(), support::ordinaryUser, 0), 0);
-    EXPECT_FALSE(linux_::readEntitlements(program)->has_value());
-    const std::string bytes = *encodeXML(Value(manager));
     const std::string copy = scratch / "copy";
-    ASSERT_EQ(setxattr(copy.c_str(), linux_::userEntitlementsAttribute, bytes.data(), bytes.size(), 0), 0);
-    EXPECT_FALSE(linux_::readEntitlements(copy)->has_value());
+    fs::copy_file(program, copy);
+    EXPECT_FALSE(isBelieved(copy));
+    if (!isRoot) return;
 
-    // One user's daemon: the same attribute, on that user's files alone, and what root signed.
-    EXPECT_EQ(support::resultInChild([&] {
-                  if (!support::becomeOrdinaryUser()) return 9;
-                  auto foreign = linux_::readEntitlements(copy);
-                  if (!foreign || foreign->has_value()) return 1;
-                  auto own = linux_::readEntitlements(program);
-                  return own && own->has_value() ? 0 : 2;
-              }),
-              0);
+    // root's daemon: not another user's file, not the attribute that its owner can write. One user's daemon: that
+    // attribute, on that user's files alone, and what root signed.
+    const auto isBelievedByUser = [&](const std::string& path) {
+        return support::resultInChild([&] { return support::becomeOrdinaryUser() ? int{isBelieved(path)} : 9; });
+    };
+    ASSERT_EQ(chown(program.c_str(), support::ordinaryUser, 0), 0);
+    EXPECT_FALSE(isBelieved(program));
+    EXPECT_EQ(isBelievedByUser(program), 1);
+    const std::string bytes = *encodeXML(Value(manager));
+    ASSERT_EQ(setxattr(copy.c_str(), linux_::userEntitlementsAttribute, bytes.data(), bytes.size(), 0), 0);
+    EXPECT_FALSE(isBelieved(copy));
+    EXPECT_EQ(isBelievedByUser(copy), 0);
     ASSERT_EQ(setxattr(copy.c_str(), linux_::entitlementsAttribute, bytes.data(), bytes.size(), 0), 0);
-    EXPECT_EQ(support::resultInChild([&] {
-                  if (!support::becomeOrdinaryUser()) return 9;
-                  auto signedByRoot = linux_::readEntitlements(copy);
-                  return signedByRoot && signedByRoot->has_value() ? 0 : 1;
-              }),
-              0);
+    EXPECT_EQ(isBelievedByUser(copy), 1);
 }
 
 // A stick or a FUSE file system that a user may mount claims any owner and any attribute.
 TEST_F(LinuxCodeSigning, FileSystemWithoutPrivilegesLendsNone) {
     if (geteuid() != 0) GTEST_SKIP() << "for root's daemon";
-    sign(manager);
-    if (IsSkipped()) return;
+    const char* directory = scratch.path().c_str();
     int result = support::resultInChild([&] {
-        const char* directory = scratch.path().c_str();
         if (unshare(CLONE_NEWNS) != 0 || mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-            mount(directory, directory, nullptr, MS_BIND, nullptr) != 0)
+            mount(directory, directory, nullptr, MS_BIND, nullptr) != 0 || !isBelieved(program) ||
+            mount("none", directory, nullptr, MS_REMOUNT | MS_BIND | MS_NOSUID, nullptr) != 0)
             return 9;
-        auto ordinary = linux_::readEntitlements(program);
-        if (mount("none", directory, nullptr, MS_REMOUNT | MS_BIND | MS_NOSUID, nullptr) != 0) return 9;
-        auto nosuid = linux_::readEntitlements(program);
-        return ordinary && ordinary->has_value() && nosuid && !nosuid->has_value() ? 0 : 1;
+        return int{isBelieved(program)};
     });
     if (result == 9) GTEST_SKIP() << "may not mount";
     EXPECT_EQ(result, 0);

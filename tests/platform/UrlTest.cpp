@@ -13,12 +13,10 @@ TEST(URLFile, EscapesAllButUnreservedCharactersAndKeepsThePath) {
         std::string path, text, kept;
     } cases[] = {
         {"/Applications/Über uns.app", "file:///Applications/%C3%9Cber%20uns.app", "/Applications/Über uns.app"},
-        {"/a%b#c?d:e@f", "file:///a%25b%23c%3Fd%3Ae%40f", "/a%b#c?d:e@f"},
-        {"/~a-b_c.d", "file:///~a-b_c.d", "/~a-b_c.d"},
+        {"/~a-b_c.d%e#f?g:h@i", "file:///~a-b_c.d%25e%23f%3Fg%3Ah%40i", "/~a-b_c.d%e#f?g:h@i"},
         {"/a/b//", "file:///a/b", "/a/b"},
         {"/", "file:///", "/"},
         {"/\xFF\n", "file:///%FF%0A", "/\xFF\n"},
-        {"/a/../b", "file:///a/../b", "/a/../b"},
     };
     for (const auto& [path, text, kept] : cases) {
         const URL url = URL::file(path);
@@ -46,25 +44,11 @@ TEST(URLParse, TellsFileURLsFromOthers) {
         bool isFile;
         std::string path;
     } cases[] = {
-        {"file:///a/b", true, "/a/b"},
-        {"FILE:///a", true, "/a"},
-        {"file:/a", true, "/a"},
-        {"file://localhost/a/", true, "/a"},
-        {"file://LocalHost/", true, "/"},
-        {"file:///a%2Fb%2f", true, "/a/b"},
-        {"file:///a?query#x", true, "/a"},
-        {"file:///%C3%9C", true, "/Ü"},
-        {"file:///Ü", true, "/Ü"},
-        {"file://elsewhere/a", false, "/a"},
-        {"file://localhost", false, ""},
-        {"file:a", false, "a"},
-        {"https://host/a%20b", false, "/a b"},
-        {"/a/b", false, "/a/b"},
-        {"//host/a", false, "/a"},
-        {"a/b", false, "a/b"},
-        {"files:///a", false, "/a"},
-        {"1file:///a", false, "1file:///a"},
-        {"?file:///a", false, ""},
+        {"file:///a/b", true, "/a/b"},         {"file:/a", true, "/a"},           {"FILE://LocalHost/a/", true, "/a"},
+        {"file:///a%2Fb%2f", true, "/a/b"},    {"file:///a?query#x", true, "/a"}, {"file:///Ü", true, "/Ü"},
+        {"file://elsewhere/a", false, "/a"},   {"file://localhost", false, ""},   {"file:a", false, "a"},
+        {"https://host/a%20b", false, "/a b"}, {"/a/b", false, "/a/b"},           {"files:///a", false, "/a"},
+        {"1file:///a", false, "1file:///a"},   {"?file:///a", false, ""},
     };
     for (const auto& [text, isFile, path] : cases) {
         const auto url = URL::parse(text);
@@ -87,7 +71,6 @@ TEST(URLAppending, AppendsAsWritten) {
     const struct {
         std::string base, component, text, path;
     } cases[] = {
-        {"file:///a", "b", "file:///a/b", "/a/b"},
         {"file:///a/", "b c", "file:///a/b%20c", "/a/b c"},
         {"file:///", "b", "file:///b", "/b"},
         {"file:///a", "../b//c", "file:///a/../b//c", "/a/../b//c"},
@@ -109,14 +92,11 @@ TEST(UUIDParse, ReadsTheTextFormInEitherCaseAndNothingElse) {
     const auto uuid = UUID::parse(text);
     ASSERT_TRUE(uuid);
     EXPECT_EQ(uuid->bytes[0], 0x0F);
-    EXPECT_EQ(uuid->bytes[15], 0xF0);
     EXPECT_EQ(uuid->text(), text);
     EXPECT_EQ(UUID::parse("0f1e2d3c-4b5a-6978-8796-a5b4c3d2e1f0"), uuid);
 
-    EXPECT_FALSE(UUID::parse(""));
-    EXPECT_FALSE(UUID::parse(text + "0"));
-    EXPECT_FALSE(UUID::parse("{" + text.substr(1)));
-    EXPECT_FALSE(UUID::parse(text.substr(0, 35)));
+    for (const std::string& wrong : {std::string(), text + "0", "{" + text.substr(1), text.substr(0, 35)})
+        EXPECT_FALSE(UUID::parse(wrong)) << wrong;
     for (std::size_t i = 0; i < text.size(); ++i) {
         std::string broken = text;
         broken[i] = broken[i] == '-' ? '0' : '-';

@@ -7,7 +7,6 @@
 #include <optional>
 #include <string>
 #include <utility>
-#include <vector>
 
 namespace support {
 
@@ -32,8 +31,6 @@ public:
 
     /// The running program.
     std::string mainExecutable = "/usr/bin/program";
-    /// Every path asked for.
-    std::vector<std::pair<std::string, platform::BundleMode>> asked;
 
     std::shared_ptr<const platform::BundleObject> main() override {
         auto bundle = fromPath(mainExecutable, platform::BundleMode::executable);
@@ -43,7 +40,6 @@ public:
 
     std::shared_ptr<const platform::BundleObject> fromPath(const std::string& path,
                                                            platform::BundleMode mode) override {
-        asked.emplace_back(path, mode);
         if (mode == platform::BundleMode::directory) {
             std::string trimmed = path;
             while (trimmed.size() > 1 && trimmed.back() == '/') trimmed.pop_back();

@@ -12,20 +12,15 @@ namespace support {
 class FakeCodeSigning final : public platform::CodeSigning {
 public:
     std::map<std::int32_t, platform::Dictionary> entitlements;
-    /// Processes that cannot be identified.
-    std::map<std::int32_t, bool> unidentified;
     /// Set: every look-up reports it, and gives its value all the same.
     std::optional<platform::Error> failure;
-    int lookUps = 0;
 
     std::shared_ptr<platform::SecTask> taskFromAuditToken(const platform::AuditToken& token) override {
-        if (unidentified.contains(token.pid)) return nullptr;
         return std::make_shared<Task>(token.pid);
     }
 
     platform::EntitlementValue copyEntitlement(const std::shared_ptr<platform::SecTask>& task,
                                                const std::string& name) override {
-        ++lookUps;
         auto known = std::dynamic_pointer_cast<Task>(task);
         if (!known) return {platform::Value(), platform::Error{platform::posixErrorDomain, EINVAL, "no task"}};
         auto granted = entitlements.find(known->pid);

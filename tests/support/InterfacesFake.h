@@ -6,7 +6,6 @@
 #include <set>
 #include <string>
 #include <utility>
-#include <vector>
 
 namespace support {
 
@@ -14,24 +13,16 @@ namespace support {
 /// name is refused until it is registered.
 class FakeInterfaces final : public platform::linux_::Interfaces {
 public:
-    /// Names that are never found, registered or not.
-    std::set<std::string> unfindable;
     /// Names that cannot be created, as if another thread had been faster.
     std::set<std::string> taken;
     /// Names under which another thread registers an interface just before the caller does.
     std::set<std::string> overtaken;
-    /// Every name looked up.
-    std::vector<std::string> looked;
 
     /// Registers a new interface and returns it.
     std::shared_ptr<platform::Interface> add(const std::string& name) {
         return platform::linux_::Interfaces::registerInterface(platform::linux_::Interfaces::create(name));
     }
 
-    std::shared_ptr<platform::Interface> find(const std::string& name) override {
-        looked.push_back(name);
-        return unfindable.contains(name) ? nullptr : platform::linux_::Interfaces::find(name);
-    }
     std::shared_ptr<platform::Interface> create(const std::string& name) override {
         return taken.contains(name) ? nullptr : platform::linux_::Interfaces::create(name);
     }

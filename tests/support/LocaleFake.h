@@ -14,9 +14,6 @@ namespace support {
 /// The languages that the test sets; "en" alone at first. Callable from any thread.
 class FakeLocale final : public platform::Locale {
 public:
-    /// While true, changes are told to nobody. Set it before threads ask.
-    bool losesNotices = false;
-
     /// Takes the list as it is. Observers hear of it when it differs from the last.
     void setLanguages(std::vector<std::string> languages) {
         {
@@ -24,7 +21,7 @@ public:
             if (languages == _languages) return;
             _languages = std::move(languages);
         }
-        if (!losesNotices) _observers->notifyAll();
+        _observers->notifyAll();
     }
 
     std::vector<std::string> languages() override {

@@ -14,10 +14,7 @@ namespace support {
 /// Notifications within the process. Callable from any thread.
 class FakeNotifications final : public platform::Notifications {
 public:
-    /// While true, posts reach nobody. Set it before threads post.
-    bool losesPosts = false;
-
-    /// Every name posted, lost ones too.
+    /// Every name posted.
     std::vector<std::string> posts() const {
         const std::lock_guard lock(_mutex);
         return _posts;
@@ -28,7 +25,7 @@ public:
             const std::lock_guard lock(_mutex);
             _posts.push_back(name);
         }
-        if (!losesPosts) _observers->notify(name);
+        _observers->notify(name);
     }
     std::unique_ptr<platform::NotificationObservation> observe(const std::string& name,
                                                                std::shared_ptr<platform::WorkQueue> queue,

@@ -4,7 +4,6 @@
 
 #include <map>
 #include <string>
-#include <vector>
 
 namespace support {
 
@@ -13,8 +12,6 @@ class FakePreferences final : public platform::Preferences {
 public:
     /// While true, `synchronize` fails.
     bool isUnreadable = false;
-    /// Every domain synchronized.
-    std::vector<std::string> synchronized;
 
     /// As another process would; an absent value removes.
     void store(const std::string& domain, const std::string& key, platform::Value value) {
@@ -23,7 +20,6 @@ public:
 
     void addDomain(const std::string& domain) override { _read.try_emplace(domain); }
     bool synchronize(const std::string& domain) override {
-        synchronized.push_back(domain);
         const auto found = _read.find(domain);
         if (found == _read.end() || isUnreadable) return false;
         found->second = _stored[domain];

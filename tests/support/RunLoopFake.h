@@ -4,7 +4,6 @@
 #include "tests/support/WorkQueueFake.h"
 
 #include <functional>
-#include <map>
 #include <memory>
 #include <utility>
 
@@ -39,11 +38,6 @@ public:
             State::raise(state);
         }
         return isTaken;
-    }
-    bool hasActiveSource(int signal) const {
-        for (const auto& weak : _states)
-            if (const auto state = weak.lock(); state && state->signal == signal && state->isActive) return true;
-        return false;
     }
 
     /// How often `run` was called.
