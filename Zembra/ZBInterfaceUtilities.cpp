@@ -49,9 +49,9 @@ platform::Error malformed(std::string_view quoted) {
 }
 
 Failure applyEntry(Interfaces& interfaces, InterfaceDescription& description, const std::string& operation,
-                   std::string_view entry, std::string_view specification) {
+                   std::string_view entry, std::string_view wholeText) {
     const auto parts = split(entry, ':');
-    if (parts.size() != 3) return malformed(specification);
+    if (parts.size() != 3) return malformed(wholeText);
     const std::string_view side = parts[0];
     const std::string_view type = parts[2];
     if (side != "request" && side != "reply") return malformed(side);
@@ -74,7 +74,7 @@ Failure applyEntry(Interfaces& interfaces, InterfaceDescription& description, co
     return std::nullopt;
 }
 
-/// How an element of a compound specification names an interface. One that is no text goes by its printed form.
+/// How an element of a compound's array names an interface. One that is no text goes by its printed form.
 std::string nameOf(const Value& element) {
     const auto text = element.string();
     return text ? std::string(*text) : element.description();
@@ -91,9 +91,9 @@ std::shared_ptr<Interface> interfaceLookup(Interfaces& interfaces, const std::st
     return nullptr;
 }
 
-std::shared_ptr<Interface> compoundInterface(Interfaces& interfaces, const Value& specification, Failure* error) {
-    if (const auto name = specification.string()) return interfaceLookup(interfaces, std::string(*name), error);
-    const auto names = specification.array();
+std::shared_ptr<Interface> compoundInterface(Interfaces& interfaces, const Value& nameOrNames, Failure* error) {
+    if (const auto name = nameOrNames.string()) return interfaceLookup(interfaces, std::string(*name), error);
+    const auto names = nameOrNames.array();
     if (!names) return nullptr;
 
     std::string compoundName = "__XX_COMPOUND";
@@ -113,10 +113,10 @@ std::shared_ptr<Interface> compoundInterface(Interfaces& interfaces, const Value
 }
 
 Failure interfaceClassSpecification(Interfaces& interfaces, InterfaceDescription& description,
-                                    const std::string& operation, std::string_view specification) {
-    if (specification.empty()) return std::nullopt;
-    for (const std::string_view entry : split(specification, ',')) {
-        if (auto error = applyEntry(interfaces, description, operation, entry, specification)) return error;
+                                    const std::string& operation, std::string_view classes) {
+    if (classes.empty()) return std::nullopt;
+    for (const std::string_view entry : split(classes, ',')) {
+        if (auto error = applyEntry(interfaces, description, operation, entry, classes)) return error;
     }
     return std::nullopt;
 }

@@ -18,15 +18,15 @@ std::shared_ptr<platform::Interface> interfaceLookup(platform::Interfaces& inter
 
 /// One interface for a name, or for all names of an array, where the same names in the same order give every caller the
 /// same interface. Null, with `error` (unless null) set, when one of them cannot be found; null without an error when
-/// `specification` is neither.
+/// `nameOrNames` is neither.
 std::shared_ptr<platform::Interface> compoundInterface(platform::Interfaces& interfaces,
-                                                       const platform::Value& specification, platform::Failure* error);
+                                                       const platform::Value& nameOrNames, platform::Failure* error);
 
 /// Applies a text such as "request:0:{A+B},reply:1:P" to one operation of `description`: argument 0 of the request may
 /// be of the classes A and B, and argument 1 of the reply is an object with the interface P. Entries take effect one by
 /// one; the first faulty one ends it with an error.
 platform::Failure interfaceClassSpecification(platform::Interfaces& interfaces,
                                               platform::InterfaceDescription& description, const std::string& operation,
-                                              std::string_view specification);
+                                              std::string_view classes);
 
 } // namespace zembra

@@ -4,6 +4,7 @@
 #include "tools/zbctl/Json.h"
 
 #include <algorithm>
+#include <array>
 #include <iostream>
 
 namespace zbctl {
@@ -90,6 +91,32 @@ void print(std::ostream& out, const Value& value, std::size_t indent) {
     }
 }
 
+using TableLine = std::array<std::string, 5>;
+using TableWidths = std::array<std::size_t, 4>; // nothing follows the last column
+
+/// In characters.
+std::size_t width(const std::string& text) {
+    return static_cast<std::size_t>(std::count_if(
+        text.begin(), text.end(), [](char byte) { return (static_cast<unsigned char>(byte) & 0xc0U) != 0x80U; }));
+}
+
+std::string electionName(const Dictionary& form) {
+    const auto annotations = form.dictionary(zembra::formKey::annotations);
+    const Value election = annotations ? (*annotations)[zembra::annotationKey::election] : Value();
+    if (!election || election == Value(electionNone)) return "-";
+    if (election == Value(electionUse)) return "use";
+    return election == Value(electionIgnore) ? "ignore" : printable(line(election));
+}
+
+TableLine tableLine(const Dictionary& form) {
+    const auto text = [&](std::string_view key) { return printable(form.string(key).value_or("-")); };
+    std::string path = text(zembra::formKey::path);
+    if (form.contains(zembra::formKey::overriding)) path += "  (replaces " + text(zembra::formKey::overriding) + ')';
+    if (form.contains(zembra::formKey::overrider)) path += "  (replaced by " + text(zembra::formKey::overrider) + ')';
+    return {text(zembra::formKey::identifier), text(zembra::formKey::version), text(zembra::formKey::uuid),
+            electionName(form), path};
+}
+
 } // namespace
 
 std::string printable(std::string_view text) {
@@ -125,6 +152,31 @@ void printForm(std::ostream& out, const Dictionary& form) {
     if (const auto version = form.string(zembra::formKey::version)) out << ' ' << printable(*version);
     out << '\n';
     print(out, form, indentation);
+}
+
+void printPlugIns(std::ostream& out, const Array& forms) {
+    if (forms.empty()) {
+        out << "no plug-in matches\n";
+        return;
+    }
+    std::vector<TableLine> lines{{"IDENTIFIER", "VERSION", "UUID", "ELECTION", "PATH"}};
+    for (const Value& form : forms) lines.push_back(tableLine(form.dictionary().value_or(Dictionary())));
+    TableWidths widths{};
+    for (const auto& line : lines) {
+        for (std::size_t i = 0; i < widths.size(); ++i) widths[i] = std::max(widths[i], width(line[i]));
+    }
+    for (const auto& line : lines) {
+        for (std::size_t i = 0; i < widths.size(); ++i) {
+            out << line[i] << std::string(widths[i] - width(line[i]) + indentation, ' ');
+        }
+        out << line.back() << '\n';
+    }
+}
+
+ExitStatus finish(bool json, const platform::ReplyOrError& answer) {
+    const ExitStatus status = report(answer);
+    if (status == ExitStatus::success && json) printJson(std::cout, std::get<Dictionary>(answer));
+    return status;
 }
 
 bool flushOutput() {

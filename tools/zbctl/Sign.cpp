@@ -1,6 +1,7 @@
 #include "platform/linux/Entitlements.h"
 #include "platform/linux/Files.h"
-#include "platform/linux/Utf8.h"
+#include "tools/zbctl/Input.h"
+#include "tools/zbctl/Options.h"
 #include "tools/zbctl/Output.h"
 #include "tools/zbctl/Verbs.h"
 
@@ -12,9 +13,16 @@ using platform::Dictionary;
 using platform::Failure;
 using platform::MutableDictionary;
 using platform::Result;
-using platform::Value;
 
 namespace {
+
+struct Signing {
+    std::string file;
+    std::optional<std::string> entitlements; // a property-list file
+    std::vector<std::string> settings;       // KEY or KEY=VALUE
+    bool show = false;
+    bool remove = false;
+};
 
 ExitStatus finish(const std::string& file, const Failure& failure) {
     if (!failure) return ExitStatus::success;
@@ -22,20 +30,7 @@ ExitStatus finish(const std::string& file, const Failure& failure) {
     return ExitStatus::failure;
 }
 
-/// An entitlement without a name, or one that would be written as another text than was given, helps nobody.
-bool isSetting(const std::string& setting) {
-    return !setting.empty() && setting.front() != '=' && !platform::linux_::firstBadByte(setting);
-}
-
-/// "KEY" sets true, "KEY=true" and "KEY=false" booleans, "KEY=TEXT" a string.
-void apply(const std::string& setting, MutableDictionary& entitlements) {
-    const std::size_t separator = setting.find('=');
-    const std::string text = separator == std::string::npos ? "true" : setting.substr(separator + 1);
-    const Value value = text == "true" || text == "false" ? Value(text == "true") : Value(text);
-    entitlements.set(setting.substr(0, separator), value);
-}
-
-Result<MutableDictionary> entitlementsOf(const Signing& signing) {
+Result<MutableDictionary> entitlementsOf(const Signing& signing, const std::vector<Setting>& settings) {
     MutableDictionary entitlements;
     if (signing.entitlements) {
         platform::linux_::Files files(platform::linux_::Root::ofProcess());
@@ -48,34 +43,50 @@ Result<MutableDictionary> entitlementsOf(const Signing& signing) {
             return platform::Error{platform::propertyListErrorDomain, 0, *signing.entitlements + ": not a dictionary"};
         entitlements.merge(*dictionary);
     }
-    for (const auto& setting : signing.settings) apply(setting, entitlements);
+    for (const auto& setting : settings) entitlements.set(setting.key, setting.value);
     return entitlements;
 }
 
-ExitStatus show(const Common& common, const std::string& file) {
+ExitStatus show(const Invocation& invocation, const std::string& file) {
     const auto entitlements = platform::linux_::readEntitlements(file);
     if (!entitlements) return finish(file, entitlements.error());
     const Dictionary shown = entitlements->value_or(Dictionary());
-    if (common.json)
+    if (invocation.json)
         printJson(std::cout, shown);
     else
         printTree(std::cout, shown);
     return ExitStatus::success;
 }
 
-} // namespace
-
-ExitStatus sign(const Common& common, const Signing& signing) {
-    if (signing.show) return show(common, signing.file);
+ExitStatus sign(const Invocation& invocation, const Signing& signing) {
+    if (signing.show) return show(invocation, signing.file);
     if (signing.remove) return finish(signing.file, platform::linux_::removeEntitlements(signing.file));
-    for (const auto& setting : signing.settings) {
-        if (isSetting(setting)) continue;
-        complain('"' + setting + "\" is not KEY or KEY=VALUE in UTF-8");
-        return ExitStatus::usage;
+    std::vector<Setting> settings;
+    for (const auto& text : signing.settings) {
+        auto setting = settingOf(text);
+        if (!setting) return ExitStatus::usage;
+        settings.push_back(*std::move(setting));
     }
-    const auto entitlements = entitlementsOf(signing);
+    const auto entitlements = entitlementsOf(signing, settings);
     if (!entitlements) return finish(signing.file, entitlements.error());
     return finish(signing.file, platform::linux_::writeEntitlements(signing.file, *entitlements));
+}
+
+} // namespace
+
+void addSign(CLI::App& app, Invocation& invocation) {
+    auto* verb = app.add_subcommand("sign", "Write the entitlements of a program");
+    const auto signing = std::make_shared<Signing>();
+    verb->add_option("FILE", signing->file, "The program, or a bundle's executable")->required();
+    auto* what = verb->add_option_group("what");
+    auto* file = addText(what, "--entitlements", signing->entitlements, "A property list with all of them");
+    auto* setting = what->add_option("-e", signing->settings, "One entitlement: KEY, KEY=true, KEY=false or KEY=TEXT")
+                        ->type_name("KEY[=VALUE]")
+                        ->allow_extra_args(false);
+    auto* show = what->add_flag("--show", signing->show, "Print them")->excludes(file)->excludes(setting);
+    what->add_flag("--remove", signing->remove, "Remove them all")->excludes(file)->excludes(setting)->excludes(show);
+    what->require_option(1, 0);
+    verb->callback([=, &invocation] { invocation.status = sign(invocation, *signing); });
 }
 
 } // namespace zbctl

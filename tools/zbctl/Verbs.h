@@ -2,47 +2,38 @@
 
 #include "tools/zbctl/Session.h"
 
-#include <cstdint>
+#include <CLI/App.hpp>
 #include <optional>
 #include <string>
 #include <vector>
 
-/// What zbctl does, a function per verb. Each prints its result on standard output and its troubles on standard error.
+/// What zbctl does. Each verb prints its result on standard output and its troubles on standard error.
 namespace zbctl {
 
-struct Common {
+/// One run of the program: what stands before and behind the verb's own words, and how it ends.
+struct Invocation {
     std::optional<std::string> service;
     bool json = false;
+    std::vector<std::string> command; // behind "--"; of "hold" and "ready" only
+    ExitStatus status = ExitStatus::success;
 };
 
-/// Relative paths start at the working directory.
-enum class Registration { add, remove };
-ExitStatus changeRegistration(const Common& common, Registration registration, const std::vector<std::string>& paths);
+// Each adds its verbs to the command line. They run while it is parsed, at most one of them, and leave their status in
+// `invocation`, which must outlive `app`.
 
-ExitStatus bulk(const Common& common, std::uint64_t flags);
-
-/// One of them is given.
-struct Location {
-    std::optional<std::string> uuid;
-    std::optional<std::string> url;
-    std::optional<std::string> path;
-};
-ExitStatus find(const Common& common, const Location& location);
-
-/// Sends what the file ("-": standard input) holds, as it stands: a property list of either encoding, or JSON.
-/// Prints the reply, also one that reports an error.
-ExitStatus raw(const Common& common, const std::string& file);
-
-struct Signing {
-    std::string file;
-    std::optional<std::string> entitlements; // a property-list file
-    std::vector<std::string> settings;       // KEY or KEY=VALUE
-    bool show = false;
-    bool remove = false;
-};
-ExitStatus sign(const Common& common, const Signing& signing);
-
-/// A line per notification. Ends after `count` of them, or never.
-ExitStatus watch(const std::string& name, std::optional<std::uint64_t> count);
+/// "add", "remove" and "bulk".
+void addRegistration(CLI::App& app, Invocation& invocation);
+void addFind(CLI::App& app, Invocation& invocation);
+void addMatch(CLI::App& app, Invocation& invocation);
+/// "annotate", "elect" and "bulk-annotate".
+void addAnnotations(CLI::App& app, Invocation& invocation);
+/// "ready" and "access".
+void addActivation(CLI::App& app, Invocation& invocation);
+/// "hold" and "release".
+void addHolds(CLI::App& app, Invocation& invocation);
+void addWatch(CLI::App& app, Invocation& invocation);
+void addInspect(CLI::App& app, Invocation& invocation);
+void addSign(CLI::App& app, Invocation& invocation);
+void addRaw(CLI::App& app, Invocation& invocation);
 
 } // namespace zbctl

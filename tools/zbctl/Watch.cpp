@@ -1,5 +1,7 @@
+#include "Zembra/ZBProtocol.h"
 #include "platform/linux/Notifications.h"
 #include "platform/linux/UserDirectory.h"
+#include "tools/zbctl/Options.h"
 #include "tools/zbctl/Output.h"
 #include "tools/zbctl/Verbs.h"
 
@@ -19,8 +21,7 @@ struct Arrivals {
     std::uint64_t count = 0;
 };
 
-} // namespace
-
+/// A line per notification. Ends after `count` of them, or never.
 ExitStatus watch(const std::string& name, std::optional<std::uint64_t> count) {
     if (platform::linux_::pathComponentError(name) != 0) {
         complain('"' + name + "\" is not the name of a notification");
@@ -46,6 +47,17 @@ ExitStatus watch(const std::string& name, std::optional<std::uint64_t> count) {
         if (!std::cout) return ExitStatus::failure;
     }
     return ExitStatus::success;
+}
+
+} // namespace
+
+void addWatch(CLI::App& app, Invocation& invocation) {
+    auto* verb = app.add_subcommand("watch", "Print a line for each notification");
+    const auto name = std::make_shared<std::string>(zembra::annotationChangeNotification);
+    const auto count = std::make_shared<std::optional<std::uint64_t>>();
+    verb->add_option("NAME", *name, "The notification")->capture_default_str();
+    addNumber(verb, "--count", [=](std::uint64_t number) { *count = number; }, "End after so many");
+    verb->callback([=, &invocation] { invocation.status = watch(*name, *count); });
 }
 
 } // namespace zbctl
