@@ -10,7 +10,6 @@
 namespace zbd {
 
 namespace log = zembra::log;
-using platform::Dictionary;
 
 namespace {
 
@@ -46,8 +45,8 @@ Outcome mustMatchRules(const Selection& selection, const ZBDPlugInRef& candidate
 }
 
 Outcome mustNotBeExcluded(const Selection& selection, const ZBDPlugInRef& candidate) {
-    for (const Dictionary& exclusion : selection.exclusions) {
-        if (!candidate->match(exclusion)) continue;
+    for (const MatchRules& exclusion : selection.exclusions) {
+        if (candidate->mismatch(exclusion)) continue;
         log::ops().info("client %d plugin %{public}@ globally excluded", selection.client.pid(), candidate->uuid());
         return Rejection{"excluded by the user"};
     }
@@ -85,10 +84,10 @@ std::optional<Rejection> rejectionOf(const Selection& selection, const ZBDPlugIn
     return std::nullopt;
 }
 
-std::vector<Dictionary> readExclusions(const platform::Value& stored) {
-    std::vector<Dictionary> exclusions;
+std::vector<MatchRules> readExclusions(const platform::Value& stored, platform::TypeConformance& types) {
+    std::vector<MatchRules> exclusions;
     for (const platform::Value& element : stored.array().value_or(platform::Array())) {
-        if (const auto rules = element.dictionary()) exclusions.push_back(*rules);
+        if (const auto rules = element.dictionary()) exclusions.emplace_back(rules, types);
     }
     return exclusions;
 }

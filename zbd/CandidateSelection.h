@@ -20,8 +20,8 @@ struct Selection {
     ZBDServer& server;
     const ZBDQmxClient& client;
     std::uint64_t flags = 0; // DiscoveryFlags
-    std::optional<platform::Dictionary> rules;
-    std::vector<platform::Dictionary> exclusions; // the user's, as read for this request
+    MatchRules rules;
+    std::vector<MatchRules> exclusions; // the user's, as read for this request
 };
 
 /// Why a candidate is dropped.
@@ -45,6 +45,6 @@ std::span<const SelectionTest> selectionTests();
 std::optional<Rejection> rejectionOf(const Selection& selection, const ZBDPlugInRef& candidate);
 
 /// The dictionaries in the user's exclusions; whatever else is stored there is ignored.
-std::vector<platform::Dictionary> readExclusions(const platform::Value& stored);
+std::vector<MatchRules> readExclusions(const platform::Value& stored, platform::TypeConformance& types);
 
 } // namespace zbd

@@ -26,7 +26,7 @@ namespace {
 constexpr std::size_t maximumPath = 1024; // bytes of a resolved path with its NUL; longer ones count as unresolved
 
 /// Registering a path takes some tenths of a millisecond, and handing over to the next slice a hundredth of that.
-constexpr std::size_t pathsPerSlice = 16;
+constexpr std::size_t pathsPerTurn = 16;
 
 struct RequestType {
     std::string_view name;
@@ -91,6 +91,7 @@ void Transaction::dispatch() {
 }
 
 void Transaction::done() {
+    saveChanges();
     if (platform::trace::requestOutputEnabled()) {
         platform::trace::requestOutput(_client->pid(), Value(_reply.content).description().c_str());
     }
@@ -139,16 +140,26 @@ bool Transaction::walkPaths(const Array& paths, std::size_t first, std::size_t e
 void Transaction::processPaths(PathCallback callback) {
     const auto paths = _request.array(key::paths);
     if (!paths) return fail(code::malformed, "invalid request format");
-    processSlice(*paths, 0, std::move(callback));
+    inTurns(
+        paths->size(), pathsPerTurn,
+        [this, paths, callback = std::move(callback)](std::size_t first, std::size_t end) {
+            return walkPaths(*paths, first, end, callback);
+        },
+        [this] { done(); });
 }
 
-void Transaction::processSlice(const Array& paths, std::size_t first, PathCallback callback) {
-    const std::size_t end = std::min(first + pathsPerSlice, paths.size());
-    if (!walkPaths(paths, first, end, callback)) return;
-    if (end == paths.size()) return done();
-    _client->goOnLater([self = shared_from_this(), paths, end, callback = std::move(callback)] {
-        self->processSlice(paths, end, callback);
-    });
+void Transaction::inTurns(std::size_t count, std::size_t perTurn, Turn turn, std::function<void()> then) {
+    goOnInTurns(0, count, perTurn, std::move(turn), std::move(then));
+}
+
+void Transaction::goOnInTurns(std::size_t first, std::size_t count, std::size_t perTurn, Turn turn,
+                              std::function<void()> then) {
+    if (!_client->acceptWork()) return; // nobody is left to answer
+    const std::size_t end = std::min(first + perTurn, count);
+    if (!turn(first, end)) return;
+    if (end == count) return then();
+    _client->goOnLater([self = shared_from_this(), end, count, perTurn, turn = std::move(turn),
+                        then = std::move(then)] { self->goOnInTurns(end, count, perTurn, turn, then); });
 }
 
 /// The path as the client's user may see it; none for what does not exist, and for what that user cannot reach.
@@ -161,55 +172,62 @@ std::optional<std::string> Transaction::realPath(const std::string& path) const 
 
 ZBDPlugInRef Transaction::plugInAt(const platform::URL& url) {
     if (auto plugIn = server()->findPlugInAtPath(url)) return plugIn;
-    const auto path = url.isFile() ? realPath(url.path()) : std::nullopt;
+    const auto path = url.isFile() && url.path().starts_with('/') ? realPath(url.path()) : std::nullopt;
     return path && *path != url.path() ? server()->findPlugInAtPath(platform::URL::file(*path)) : nullptr;
 }
 
 bool Transaction::processUuidList(const PlugInCallback& callback) {
-    const auto uuids = _request.array(key::uuids);
-    if (!uuids) {
-        fail(code::malformed, "invalid request format (uuid)");
-        return false;
-    }
-    std::optional<Array> paths;
-    if (const Value value = _request[key::paths]) {
-        paths = value.array();
-        if (!paths) {
-            log::traffic().notice("Paths present but not an array (ignoring values)");
-        } else if (paths->size() != uuids->size()) {
-            log::traffic().notice("Paths present but has different count than UUIDs (ignoring)");
-            paths.reset();
-        }
-    }
-    for (std::size_t i = 0; i < uuids->size(); ++i) {
-        const Value element = (*uuids)[i];
-        if (element.kind() != platform::Kind::uuid) {
-            fail(code::malformed, "invalid request (bad uuid array)");
-            return false;
-        }
-        const auto uuid = element.uuid();
-        if (!uuid) {
-            fail(code::malformed, "invalid request (uuid allocation failure)");
-            return false;
-        }
-        const auto plugIn = plugInOfList(*uuid, paths ? &*paths : nullptr, i);
-        if (!plugIn) {
-            fail(code::malformed, "no such plugin (uuid not found)");
-            return false;
-        }
-        if (!callback(plugIn)) return false;
+    const auto list = uuidList();
+    if (!list) return false;
+    for (std::size_t i = 0; i < list->uuids.size(); ++i) {
+        const auto plugIn = plugInOfList(*list, i);
+        if (!plugIn || !callback(plugIn)) return false;
     }
     return true;
 }
 
-ZBDPlugInRef Transaction::plugInOfList(const UUID& uuid, const Array* paths, std::size_t index) {
-    if (auto plugIn = server()->findPlugIn(uuid)) return plugIn;
-    if (paths == nullptr) return nullptr;
-    log::traffic().info("Failed to find plugin by %{uuid_t}.16P", uuid);
-    const auto path = (*paths)[index].string();
-    if (!path) return nullptr;
-    log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", uuid, *path);
-    return plugInAt(platform::URL::file(*path));
+/// None when it has answered that there is no such list.
+std::optional<Transaction::UuidList> Transaction::uuidList() {
+    const auto uuids = _request.array(key::uuids);
+    if (!uuids) {
+        fail(code::malformed, "invalid request format (uuid)");
+        return std::nullopt;
+    }
+    UuidList list{*uuids, std::nullopt};
+    if (const Value value = _request[key::paths]) {
+        list.paths = value.array();
+        if (!list.paths) {
+            log::traffic().notice("Paths present but not an array (ignoring values)");
+        } else if (list.paths->size() != uuids->size()) {
+            log::traffic().notice("Paths present but has different count than UUIDs (ignoring)");
+            list.paths.reset();
+        }
+    }
+    return list;
+}
+
+/// Null when it has answered that there is no such plug-in.
+ZBDPlugInRef Transaction::plugInOfList(const UuidList& list, std::size_t index) {
+    const Value& element = list.uuids[index];
+    if (element.kind() != platform::Kind::uuid) {
+        fail(code::malformed, "invalid request (bad uuid array)");
+        return nullptr;
+    }
+    const auto uuid = element.uuid();
+    if (!uuid) {
+        fail(code::malformed, "invalid request (uuid allocation failure)");
+        return nullptr;
+    }
+    auto plugIn = server()->findPlugIn(*uuid);
+    if (!plugIn && list.paths) {
+        log::traffic().info("Failed to find plugin by %{uuid_t}.16P", *uuid);
+        if (const auto path = (*list.paths)[index].string()) {
+            log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", *uuid, *path);
+            plugIn = plugInAt(platform::URL::file(*path));
+        }
+    }
+    if (!plugIn) fail(code::malformed, "no such plugin (uuid not found)");
+    return plugIn;
 }
 
 } // namespace zbd

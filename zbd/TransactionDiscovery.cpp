@@ -66,15 +66,15 @@ void logResults(const std::vector<MutableDictionary>& forms) {
 
 /// A host that carries a plug-in itself does not see other copies of it.
 void preferBundleRelative(Candidates& candidates, std::string_view hostPath) {
-    std::unordered_map<std::string_view, ZBDPlugInRef> preferred;
+    std::unordered_map<std::string, ZBDPlugInRef> preferred;
     for (const auto& candidate : candidates) {
         const Value container = candidate->containingPath();
-        if (container && hostPath.starts_with(textOf(container)))
-            preferred[textOf(candidate->identifier())] = candidate;
+        if (!container || !hostPath.starts_with(textOf(container))) continue;
+        preferred[std::string(textOf(candidate->identifier()))] = candidate;
     }
     if (preferred.empty()) return;
     std::erase_if(candidates, [&](const ZBDPlugInRef& candidate) {
-        const auto found = preferred.find(textOf(candidate->identifier()));
+        const auto found = preferred.find(std::string(textOf(candidate->identifier())));
         if (found == preferred.end() || found->second == candidate) return false;
         log::ops().info("Ignoring %{public}@ @ '%{public}@' in favor of bundle-relative '%{public}@'",
                         found->second->uuid(), candidate->path(), found->second->path());
@@ -119,7 +119,9 @@ void Transaction::matchPlugIns() {
         return fail(code::notPermitted, "unauthorized discovery flag (ZBDiscoverAll)");
     }
 
-    const Selection selection{*server(), *_client, flags, rules, readExclusions(server()->userPrefs().exclusions())};
+    platform::TypeConformance& types = server()->platform().typeConformance;
+    const Selection selection{*server(), *_client, flags, MatchRules(rules, types),
+                              readExclusions(server()->userPrefs().exclusions(), types)};
     Candidates candidates = sortedByUUID(server()->findPlugIns(rules));
     platform::trace::discoverRaw(static_cast<unsigned>(candidates.size()));
     logCandidates(candidates);

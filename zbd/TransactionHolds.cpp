@@ -14,6 +14,12 @@ using platform::MutableArray;
 using platform::URL;
 using platform::Value;
 
+namespace {
+
+constexpr std::size_t tokensPerTurn = 64; // each posts a notification
+
+} // namespace
+
 void Transaction::lockDownPlugIns() {
     if (const auto tokens = _request.array(key::uuids)) return releaseHolds(*tokens);
 
@@ -48,7 +54,8 @@ void Transaction::lockDownPlugIns() {
     }
     std::vector<platform::PlugInProxyRef> proxies;
     for (const auto& plugIn : plugIns) {
-        if (auto proxy = plugIn->getProxy()) proxies.push_back(std::move(proxy)); // one that is gone has no instances
+        // The instances of one that is gone by now are ended because it was uninstalled.
+        if (auto proxy = plugIn->getProxy()) proxies.push_back(std::move(proxy));
     }
     server()->terminatePlugIns(proxies, [self = shared_from_this(), token = hold->uuid()] {
         log::ops().info("forced termination complete; hold request granted uuid:%{public}@", token);
@@ -57,13 +64,23 @@ void Transaction::lockDownPlugIns() {
 }
 
 void Transaction::releaseHolds(const Array& tokens) {
-    for (const Value& element : tokens) {
-        if (const auto token = element.uuid()) server()->unholdToken(*token);
-    }
-    done();
+    inTurns(
+        tokens.size(), tokensPerTurn,
+        [this, tokens](std::size_t first, std::size_t end) {
+            for (std::size_t i = first; i < end; ++i) {
+                if (const auto token = tokens[i].uuid()) server()->unholdToken(*token);
+            }
+            return true;
+        },
+        [this] { done(); });
 }
 
 bool Transaction::collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugInRef>& plugIns) {
+    // Each once, however often it is named: checking and terminating cost more than naming.
+    ZBDPlugInSet known;
+    const auto collect = [&](const ZBDPlugInRef& plugIn) {
+        if (known.insert(plugIn).second) plugIns.push_back(plugIn);
+    };
     return marshalPaths([&](const std::string& path, bool resolved) {
         if (!resolved) {
             fail(code::badPath, platform::format("invalid path: %@", path));
@@ -71,15 +88,15 @@ bool Transaction::collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugI
         }
         if ((flags & zembra::ZBLockPlugInPaths) == 0) {
             const auto within = server()->plugInsWithinApplication(URL::file(path));
-            if (within) plugIns.insert(plugIns.end(), within->begin(), within->end());
+            for (const ZBDPlugInRef& plugIn : within.value_or(std::vector<ZBDPlugInRef>())) collect(plugIn);
             return true;
         }
-        auto plugIn = server()->findPlugInAtPath(URL::file(path));
+        const auto plugIn = server()->findPlugInAtPath(URL::file(path));
         if (!plugIn) {
             fail(code::badPath, platform::format("no plug-in at path:%@", path));
             return false;
         }
-        plugIns.push_back(std::move(plugIn));
+        collect(plugIn);
         return true;
     });
 }

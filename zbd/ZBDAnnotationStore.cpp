@@ -66,23 +66,38 @@ std::optional<Dictionary> ZBDAnnotationStore::annotationForPlugIn(const ZBDPlugI
 }
 
 void ZBDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation, const ZBDPlugIn& plugIn) {
-    const std::string key = plugIn.annotationKey();
-    if (annotation) {
-        // A new dictionary each time: requests may still be reading the stored one.
-        auto merged = MutableDictionary::copyOf(annotationForIdentifier(key).value_or(Dictionary()));
-        merged.merge(*annotation);
-        if (const auto alone = encodedDatabase({{key, merged}}); !alone) {
-            log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, alone.error());
-            return;
+    // The change does not outlive this call, so it needs no share in the record.
+    const AnnotationChange change{annotation, {std::shared_ptr<void>(), &plugIn}};
+    setAnnotations({&change, 1});
+}
+
+void ZBDAnnotationStore::setAnnotations(std::span<const AnnotationChange> changes) {
+    const auto before = MutableDictionary::copyOf(_annotations);
+    for (const AnnotationChange& change : changes) apply(change);
+    const auto bytes = encodedDatabase(_annotations);
+    if (!bytes) {
+        _annotations = before;
+        if (changes.size() == 1) {
+            log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, bytes.error());
+        } else {
+            // One of them cannot be saved; the others can.
+            for (const AnnotationChange& change : changes) setAnnotations({&change, 1});
         }
-        _annotations.set(key, merged);
-    } else {
-        _annotations.remove(key);
+        return;
     }
     Error error;
-    if (!saveDb(error)) {
+    if (!write(*bytes, error)) {
         log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, error);
     }
+}
+
+void ZBDAnnotationStore::apply(const AnnotationChange& change) {
+    const std::string key = change.plugIn->annotationKey();
+    if (!change.annotation) return _annotations.remove(key);
+    // A new dictionary each time: requests may still be reading the stored one.
+    auto merged = MutableDictionary::copyOf(annotationForIdentifier(key).value_or(Dictionary()));
+    merged.merge(*change.annotation);
+    _annotations.set(key, merged);
 }
 
 bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
@@ -109,17 +124,20 @@ bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
 }
 
 bool ZBDAnnotationStore::saveDb(Error& error) {
-    const auto save = [&]() -> platform::Failure {
-        const auto bytes = encodedDatabase(_annotations);
-        if (!bytes) return bytes.error();
-        if (_isFileDamaged) {
-            auto failure = _platform.files.setAside(_annotationsURL.path(), damagedSuffix);
-            if (failure && failure->code != platform::fileReadNoSuchFileCode) return failure;
-            _isFileDamaged = false;
-        }
-        return _platform.files.writeAtomically(_annotationsURL.path(), *bytes);
-    };
-    auto failure = save();
+    const auto bytes = encodedDatabase(_annotations);
+    if (bytes) return write(*bytes, error);
+    error = bytes.error();
+    return false;
+}
+
+bool ZBDAnnotationStore::write(const std::string& bytes, Error& error) {
+    platform::Failure failure;
+    if (_isFileDamaged) {
+        failure = _platform.files.setAside(_annotationsURL.path(), damagedSuffix);
+        if (failure && failure->code == platform::fileReadNoSuchFileCode) failure.reset();
+        _isFileDamaged = failure.has_value();
+    }
+    if (!failure) failure = _platform.files.writeAtomically(_annotationsURL.path(), bytes);
     if (!failure) return true;
     error = std::move(*failure);
     return false;

@@ -7,12 +7,19 @@
 #include <cstddef>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
 namespace zbd {
 
 class ZBDPlugIn;
+
+/// What is to become of one plug-in's annotation: see `setAnnotation`.
+struct AnnotationChange {
+    std::optional<platform::Dictionary> annotation;
+    std::shared_ptr<const ZBDPlugIn> plugIn;
+};
 
 /// Keeps the user's annotations of plug-ins in one small property-list file that survives restarts.
 /// Takes no lock: the database calls it on its own queue, or while no change can happen.
@@ -34,8 +41,11 @@ public:
 
     /// Merges `annotation` into what is stored for the plug-in, or removes that when it is none; then saves. A failure
     /// to save is logged; the change stays in memory and goes out with the next one. What no file can hold (a UUID,
-    /// control characters, nesting without end) is logged and not taken, for no change could be saved after it.
+    /// control characters, nesting without end, more than `maximumFileSize` in all) is logged and not taken, for no
+    /// change could be saved after it.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
+    /// The same for many, in their order, saved together.
+    void setAnnotations(std::span<const AnnotationChange> changes);
 
     /// False, with `error` set, when no table could be loaded; the present table then is as it was.
     bool loadDb(const platform::URL& url, platform::Error& error);
@@ -51,6 +61,8 @@ public:
     static std::optional<platform::URL> containerURL(platform::Platform& platform);
 
 private:
+    void apply(const AnnotationChange& change);
+    bool write(const std::string& bytes, platform::Error& error);
     ZBDAnnotationStore(platform::Platform& platform, platform::URL url);
 
     platform::Platform& _platform;

@@ -4,7 +4,7 @@
 #include "Zembra/ZBPlugInCore.h"
 #include "platform/Platform.h"
 #include "platform/Registry.h"
-#include "zbd/RuleMismatch.h"
+#include "zbd/MatchRules.h"
 
 #include <memory>
 #include <mutex>
@@ -94,7 +94,7 @@ public:
     /// Whether the plug-in fulfils every rule; it does when there are none.
     bool match(const std::optional<platform::Dictionary>& rules) const;
     /// The first rule that it does not fulfil.
-    std::optional<RuleMismatch> mismatch(const std::optional<platform::Dictionary>& rules) const;
+    std::optional<RuleMismatch> mismatch(const MatchRules& rules) const;
     bool matchKey(std::string_view key, const platform::Value& pattern) const;
     /// `patterns` is a string or an array of strings, of which one has to fit; nothing fits anything else.
     bool matchValue(std::string_view value, const platform::Value& patterns) const;
@@ -124,8 +124,7 @@ private:
     platform::Value valueForRule(std::string_view key) const;
     std::string userElection() const;
     const char* sandboxProfile() const;
-    bool matchElements(const platform::Array& elements, const platform::Value& patterns) const;
-    bool accepts(std::string_view key, const platform::Value& value, const platform::Value& pattern) const;
+    bool accepts(const MatchRule& rule, const platform::Value& value) const;
     void setLocalized(zembra::AtomicField<platform::Value>& field, platform::Value value);
 
     platform::Platform& _platform;

@@ -10,7 +10,6 @@ namespace zbd {
 
 namespace log = zembra::log;
 namespace ruleKey = zembra::ruleKey;
-using platform::Array;
 using platform::Dictionary;
 using platform::Value;
 
@@ -19,26 +18,22 @@ namespace {
 /// Bits of an election that rules do not see.
 constexpr std::int64_t unseenElectionBits = 0xFF00;
 
-/// From this many comparisons on, an array of values is looked up among the patterns instead.
-constexpr std::size_t manyComparisons = 1024;
-
 } // namespace
 
-bool ZBDPlugIn::match(const std::optional<Dictionary>& rules) const { return !mismatch(rules); }
+bool ZBDPlugIn::match(const std::optional<Dictionary>& rules) const {
+    return !mismatch(MatchRules(rules, _platform.typeConformance));
+}
 
-std::optional<RuleMismatch> ZBDPlugIn::mismatch(const std::optional<Dictionary>& rules) const {
-    if (!rules) return std::nullopt;
-    for (const auto& rule : *rules) {
-        Value value = valueForRule(rule.name());
-        if (!accepts(rule.name(), value, rule.value)) {
-            return RuleMismatch{std::string(rule.name()), rule.value, std::move(value)};
-        }
+std::optional<RuleMismatch> ZBDPlugIn::mismatch(const MatchRules& rules) const {
+    for (const MatchRule& rule : rules) {
+        Value value = valueForRule(*rule.key.string());
+        if (!accepts(rule, value)) return RuleMismatch{rule.key, rule.pattern, std::move(value)};
     }
     return std::nullopt;
 }
 
 bool ZBDPlugIn::matchKey(std::string_view key, const Value& pattern) const {
-    return accepts(key, valueForRule(key), pattern);
+    return accepts({Value(key), pattern, preparedAlternatives(pattern, _platform.typeConformance)}, valueForRule(key));
 }
 
 Value ZBDPlugIn::valueForRule(std::string_view key) const {
@@ -61,28 +56,19 @@ std::string ZBDPlugIn::userElection() const {
     return std::to_string(election.integerValue().value_or(0) & ~unseenElectionBits);
 }
 
-bool ZBDPlugIn::accepts(std::string_view key, const Value& value, const Value& pattern) const {
-    if (key == ruleKey::containingApp && !value) return false;
-    if (pattern == Value(true)) return value && !(value == Value(false));
-    if (pattern == Value(false)) return !value || value == Value(false);
+bool ZBDPlugIn::accepts(const MatchRule& rule, const Value& value) const {
+    if (!value && rule.key == Value(ruleKey::containingApp)) return false;
+    if (rule.pattern == Value(true)) return value && !(value == Value(false));
+    if (rule.pattern == Value(false)) return !value || value == Value(false);
     if (!value) return false;
-    if (const auto items = pattern.dictionary()) return matchDictionary(value, *items);
-    if (const auto text = value.string()) return matchValue(*text, pattern);
-    if (const auto elements = value.array()) return matchElements(*elements, pattern);
-    return false;
-}
-
-bool ZBDPlugIn::matchElements(const Array& elements, const Value& patterns) const {
-    std::optional<MatchAlternatives> prepared;
-    if (const auto alternatives = patterns.array();
-        alternatives && elements.size() > 1 && alternatives->size() > manyComparisons / elements.size()) {
-        prepared.emplace(*alternatives, _platform.typeConformance);
-    }
-    return std::any_of(elements.begin(), elements.end(), [&](const Value& element) {
-        const auto text = element.string();
+    if (const auto items = rule.pattern.dictionary()) return matchDictionary(value, *items);
+    const auto fits = [&](const Value& single) {
+        const auto text = single.string();
         if (!text) return false;
-        return prepared ? prepared->accepts(*text) : matchValue(*text, patterns);
-    });
+        return rule.alternatives ? rule.alternatives->accepts(*text) : matchValue(*text, rule.pattern);
+    };
+    if (const auto elements = value.array()) return std::any_of(elements->begin(), elements->end(), fits);
+    return fits(value);
 }
 
 bool ZBDPlugIn::matchValue(std::string_view value, const Value& patterns) const {

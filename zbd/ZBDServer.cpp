@@ -35,7 +35,6 @@ std::shared_ptr<ZBDServer> ZBDServer::initForService(platform::Platform& platfor
         log::ops().error("unable to listen for %{public}s: %{public}s", serviceName, *refusal);
         return nullptr;
     }
-    self->_holds.clear();
     singleton() = self;
     self->setDelegate(self);
     // The handler keeps the server alive for as long as connections may come.

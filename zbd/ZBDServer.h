@@ -6,6 +6,7 @@
 #include "zbd/ZBDatabase.h"
 
 #include <functional>
+#include <list>
 #include <memory>
 #include <optional>
 #include <string>
@@ -20,7 +21,7 @@ class ZBDQmxClient;
 /// holds. It is at the same time the plug-in database and its delegate.
 class ZBDServer final : public ZBDatabase, public ZBDatabaseDelegate {
 public:
-    using Holds = std::vector<std::shared_ptr<ZBDPlugInHold>>;
+    using Holds = std::list<std::shared_ptr<ZBDPlugInHold>>;
 
     /// A server whose listener is suspended until `run`. Null, with the reason logged, when the database cannot work or
     /// the service's name cannot be had. Main thread. The platform must outlive the process's other threads.
@@ -53,6 +54,7 @@ public:
     bool holdOnPlugIn(const ZBDPlugInRef& plugIn);
     void addHold(const std::shared_ptr<ZBDPlugInHold>& hold);
     void unholdToken(const platform::UUID& token);
+    /// Some of the client's holds end before this returns, the others soon after.
     void unholdClient(const std::shared_ptr<ZBDQmxClient>& client);
     /// Asks the service manager to end the running instances of each plug-in. `reply` runs once, on a queue of its own,
     /// after it has answered for all of them; no thread waits meanwhile.
@@ -69,20 +71,22 @@ public:
 private:
     explicit ZBDServer(platform::Platform& platform);
     void handleListenerEvent(const platform::Listener::Event& event);
+    Holds::iterator removeHold(Holds::iterator hold);
+    void unholdSlice(const std::shared_ptr<ZBDQmxClient>& client);
     void releaseAllHolds();
 
-    // Set during construction and only read afterwards, the holds aside.
+    // Set during construction and only read afterwards.
     std::uint32_t _verbose = 0;
     std::shared_ptr<platform::WorkQueue> _qmxQueue;
     std::shared_ptr<platform::WorkQueue> _mainQueue;
     std::shared_ptr<platform::Listener> _service;
     std::unique_ptr<ZBDUserPrefs> _userPrefs;
-    void uncountHold(const ZBDPlugInHold& hold);
+    std::shared_ptr<platform::WorkQueue> _syncQueue;
 
     // On _syncQueue only.
-    Holds _holds;
+    Holds _holds; // in the order they were added
+    std::unordered_map<platform::UUID, Holds::iterator> _holdsByToken;
     std::unordered_map<ZBDPlugInRef, std::size_t, zembra::ZBPlugInHash, zembra::ZBPlugInEqual> _holdCounts;
-    std::shared_ptr<platform::WorkQueue> _syncQueue;
 };
 
 } // namespace zbd

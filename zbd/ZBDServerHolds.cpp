@@ -21,49 +21,53 @@ bool ZBDServer::holdOnPlugIn(const ZBDPlugInRef& plugIn) {
 
 void ZBDServer::addHold(const std::shared_ptr<ZBDPlugInHold>& hold) {
     _syncQueue->sync([&] {
-        _holds.push_back(hold);
+        _holdsByToken.emplace(hold->uuid(), _holds.insert(_holds.end(), hold));
         for (const ZBDPlugInRef& plugIn : hold->blocked()) ++_holdCounts[plugIn];
     });
     notifyAnnotationChange();
 }
 
-void ZBDServer::uncountHold(const ZBDPlugInHold& hold) {
-    for (const ZBDPlugInRef& plugIn : hold.blocked()) {
+ZBDServer::Holds::iterator ZBDServer::removeHold(Holds::iterator hold) {
+    for (const ZBDPlugInRef& plugIn : (*hold)->blocked()) {
         const auto count = _holdCounts.find(plugIn);
         if (--count->second == 0) _holdCounts.erase(count);
     }
+    _holdsByToken.erase((*hold)->uuid());
+    const auto next = _holds.erase(hold);
+    notifyAnnotationChange();
+    return next;
 }
 
 void ZBDServer::unholdToken(const UUID& token) {
     _syncQueue->sync([&] {
-        const auto found =
-            std::find_if(_holds.begin(), _holds.end(), [&](const auto& hold) { return hold->uuid() == token; });
-        if (found == _holds.end()) return;
+        const auto found = _holdsByToken.find(token);
+        if (found == _holdsByToken.end()) return;
         log::ops().debug("releasing plug-in hold %{public}@ at client's request", token);
-        uncountHold(**found);
-        _holds.erase(found);
-        notifyAnnotationChange();
+        removeHold(found->second);
     });
 }
 
 void ZBDServer::unholdClient(const std::shared_ptr<ZBDQmxClient>& client) {
-    // In slices, so that other requests get to the queue while ten thousand holds end.
+    _syncQueue->sync([&] { unholdSlice(client); });
+}
+
+void ZBDServer::unholdSlice(const std::shared_ptr<ZBDQmxClient>& client) {
+    // Ten thousand holds end in slices, between which others get to the queue. The rest does not keep the caller: that
+    // is the transport's thread, which reads every client's requests.
     constexpr std::size_t slice = 64;
-    std::size_t released = slice;
-    while (released == slice) {
-        released = 0;
-        _syncQueue->sync([&] {
-            std::erase_if(_holds, [&](const auto& hold) {
-                if (released == slice || hold->client() != client) return false;
-                log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(),
-                                 client->pid());
-                uncountHold(*hold);
-                ++released;
-                return true;
-            });
-            for (std::size_t i = 0; i < released; ++i) notifyAnnotationChange();
-        });
+    std::size_t released = 0;
+    for (auto hold = _holds.begin(); hold != _holds.end() && released < slice;) {
+        if ((*hold)->client() != client) {
+            ++hold;
+            continue;
+        }
+        log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", (*hold)->uuid(), client->pid());
+        hold = removeHold(hold);
+        ++released;
     }
+    if (released < slice) return;
+    _syncQueue->async(
+        [self = std::static_pointer_cast<ZBDServer>(shared_from_this()), client] { self->unholdSlice(client); });
 }
 
 void ZBDServer::releaseAllHolds() {
@@ -72,6 +76,7 @@ void ZBDServer::releaseAllHolds() {
             log::ops().debug("releasing plug-in hold %{public}@ because server is stopping", hold->uuid());
         }
         _holds.clear();
+        _holdsByToken.clear();
         _holdCounts.clear();
     });
 }

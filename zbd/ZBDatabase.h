@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <unordered_map>
 #include <unordered_set>
@@ -56,6 +57,7 @@ public:
     // ZBDatabaseAnnotations.cpp
     std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn);
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
+    void setAnnotations(std::span<const AnnotationChange> changes);
     /// Tells every host that annotations or holds changed. Any thread.
     void notifyAnnotationChange();
     /// Elects a plug-in that asks for it, unless the user decided otherwise. On the database queue only.

@@ -14,6 +14,10 @@ void ZBDatabase::setAnnotation(const std::optional<Dictionary>& annotation, cons
     _sync->sync([&] { _annotations->setAnnotation(annotation, plugIn); });
 }
 
+void ZBDatabase::setAnnotations(std::span<const AnnotationChange> changes) {
+    _sync->sync([&] { _annotations->setAnnotations(changes); });
+}
+
 void ZBDatabase::notifyAnnotationChange() { _platform.notifications.post(zembra::annotationChangeNotification); }
 
 void ZBDatabase::autoElect(const ZBDPlugIn& plugIn) {

@@ -92,20 +92,36 @@ ProcessAssertions::ProcessAssertions(const Root& root) : _directory(busyDirector
     static_cast<void>(openUsersDirectory(_directory, ::geteuid(), MissingDirectory::made));
 }
 
+/// Opening every user's directory for each plug-in of a long request would let one user, who can make any number of
+/// directories, stop the daemon. So they stay open until the directory around them changes.
+void ProcessAssertions::readUsers(int directory) {
+    struct stat status{};
+    timespec now{};
+    clock_gettime(CLOCK_REALTIME, &now);
+    const bool isKnown = ::fstat(directory, &status) == 0 && status.st_ino == _inode &&
+                         status.st_mtim.tv_sec == _changed.tv_sec && status.st_mtim.tv_nsec == _changed.tv_nsec;
+    // Within the clock's grain another change may follow that does not show.
+    if (isKnown && now.tv_sec > _changed.tv_sec + 1) return;
+    _users.clear();
+    for (const uid_t user : usersIn(directory)) {
+        if (auto own = openPrivateDirectory(directory, user)) _users.emplace_back(user, std::move(own));
+    }
+    _inode = status.st_ino;
+    _changed = status.st_mtim;
+}
+
 std::vector<Dictionary> ProcessAssertions::busyExtensionInstances(const std::set<std::string>& bundleIdentifiers) {
     const auto directory = openUsersDirectory(_directory, ::geteuid(), MissingDirectory::refused);
     if (!directory) {
         if (directory.error().code != ENOENT) log().error("busy instances not told: %@", directory.error());
         return {};
     }
-    std::vector<std::pair<uid_t, Descriptor>> users;
-    for (const uid_t user : usersIn(directory->get())) {
-        if (auto own = openPrivateDirectory(directory->get(), user)) users.emplace_back(user, std::move(own));
-    }
+    const std::lock_guard lock(_lock);
+    readUsers(directory->get());
     std::vector<Dictionary> instances;
     for (const auto& identifier : bundleIdentifiers) {
         if (pathComponentError(identifier) != 0) continue;
-        for (const auto& [user, own] : users) {
+        for (const auto& [user, own] : _users) {
             const Descriptor file = openOfUser(own.get(), identifier, 0);
             if (!file) {
                 if (errno != ENOENT)

@@ -1,7 +1,14 @@
 #pragma once
 
 #include "platform/ProcessAssertions.h"
+#include "platform/linux/Descriptor.h"
 #include "platform/linux/Root.h"
+
+#include <ctime>
+#include <mutex>
+#include <sys/types.h>
+#include <utility>
+#include <vector>
 
 namespace platform::linux_ {
 
@@ -27,7 +34,13 @@ public:
     std::vector<Dictionary> busyExtensionInstances(const std::set<std::string>& bundleIdentifiers) override;
 
 private:
+    void readUsers(int directory);
+
     const std::string _directory;
+    std::mutex _lock;                                 // guards what follows
+    std::vector<std::pair<uid_t, Descriptor>> _users; // whose instances count, and their directories
+    ino_t _inode = 0;                                 // of the directory around them, with its time of change
+    timespec _changed{};
 };
 
 } // namespace platform::linux_

@@ -81,11 +81,11 @@ std::vector<std::string> valuesForEquality(const InstalledPlugIn& plugIn, const 
     std::vector<std::string> values;
     if (const auto text = value.string()) values.push_back(normalizedForEquality(*text));
     for (const Value& element : value.array().value_or(Array())) {
-        const auto text = element.string();
-        if (!text) continue;
-        auto normalized = normalizedForEquality(*text);
-        if (std::ranges::find(values, normalized) == values.end()) values.push_back(std::move(normalized));
+        if (const auto text = element.string()) values.push_back(normalizedForEquality(*text));
     }
+    std::ranges::sort(values);
+    const auto doubles = std::ranges::unique(values);
+    values.erase(doubles.begin(), doubles.end());
     return values;
 }
 

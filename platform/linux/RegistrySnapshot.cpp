@@ -18,7 +18,7 @@ constexpr std::size_t maximumKeptQuestion = 4096; // bytes
 bool isWorthKeeping(const std::vector<EqualityTest>& tests) {
     std::size_t size = 0;
     for (const auto& test : tests) {
-        for (const auto& value : test.values) size += sizeof value + value.size();
+        for (const auto& value : test.values) size += value.size() + 1;
     }
     return size <= maximumKeptQuestion;
 }

@@ -159,8 +159,14 @@ TEST_F(AnnotationStore, WhatNoFileCanHoldIsNotTaken) {
         EXPECT_TRUE(logged(LogLevel::error, unsaved));
         EXPECT_EQ(store->annotationForIdentifier("com.example.a"), elected);
     }
-    store->setAnnotation(elected, *plugIn("b"));
-    EXPECT_EQ(stored().size(), 2U) << "others are saved on";
+    // Nor what is too much together; the rest of the same request is taken.
+    const Dictionary half{{"extension", Dictionary{{"k", std::string(ZBDAnnotationStore::maximumFileSize / 2, 'x')}}}};
+    const std::vector<zbd::AnnotationChange> changes{{half, plugIn("b")}, {half, plugIn("c")}, {elected, plugIn("d")}};
+    store->setAnnotations(changes);
+    EXPECT_EQ(stored().size(), 3U);
+    EXPECT_EQ(store->annotationForIdentifier("com.example.b"), half);
+    EXPECT_FALSE(store->annotationForIdentifier("com.example.c"));
+    EXPECT_EQ(store->annotationForIdentifier("com.example.d"), elected);
 }
 
 TEST_F(AnnotationStore, UnsavedChangeGoesOutWithTheNext) {

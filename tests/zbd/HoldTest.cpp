@@ -67,8 +67,7 @@ TEST_F(Hold, PathsNameApplicationsOrPlugIns) {
     EXPECT_TRUE(
         processLog.contains(LogLevel::debug, "ops", "releasing plug-in hold " + one->text() + " at client's request"));
     EXPECT_TRUE(isHeld(0));
-    // The death of the client releases the rest, each with its line and its notification.
-    processLog.clear();
+    // The death of the client releases the rest, each with its notification.
     const auto beforeDeath = posts();
     client->cancel();
     daemon.fake.transport.deliver();
@@ -118,6 +117,7 @@ TEST_F(Hold, ForcedHoldsAnswerAfterEveryTermination) {
 
 TEST_F(Hold, AClientThatDiedMeanwhileLeavesNone) {
     const auto client = daemon.connect();
+    const auto before = posts();
     // The connection ends while the request is being served, before the hold is made.
     daemon.fake.registry.before("plugInsOfApplication", [&] {
         client->cancel();
@@ -127,8 +127,32 @@ TEST_F(Hold, AClientThatDiedMeanwhileLeavesNone) {
         Dictionary{{"request", "lock"}, {"version", 3}, {"paths", Array{"/Applications/A.app"}}, {"flags", 2}},
         daemon.fake.queues.makeSerial("replies"), [](const platform::ReplyOrError&) {});
     daemon.fake.transport.deliver();
-    EXPECT_TRUE(daemon.server->holds().empty());
+    EXPECT_EQ(posts(), before + 2) << "made and released";
     EXPECT_FALSE(isHeld(0));
+}
+
+TEST_F(Hold, ADeathReleasesThatClientsHoldsAlone) {
+    const auto other = daemon.connect();
+    const auto hold = [&](const auto& client) {
+        const auto reply =
+            daemon.ask(client, {{"request", "lock"}, {"version", 3}, {"paths", Array{plugIns[0].path}}, {"flags", 1}});
+        return *reply->uuid("uuids");
+    };
+    // More than are released in one turn, and a multiple of that.
+    for (const std::size_t count : {std::size_t{130}, std::size_t{128}}) {
+        const auto client = daemon.connect();
+        for (std::size_t i = 0; i < count / 2; ++i) hold(client);
+        const auto kept = hold(other);
+        for (std::size_t i = 0; i < count - count / 2; ++i) hold(client);
+        const auto before = posts();
+        client->cancel();
+        daemon.fake.transport.deliver();
+        EXPECT_EQ(posts(), before + count);
+        ASSERT_EQ(daemon.server->holds().size(), 1U);
+        EXPECT_EQ(daemon.server->holds().front()->uuid(), kept);
+        daemon.server->unholdToken(kept);
+        EXPECT_FALSE(isHeld(0));
+    }
 }
 
 } // namespace
