@@ -27,7 +27,7 @@ struct Selection {
 /// Why a candidate is dropped.
 struct Rejection {
     std::string reason;                     // for people
-    std::optional<RuleMismatch> mismatch{}; // when rules decided
+    std::optional<RuleMismatch> mismatch = std::nullopt; // when rules decided
 };
 
 /// One test that a candidate has to pass.

@@ -18,7 +18,6 @@ namespace key = zembra::key;
 namespace code = zembra::code;
 namespace requestType = zembra::requestType;
 using platform::Array;
-using platform::UUID;
 using platform::Value;
 
 namespace {

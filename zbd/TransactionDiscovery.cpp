@@ -46,6 +46,7 @@ void logCandidates(const Candidates& candidates) {
         log::ops().info("Candidate plugin count: 0");
     } else if (log::ops().isEnabled(platform::LogLevel::info)) {
         std::vector<std::string> texts;
+        texts.reserve(candidates.size());
         for (const auto& candidate : candidates) {
             texts.push_back(
                 platform::format("%@(%@) %@", candidate->identifier(), candidate->version(), candidate->uuid()));
@@ -59,6 +60,7 @@ void logResults(const std::vector<MutableDictionary>& forms) {
         log::ops().info("Resulting plugin count: 0");
     } else if (log::ops().isEnabled(platform::LogLevel::info)) {
         std::vector<Value> uuids;
+        uuids.reserve(forms.size());
         for (const auto& form : forms) uuids.push_back(form[formKey::uuid]);
         log::ops().info("Resulting plugin count: %u, UUIDs: %{public}@", forms.size(), uuids);
     }

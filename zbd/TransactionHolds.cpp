@@ -12,7 +12,6 @@ namespace code = zembra::code;
 using platform::Array;
 using platform::MutableArray;
 using platform::URL;
-using platform::Value;
 
 namespace {
 

@@ -14,7 +14,7 @@ std::optional<std::string> ZBDPlugIn::allowForClient(const ZBDQmxClient& host) c
     if (const Value restriction = host.entitlementValueForKey(zembra::entitlement::allowedPlugIns)) {
         const auto pattern = restriction.dictionary();
         if (!pattern) return "invalid host restriction entitlement";
-        if (!match(*pattern)) return "the host's plug-in entitlement does not allow this plug-in";
+        if (!match(pattern)) return "the host's plug-in entitlement does not allow this plug-in";
     }
     if (const Value required = pluginKey(zembra::manifest::hostEntitlement)) {
         // A name that is no text is one that no host can hold.

@@ -64,10 +64,11 @@ ZBDPlugInRef ZBDatabase::cachedPlugIn(const UUID& uuid) {
 ZBDPlugInRef ZBDatabase::plugInForProxy(const PlugInProxyRef& proxy) {
     return _sync->sync([&]() -> ZBDPlugInRef {
         // A proxy without a UUID gives a record with a random one: never found again, so it is not kept.
-        if (proxy->uuid) {
-            if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
-        }
-        return createPlugInForProxy(proxy);
+        if (!proxy->uuid) return createPlugInForProxy(proxy);
+        if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
+        // The proxy may be older than the notice of its uninstall; then nothing would end a record made of it.
+        const auto current = _workspace.plugInForUUID(*proxy->uuid);
+        return current ? createPlugInForProxy(current) : nullptr;
     });
 }
 

@@ -165,7 +165,7 @@ TEST_F(RegistryOnDisk, ReplacedBundleKeepsItsUUIDIfItIsTheSamePlugIn) {
     }
 }
 
-TEST_F(RegistryOnDisk, ChangeInPlaceChangesKnowledgeWithoutNotice) {
+TEST_F(RegistryOnDisk, ChangeInPlaceKeepsTheUUIDAndIsToldWhenAnythingShows) {
     writeApplication(app, {"a"});
     writeFile(plugIn + "/program", "code");
     writeManifest(plugIn, plugInInfo("a", {}, {{"VBBundleExecutable", "program"}}));
@@ -173,8 +173,9 @@ TEST_F(RegistryOnDisk, ChangeInPlaceChangesKnowledgeWithoutNotice) {
     const auto uuid = uuidAt(plugIn);
     const auto date = at(plugIn)->registrationDate;
     auto knowledge = registry().knowledgeUUID();
-    const auto expectChanged = [&](bool isChanged, const char* what) {
-        EXPECT_EQ(settle(), Notices{}) << what;
+    const Notices replaced{"-a", "+a"};
+    const auto expectChanged = [&](bool isChanged, const char* what, bool isApplication = false) {
+        EXPECT_EQ(settle(), isChanged && !isApplication ? replaced : Notices{}) << what;
         EXPECT_EQ(registry().knowledgeUUID() != knowledge, isChanged) << what;
         knowledge = registry().knowledgeUUID();
         EXPECT_EQ(uuidAt(plugIn), uuid) << what;
@@ -198,7 +199,7 @@ TEST_F(RegistryOnDisk, ChangeInPlaceChangesKnowledgeWithoutNotice) {
     ASSERT_TRUE(at(plugIn)->entitlements);
     EXPECT_TRUE(at(plugIn)->entitlements->contains("com.nordane.any"));
     writeManifest(app, Dictionary{{"VBBundleIsPlaceholder", true}, {"VBBundleName", "One"}});
-    expectChanged(true, "application");
+    expectChanged(true, "application", true);
     EXPECT_TRUE(at(plugIn)->containingBundle->isPlaceholder);
     EXPECT_EQ(at(plugIn)->containingBundle->localizedName, "One");
 

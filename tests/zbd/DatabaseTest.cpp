@@ -119,6 +119,12 @@ TEST_F(Database, UninstallNoticeRemovesThenTellsTheDelegate) {
         EXPECT_TRUE(logged(LogLevel::standard, "plug-in UNINSTALLED:" + identifier + " " + identifier + "(1) " +
                                                    proxy->uuid->text() + " " + proxy->bundleURL->path()));
     }
+    // A discovery may have taken b's proxy before b was replaced and its notice came.
+    auto newer = *b;
+    newer.localizedName = "newer";
+    fake.registry.install(newer);
+    database->plugInForProxy(b);
+    EXPECT_EQ(database->findPlugIn(*b->uuid)->localizedName(), Value("newer"));
 }
 
 TEST_F(Database, UnplacedAndPlaceholderPlugInsAreSkipped) {
