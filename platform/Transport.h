@@ -109,6 +109,8 @@ public:
     using EventHandler = std::function<void(const Event&)>;
 
     virtual ~Listener() = default;
+    /// Why the name could not be had; none when it is ours. Before `resume`.
+    virtual std::optional<std::string> refusal() const = 0;
     /// Called on the queue given at creation. A new connection starts suspended; one that nobody keeps or resumes is
     /// closed.
     virtual void setEventHandler(EventHandler handler) = 0;
@@ -126,8 +128,8 @@ public:
 class Transport {
 public:
     virtual ~Transport() = default;
-    /// Never fails at once: a name that cannot be had is reported to the listener's handler as an error of kind
-    /// `other`, after `resume`.
+    /// A listener without its name, when that cannot be had: whoever resumes it all the same is told by an error of
+    /// kind `other`.
     virtual std::shared_ptr<Listener> createListener(const std::string& serviceName,
                                                      std::shared_ptr<WorkQueue> queue) = 0;
     /// Connects when first needed; failures come as connection-invalid events and as errors in place of replies.

@@ -1,9 +1,11 @@
 #include "platform/PropertyList.h"
 
 #include "platform/linux/PropertyListCoding.h"
+#include "platform/linux/TransportMessage.h"
 #include "platform/linux/Utf8.h"
 
 #include <bit>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -140,8 +142,14 @@ private:
 
 class Reader {
 public:
-    Reader(std::string_view bytes, std::size_t offset, UUIDs uuids, std::size_t nesting)
-        : _bytes(bytes), _at(offset), _end(bytes.size()), _uuids(uuids), _nesting(nesting) {}
+    Reader(std::string_view bytes, std::size_t offset, UUIDs uuids, std::size_t nesting,
+           std::size_t maximumMemory = SIZE_MAX)
+        : _bytes(bytes),
+          _at(offset),
+          _end(bytes.size()),
+          _uuids(uuids),
+          _nesting(nesting),
+          _maximumMemory(maximumMemory) {}
 
     Result<Value> read() {
         Value value;
@@ -150,10 +158,18 @@ public:
         return value;
     }
 
+    /// Bytes of memory that the value takes. Counted beside the sizes: nodes, the index of a dictionary, and what the
+    /// allocator rounds up.
+    std::size_t memory() const { return _memory; }
+
 private:
     // The least that an item takes, so that a count can be refused before memory is reserved for it.
     static constexpr std::size_t smallestValue = 1;
     static constexpr std::size_t smallestEntry = sizeof(std::uint32_t) + smallestValue;
+
+    static constexpr std::size_t leafMemory = 40;       // and the bytes
+    static constexpr std::size_t containerMemory = 136; // and the items
+    static constexpr std::size_t entryMemory = sizeof(Dictionary::Entry) + sizeof(std::uint32_t);
 
     std::size_t left() const noexcept { return _end - _at; }
 
@@ -161,6 +177,13 @@ private:
     bool fail(std::string_view what, std::size_t where) {
         _problem = std::string(what) + " at byte " + std::to_string(where);
         return false;
+    }
+
+    /// To be asked before memory is taken.
+    bool takeMemory(std::size_t size, std::size_t where) {
+        if (size > _maximumMemory - _memory) return fail("a value that takes too much memory", where);
+        _memory += size;
+        return true;
     }
 
     template <class Number> bool readNumber(Number& number) {
@@ -176,6 +199,7 @@ private:
         std::uint32_t size = 0;
         if (!readNumber(size)) return false;
         if (size > left()) return fail("a length is larger than what is left", start);
+        if (!takeMemory(leafMemory + size, start)) return false;
         bytes = _bytes.substr(_at, size);
         _at += size;
         return true;
@@ -226,10 +250,10 @@ private:
             return true;
         case uuidTag: return readUUID(value, start);
         case arrayTag:
-            return readContainer(smallestValue, start, depth,
+            return readContainer(smallestValue, sizeof(Value), start, depth,
                                  [&](std::uint32_t count) { return readItems(value, count, depth); });
         case dictionaryTag:
-            return readContainer(smallestEntry, start, depth,
+            return readContainer(smallestEntry, entryMemory, start, depth,
                                  [&](std::uint32_t count) { return readEntries(value, count, start, depth); });
         default: return fail("an unknown tag", start);
         }
@@ -239,6 +263,7 @@ private:
         if (_uuids == UUIDs::refused) return fail("a UUID where none may be", start);
         UUID uuid;
         if (left() < uuid.bytes.size()) return fail("the value is cut short", _at);
+        if (!takeMemory(leafMemory, start)) return false;
         std::memcpy(uuid.bytes.data(), _bytes.data() + _at, uuid.bytes.size());
         _at += uuid.bytes.size();
         value = uuid;
@@ -247,13 +272,20 @@ private:
 
     /// Reads size and count, and holds `readContent` to exactly that size.
     template <class Content>
-    bool readContainer(std::size_t smallestItem, std::size_t start, std::size_t depth, Content readContent) {
+    bool readContainer(std::size_t smallestItem, std::size_t itemMemory, std::size_t start, std::size_t depth,
+                       Content readContent) {
         if (depth == _nesting) return fail("containers nest too deep", start);
         std::uint32_t size = 0;
         std::uint32_t count = 0;
         if (!readNumber(size) || !readNumber(count)) return false;
         if (size > left()) return fail("a container's size is larger than what is left", start);
-        if (count > size / smallestItem) return fail("a container's count is larger than its size allows", start);
+        // All items lie beside one another, so together they cannot be more than the bytes allow. Without this,
+        // containers in one another could each claim all the bytes, and each claim takes memory before it shows wrong.
+        const std::size_t items = count * smallestItem;
+        if (items > size || items > _bytes.size() - _claimed)
+            return fail("a container's count is larger than its size allows", start);
+        _claimed += items;
+        if (!takeMemory(containerMemory + count * itemMemory, start)) return false;
         const std::size_t outerEnd = _end;
         _end = _at + size;
         if (!readContent(count)) return false;
@@ -289,6 +321,9 @@ private:
     std::size_t _end; // of the container being read
     const UUIDs _uuids;
     const std::size_t _nesting; // containers in one another
+    const std::size_t _maximumMemory;
+    std::size_t _memory = 0;
+    std::size_t _claimed = 0; // bytes that the items of all containers take at least
     std::optional<std::string> _problem;
 };
 
@@ -301,6 +336,13 @@ Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids, std::size_t nes
 }
 
 namespace linux_ {
+
+Result<DecodedMessage> decodeMessage(std::string_view bytes, std::size_t maximumSize) {
+    Reader reader(bytes, 0, UUIDs::allowed, maximumNesting, maximumSize);
+    Result<Value> content = reader.read();
+    if (!content) return content.error();
+    return DecodedMessage{*std::move(content), reader.memory()};
+}
 
 Result<Value> decodeCompactFile(std::string_view bytes, std::size_t nesting) {
     return Reader(bytes, compactMagic.size(), UUIDs::refused, nesting).read();

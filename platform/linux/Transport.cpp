@@ -32,10 +32,11 @@ void raiseDescriptorLimit() {
 
 } // namespace
 
-Transport::Transport(const Root& root)
-    : _directory(root.runtime()),
+Transport::Transport(const Root& root, const qmx::Limits& limits)
+    : _limits(limits),
+      _directory(root.runtime()),
       _loop(std::make_shared<qmx::Loop>()),
-      _counts(std::make_shared<qmx::ConnectionCounts>()),
+      _budgets(std::make_shared<const qmx::Budgets>(limits)),
       _activities(std::make_shared<std::atomic<std::size_t>>(0)) {
     raiseDescriptorLimit();
 }
@@ -44,7 +45,7 @@ Transport::~Transport() { _loop->stop(); }
 
 std::shared_ptr<platform::Listener> Transport::createListener(const std::string& serviceName,
                                                               std::shared_ptr<WorkQueue> queue) {
-    auto listener = std::make_shared<qmx::StreamListener>(_loop, _counts, std::move(queue));
+    auto listener = std::make_shared<qmx::StreamListener>(_loop, _budgets, _limits.handshake, std::move(queue));
     listener->open(_directory, serviceName);
     return listener;
 }

@@ -2,6 +2,7 @@
 
 #include "platform/Transport.h"
 #include "platform/linux/Root.h"
+#include "platform/linux/TransportLimits.h"
 
 #include <atomic>
 #include <cstddef>
@@ -11,7 +12,6 @@
 namespace platform::linux_ {
 
 namespace qmx {
-class ConnectionCounts;
 class Loop;
 } // namespace qmx
 
@@ -23,7 +23,7 @@ class Loop;
 class Transport final : public platform::Transport {
 public:
     /// Raises the process's limit of open files as far as allowed and starts the thread.
-    explicit Transport(const Root& root);
+    explicit Transport(const Root& root, const qmx::Limits& limits = {});
     /// Closes everything and joins the thread; must not run on it. Handlers that run meanwhile on other queues may
     /// finish, none is called afterwards. Finalizers still run.
     ~Transport() override;
@@ -38,9 +38,10 @@ public:
     std::size_t activityCount() const;
 
 private:
-    std::string _directory;
+    const qmx::Limits _limits;
+    const std::string _directory;
     std::shared_ptr<qmx::Loop> _loop;
-    std::shared_ptr<qmx::ConnectionCounts> _counts;
+    std::shared_ptr<const qmx::Budgets> _budgets;
     std::shared_ptr<std::atomic<std::size_t>> _activities;
 };
 

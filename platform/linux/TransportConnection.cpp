@@ -1,8 +1,10 @@
 #include "platform/linux/TransportConnection.h"
 
+#include "platform/linux/ActingAsPeer.h"
 #include "platform/linux/PeerProcess.h"
 #include "platform/linux/ProcPath.h"
 #include "platform/linux/TransportLimits.h"
+#include "platform/linux/TransportMessage.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -23,6 +25,7 @@ namespace platform::linux_::qmx {
 namespace {
 
 constexpr const char* invalidText = "Connection invalid";
+constexpr const char* budgetText = "too many bytes of this user wait";
 
 TransportError invalid(const std::string& reason) {
     return {TransportErrorKind::connectionInvalid,
@@ -35,21 +38,6 @@ std::string systemText(int number) { return std::generic_category().message(numb
 constexpr std::chrono::milliseconds connectRetryDelay{5};
 
 } // namespace
-
-std::optional<ConnectionCounts::Slot> ConnectionCounts::take(const std::shared_ptr<ConnectionCounts>& counts,
-                                                             std::uint32_t user) {
-    const std::lock_guard lock(counts->_mutex);
-    std::size_t& count = counts->_counts[user];
-    if (count >= maximumConnectionsPerUser) return std::nullopt;
-    ++count;
-    return std::optional<Slot>(std::in_place, counts, user);
-}
-
-void ConnectionCounts::giveBack(std::uint32_t user) {
-    const std::lock_guard lock(_mutex);
-    const auto found = _counts.find(user);
-    if (--found->second == 0) _counts.erase(found);
-}
 
 int withSocketAddress(const std::string& directory, const std::string& name,
                       const std::function<int(const sockaddr*, socklen_t)>& use) {
@@ -91,46 +79,58 @@ std::optional<std::uint32_t> peerUser(int socket) {
 
 std::optional<AuditToken> identifyPeer(int socket) {
     const auto credentials = peerCredentials(socket);
+    auto rights = rightsOfPeer(socket);
     // A process outside this pid namespace has no pid here.
-    if (!credentials || credentials->pid <= 0) return std::nullopt;
+    if (!credentials || credentials->pid <= 0 || !rights) return std::nullopt;
     int pidfd = -1;
     socklen_t size = sizeof pidfd;
     // An older kernel lacks the option; then the pid is opened, which is as good: the handshake proves that the
     // process that has the pid now is the one at the other end.
     if (::getsockopt(socket, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) != 0 && errno != ENOPROTOOPT) return std::nullopt;
-    auto process = LinuxPeerProcess::look(credentials->pid, Descriptor(pidfd));
+    auto process = LinuxPeerProcess::look(credentials->pid, Descriptor(pidfd), std::move(rights->groups));
     if (!process) return std::nullopt;
     return AuditToken{credentials->pid, credentials->uid, credentials->gid, std::move(process)};
 }
 
-/// Frees the request's place among the waiting ones when it goes without having been answered.
+/// Frees the message's place among the waiting ones when it goes without having been answered.
 class StreamConnection::Token final : public ReplyToken {
 public:
-    Token(std::weak_ptr<StreamConnection> connection, std::uint64_t id) : _connection(std::move(connection)), _id(id) {}
+    Token(std::weak_ptr<StreamConnection> connection, WaitingMessage message, Budget::Share share)
+        : _connection(std::move(connection)), _message(message), _share(std::move(share)) {}
     ~Token() override {
         if (_used) return;
-        if (const auto connection = _connection.lock()) connection->forgetRequest(_id);
+        if (const auto connection = _connection.lock()) connection->forget(_message);
     }
     Token(const Token&) = delete;
     Token& operator=(const Token&) = delete;
 
-    std::uint64_t id() const { return _id; }
+    const WaitingMessage& message() const { return _message; }
     bool belongsTo(const StreamConnection& connection) const {
         return !_connection.owner_before(connection.weak_from_this()) &&
                !connection.weak_from_this().owner_before(_connection);
     }
-    /// True once.
-    bool use() { return !_used.exchange(true); }
+    /// True once. Gives the share back: the next request may come before the last holder of this one lets go.
+    bool use() {
+        if (_used.exchange(true)) return false;
+        _share = {};
+        return true;
+    }
 
 private:
     const std::weak_ptr<StreamConnection> _connection;
-    const std::uint64_t _id;
+    const WaitingMessage _message;
+    Budget::Share _share; // kept without the connection, whose end does not free the memory
     std::atomic<bool> _used = false;
 };
 
-StreamConnection::StreamConnection(std::shared_ptr<Loop> loop, Descriptor socket, AuditToken peer,
-                                   ConnectionCounts::Slot slot)
-    : _loop(std::move(loop)), _socket(std::move(socket)), _slot(std::move(slot)), _peer(std::move(peer)) {}
+StreamConnection::StreamConnection(std::shared_ptr<Loop> loop, Descriptor socket, AuditToken peer, Budget::Share place,
+                                   const Budgets& budgets)
+    : _loop(std::move(loop)),
+      _inShare(budgets.received->shareOf(peer.uid)),
+      _socket(std::move(socket)),
+      _place(std::move(place)),
+      _peer(std::move(peer)),
+      _outShare(budgets.unsent->shareOf(_peer.uid)) {}
 
 StreamConnection::StreamConnection(std::shared_ptr<Loop> loop, std::string directory, std::string serviceName,
                                    std::shared_ptr<WorkQueue> queue)
@@ -219,8 +219,8 @@ void StreamConnection::send(const ReplyMessage& reply) {
     if (token == nullptr || !token->belongsTo(*this) || !token->use()) return;
     const std::lock_guard lock(_mutex);
     if (_state != State::open || _cancelled) return;
-    std::erase(_waiting, token->id());
-    if (!_sendBroken && !appendOut(FrameType::reply, token->id(), reply.content)) {
+    removeWaiting(token->message());
+    if (!_sendBroken && !appendOut(FrameType::reply, token->message().id, reply.content)) {
         // The peer waits for an answer that can never come; an end is an answer too.
         _loop->post([connection = self()] { connection->fail("reply too long"); });
         return;
@@ -251,18 +251,19 @@ void StreamConnection::sendWithReply(const Dictionary& message, std::shared_ptr<
     if (error) queue->async([hear = std::move(handler), problem = std::move(*error)] { hear(problem); });
 }
 
-void StreamConnection::forgetRequest(std::uint64_t id) {
+void StreamConnection::forget(const WaitingMessage& message) {
     const std::lock_guard lock(_mutex);
-    std::erase(_waiting, id);
+    removeWaiting(message);
     updatePause();
     updateInterest();
 }
 
-void StreamConnection::forgetSilentMessage() {
-    const std::lock_guard lock(_mutex);
-    --_waitingSilently;
-    updatePause();
-    updateInterest();
+/// Does nothing for a message of a connection that is gone.
+void StreamConnection::removeWaiting(const WaitingMessage& message) {
+    const auto found = std::find(_waiting.begin(), _waiting.end(), message);
+    if (found == _waiting.end()) return;
+    _waitingBytes -= message.size;
+    _waiting.erase(found);
 }
 
 bool StreamConnection::appendOut(FrameType type, std::uint64_t id, const Value& content) {
@@ -288,13 +289,14 @@ void StreamConnection::flushOut() {
         _out.clear();
         _outSent = 0;
         if (_out.capacity() > keptBufferBytes) _out.shrink_to_fit();
+        _outShare.resize(0);
         return;
     }
     if (_outSent > _out.size() / 2) {
         _out.erase(0, _outSent);
         _outSent = 0;
     }
-    if (unsent() > maximumUnsentBytes) {
+    if (unsent() > maximumUnsentBytes || !_outShare.resize(_out.size())) {
         _sendBroken = true;
         _loop->post(
             [connection = self()] { connection->fail("too many bytes waiting for a peer that does not read"); });
@@ -306,10 +308,12 @@ void StreamConnection::closeSocket() {
     _ending = true;
     _watched = false;
     _socket.reset();
-    _slot.reset();
+    _place = {};
     _out = {};
     _outSent = 0;
+    _outShare = {};
     _waiting.clear();
+    _waitingBytes = 0;
 }
 
 /// Only an accepted connection pauses. If both ends stopped reading while the other does not read, neither would ever
@@ -317,8 +321,10 @@ void StreamConnection::closeSocket() {
 void StreamConnection::updatePause() {
     if (!isAccepted() || _state != State::open) return;
     if (!_paused) {
-        _paused = _waiting.size() + _waitingSilently >= maximumWaitingRequests || unsent() > pauseUnsentBytes;
-    } else if (_waiting.size() + _waitingSilently <= resumeWaitingRequests && unsent() <= resumeUnsentBytes) {
+        _paused = _waiting.size() >= maximumWaitingRequests || _waitingBytes > pauseWaitingBytes ||
+                  unsent() > pauseUnsentBytes;
+    } else if (_waiting.size() <= resumeWaitingRequests && _waitingBytes <= resumeWaitingBytes &&
+               unsent() <= resumeUnsentBytes) {
         _paused = false;
         _loop->post([connection = self()] { connection->onTurn(); }); // buffered frames give no event
     }
@@ -404,8 +410,9 @@ void StreamConnection::drain() {
         if (_watched) _loop->unwatch(_socket.get());
         _watched = false;
         _sendBroken = true;
-        _out.clear();
+        _out = {};
         _outSent = 0;
+        _outShare.resize(0);
         updatePause();
     }
     _draining = true;
@@ -420,7 +427,7 @@ void StreamConnection::read() {
         if (_state == State::closed || _paused) return; // unpausing gives another turn
     }
     if (_frameBuffered) {
-        _in.erase(0, deliverFrames(_in));
+        deliverBuffered();
     } else {
         const std::span<char> buffer = _loop->scratch();
         const ssize_t count = ::recv(_socket.get(), buffer.data(), buffer.size(), MSG_DONTWAIT);
@@ -433,17 +440,38 @@ void StreamConnection::read() {
         }
         const std::string_view bytes(buffer.data(), static_cast<std::size_t>(count));
         // Frames are decoded where they lie; only the start of one that is not complete yet is kept.
-        if (_in.empty() && _state == State::open) {
-            _in.assign(bytes.substr(deliverFrames(bytes)));
-        } else {
-            _in.append(bytes);
+        const bool isDirect = _in.empty() && _state == State::open;
+        if (!keep(isDirect ? bytes.substr(deliverFrames(bytes)) : bytes)) return fail(budgetText);
+        if (!isDirect) {
             if (_state == State::greeting) readGreeting();
-            if (_state == State::open) _in.erase(0, deliverFrames(_in));
+            if (_state == State::open) deliverBuffered();
         }
     }
-    if (_in.empty() && _in.capacity() > keptBufferBytes) _in.shrink_to_fit();
     const std::lock_guard lock(_mutex);
     if (_state != State::closed && !_paused && (_frameBuffered || _draining)) _loop->again(this);
+}
+
+/// Keeps `bytes` for later; false when their user has too many here already.
+bool StreamConnection::keep(std::string_view bytes) {
+    const std::size_t needed = _in.size() + bytes.size();
+    if (needed > _in.capacity()) {
+        // By what came, never by what a frame announces.
+        const std::size_t capacity =
+            std::max(needed, std::min(2 * _in.capacity(), frameLengthSize + maximumFrameLength));
+        if (!_inShare.resize(capacity)) return false;
+        _in.reserve(capacity);
+    }
+    _in.insert(_in.end(), bytes.begin(), bytes.end());
+    return true;
+}
+
+void StreamConnection::deliverBuffered() {
+    const std::size_t used = deliverFrames({_in.data(), _in.size()});
+    if (_in.empty()) return; // the connection ended
+    _in.erase(_in.begin(), _in.begin() + static_cast<std::ptrdiff_t>(used));
+    if (_in.capacity() <= keptBufferBytes || _in.size() > _in.capacity() / 2) return;
+    _in.shrink_to_fit();
+    _inShare.resize(_in.capacity());
 }
 
 void StreamConnection::readEnd() {
@@ -470,7 +498,7 @@ void StreamConnection::readGreeting() {
     if (_in.size() < handshakeSize) return;
     Handshake greeting{};
     std::copy_n(_in.begin(), handshakeSize, greeting.begin());
-    _in.erase(0, handshakeSize);
+    _in.erase(_in.begin(), _in.begin() + handshakeSize);
     if (!isGreeting(greeting)) return malformed("foreign greeting");
     const Handshake answer = makeAnswer(greeting);
     const std::lock_guard lock(_mutex);
@@ -521,6 +549,7 @@ void StreamConnection::endGathering() {
 
 /// False when the request must wait for replies to earlier ones.
 bool StreamConnection::deliverRequest(const Frame& frame, bool moreFollow) {
+    const WaitingMessage waiting{frame.type, frame.id, frame.body.size()};
     const bool expectsReply = frame.type == FrameType::request;
     std::shared_ptr<EventHandler> handler;
     bool isDuplicate = false;
@@ -531,11 +560,12 @@ bool StreamConnection::deliverRequest(const Frame& frame, bool moreFollow) {
             updateInterest();
             return false;
         }
-        if (expectsReply) {
-            isDuplicate = std::find(_waiting.begin(), _waiting.end(), frame.id) != _waiting.end();
-            if (!isDuplicate) _waiting.push_back(frame.id);
-        } else {
-            ++_waitingSilently;
+        isDuplicate = expectsReply && std::any_of(_waiting.begin(), _waiting.end(), [&](const WaitingMessage& each) {
+                          return each.type == FrameType::request && each.id == frame.id;
+                      });
+        if (!isDuplicate) {
+            _waiting.push_back(waiting);
+            _waitingBytes += waiting.size;
         }
         _gathering = moreFollow;
         handler = _handler;
@@ -544,20 +574,25 @@ bool StreamConnection::deliverRequest(const Frame& frame, bool moreFollow) {
         malformed("id of a request that still waits");
         return true;
     }
-    Result<Value> content = decodeCompact(frame.body, UUIDs::allowed);
-    if (!content) {
-        malformed(content.error().text().c_str());
+    Result<DecodedMessage> result = decodeMessage(frame.body, maximumDecodedBytes);
+    if (!result) {
+        malformed(result.error().text().c_str());
         return true;
     }
-    ReceivedMessage message{*std::move(content), nullptr};
-    if (expectsReply) {
-        message.reply = std::make_shared<Token>(self(), frame.id);
-    } else {
-        message.place = std::shared_ptr<const void>(nullptr, [weak = std::weak_ptr(self())](const void*) {
-            if (const auto connection = weak.lock()) connection->forgetSilentMessage();
-        });
+    DecodedMessage decoded = *std::move(result);
+    Budget::Share share = _inShare.sibling();
+    if (!share.resize(decoded.size)) {
+        fail(budgetText);
+        return true;
     }
-    deliverEvent(handler, message);
+    auto token = std::make_shared<Token>(self(), waiting, std::move(share));
+    ReceivedMessage message{std::move(decoded.content), nullptr};
+    if (expectsReply) {
+        message.reply = std::move(token);
+    } else {
+        message.place = std::move(token);
+    }
+    deliverEvent(handler, std::move(message));
     return true;
 }
 
@@ -605,6 +640,7 @@ void StreamConnection::fail(const std::string& reason) {
         remains = takeRemains();
     }
     _in = {};
+    _inShare = {};
     _frameBuffered = false;
     const TransportError error = invalid(reason);
     for (auto& [id, pending] : remains.pending) {

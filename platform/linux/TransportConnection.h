@@ -2,6 +2,7 @@
 
 #include "platform/Transport.h"
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/TransportBudget.h"
 #include "platform/linux/TransportFrame.h"
 #include "platform/linux/TransportLoop.h"
 
@@ -15,39 +16,12 @@
 #include <string>
 #include <string_view>
 #include <sys/socket.h>
-#include <unordered_map>
 #include <utility>
 #include <vector>
 
 namespace platform::linux_::qmx {
 
-/// How many accepted connections each user has. Shared by everything that may give one back.
-class ConnectionCounts {
-public:
-    /// Counts one connection as long as it exists.
-    class Slot {
-    public:
-        Slot(std::shared_ptr<ConnectionCounts> counts, std::uint32_t user) : _counts(std::move(counts)), _user(user) {}
-        Slot(Slot&&) noexcept = default;
-        Slot& operator=(Slot&&) = delete;
-        ~Slot() {
-            if (_counts) _counts->giveBack(_user);
-        }
-
-    private:
-        std::shared_ptr<ConnectionCounts> _counts;
-        std::uint32_t _user;
-    };
-
-    /// None when the user has `maximumConnectionsPerUser` already.
-    static std::optional<Slot> take(const std::shared_ptr<ConnectionCounts>& counts, std::uint32_t user);
-
-private:
-    void giveBack(std::uint32_t user);
-
-    std::mutex _mutex;
-    std::unordered_map<std::uint32_t, std::size_t> _counts; // guarded by _mutex
-};
+struct Budgets;
 
 /// One end of a connection over a stream socket.
 ///
@@ -55,8 +29,9 @@ private:
 /// handler or a queue is called.
 class StreamConnection final : public platform::Connection, public Pollable {
 public:
-    /// An accepted connection whose handshake is done.
-    StreamConnection(std::shared_ptr<Loop> loop, Descriptor socket, AuditToken peer, ConnectionCounts::Slot slot);
+    /// An accepted connection whose handshake is done, and its place among its user's connections.
+    StreamConnection(std::shared_ptr<Loop> loop, Descriptor socket, AuditToken peer, Budget::Share place,
+                     const Budgets& budgets);
     /// A connection to be made to the socket `serviceName` in `directory` when it is resumed.
     StreamConnection(std::shared_ptr<Loop> loop, std::string directory, std::string serviceName,
                      std::shared_ptr<WorkQueue> queue);
@@ -82,6 +57,13 @@ private:
         std::shared_ptr<WorkQueue> queue;
         ReplyHandler handler;
     };
+    /// A delivered request that waits for its reply, or a message without reply that somebody still holds.
+    struct WaitingMessage {
+        FrameType type;
+        std::uint64_t id;
+        std::size_t size; // of its frame's body
+        friend bool operator==(const WaitingMessage&, const WaitingMessage&) = default;
+    };
     /// What a connection that ended leaves to be told; called and dropped without the lock.
     struct Remains {
         std::shared_ptr<EventHandler> handler;
@@ -102,6 +84,8 @@ private:
     void read();
     void readEnd();
     void readGreeting();
+    bool keep(std::string_view bytes);
+    void deliverBuffered();
     std::size_t deliverFrames(std::string_view bytes);
     bool deliverRequest(const Frame& frame, bool moreFollow);
     void deliverReply(const Frame& frame);
@@ -117,11 +101,11 @@ private:
     void closeSocket();
     void updatePause();
     void updateInterest();
+    void removeWaiting(const WaitingMessage& message);
     std::size_t unsent() const { return _out.size() - _outSent; }
     Remains takeRemains();
 
-    void forgetRequest(std::uint64_t id);
-    void forgetSilentMessage();
+    void forget(const WaitingMessage& message);
 
     const std::shared_ptr<Loop> _loop;
     const std::string _directory; // connecting ends only, as the next two
@@ -129,7 +113,8 @@ private:
     const std::shared_ptr<WorkQueue> _queue; // null: an accepted connection
 
     // The loop's thread only.
-    std::string _in;             // what came and was not delivered yet; its front is the start of a frame
+    std::vector<char> _in;       // what came and was not delivered yet; its front is the start of a frame
+    Budget::Share _inShare;      // the capacity of `_in`
     bool _frameBuffered = false; // `_in` may hold a complete frame
     bool _ended = false;         // the peer sends no more
     bool _draining = false;      // the peer is gone: what it sent before is delivered, then the connection is invalid
@@ -140,7 +125,7 @@ private:
     // Guarded by _mutex.
     State _state = State::suspended;
     Descriptor _socket;
-    std::optional<ConnectionCounts::Slot> _slot;
+    Budget::Share _place; // among its user's connections
     AuditToken _peer;
     bool _resumed = false;
     bool _cancelled = false;
@@ -152,8 +137,9 @@ private:
     std::uint32_t _interest = 0;
     std::string _out;
     std::size_t _outSent = 0;
-    std::size_t _waitingSilently = 0;    // delivered messages without reply that somebody still holds
-    std::vector<std::uint64_t> _waiting; // ids of delivered requests without a reply; a handful
+    Budget::Share _outShare;              // the size of `_out` as it was when the socket took no more
+    std::vector<WaitingMessage> _waiting; // a handful
+    std::size_t _waitingBytes = 0;
     std::uint64_t _nextId = 1;
     std::map<std::uint64_t, PendingReply> _pending;
     std::shared_ptr<EventHandler> _handler;

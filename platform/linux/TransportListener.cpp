@@ -51,14 +51,14 @@ pid_t senderOf(msghdr& message) {
 class HandshakingPeer final : public Pollable {
 public:
     HandshakingPeer(std::shared_ptr<Loop> loop, std::weak_ptr<StreamListener> listener, Descriptor socket,
-                    AuditToken peer, ConnectionCounts::Slot slot)
+                    AuditToken peer, Budget::Share place)
         : _loop(std::move(loop)),
           _listener(std::move(listener)),
           _socket(std::move(socket)),
           _peer(std::move(peer)),
-          _slot(std::move(slot)) {}
+          _place(std::move(place)) {}
 
-    static void begin(std::shared_ptr<HandshakingPeer> peer) {
+    static void begin(std::shared_ptr<HandshakingPeer> peer, std::chrono::milliseconds deadline) {
         // Before the greeting, so that the answer to it never comes without its sender. Not once for the listening
         // socket: connections made to a socket that was passed in are older than that would be.
         const int on = 1;
@@ -73,7 +73,10 @@ public:
             return;
         }
         Loop& loop = *peer->_loop;
-        if (loop.watch(peer->_socket.get(), EPOLLIN, peer.get())) loop.keep(std::move(peer));
+        if (!loop.watch(peer->_socket.get(), EPOLLIN, peer.get())) return;
+        HandshakingPeer* const kept = peer.get();
+        loop.keep(std::move(peer));
+        loop.expire(kept, deadline);
     }
 
     void onEvents(std::uint32_t) override {
@@ -85,11 +88,12 @@ public:
         ::setsockopt(_socket.get(), SOL_SOCKET, SO_PASSCRED, &off, sizeof off);
         _loop->unwatch(_socket.get());
         if (const auto listener = _listener.lock()) {
-            listener->accepted(std::move(_socket), std::move(_peer), std::move(*_slot));
+            listener->accepted(std::move(_socket), std::move(_peer), std::move(_place));
         }
         giveUp();
     }
 
+    void onDeadline() override { giveUp(); }
     void shutDown() override { _socket.reset(); }
 
 private:
@@ -111,7 +115,7 @@ private:
 
     void giveUp() {
         _socket.reset();
-        _slot.reset();
+        _place = {};
         _loop->drop(this);
     }
 
@@ -119,7 +123,7 @@ private:
     const std::weak_ptr<StreamListener> _listener;
     Descriptor _socket;
     AuditToken _peer;
-    std::optional<ConnectionCounts::Slot> _slot;
+    Budget::Share _place; // among its user's connections
     Handshake _expected{};
     Handshake _answer{};
     std::size_t _received = 0;
@@ -132,9 +136,9 @@ bool isServiceName(const std::string& name) {
            name.find('/') == std::string::npos && name.find('\0') == std::string::npos && !name.ends_with(lockSuffix);
 }
 
-StreamListener::StreamListener(std::shared_ptr<Loop> loop, std::shared_ptr<ConnectionCounts> counts,
-                               std::shared_ptr<WorkQueue> queue)
-    : _loop(std::move(loop)), _counts(std::move(counts)), _queue(std::move(queue)) {}
+StreamListener::StreamListener(std::shared_ptr<Loop> loop, std::shared_ptr<const Budgets> budgets,
+                               std::chrono::milliseconds handshake, std::shared_ptr<WorkQueue> queue)
+    : _loop(std::move(loop)), _budgets(std::move(budgets)), _handshake(handshake), _queue(std::move(queue)) {}
 
 StreamListener::~StreamListener() { close(); }
 
@@ -233,6 +237,8 @@ void StreamListener::close() {
     _lock.reset();
 }
 
+std::optional<std::string> StreamListener::refusal() const { return _socket ? std::nullopt : std::optional(_problem); }
+
 void StreamListener::setEventHandler(EventHandler handler) {
     auto shared = handler ? std::make_shared<EventHandler>(std::move(handler)) : nullptr;
     const std::lock_guard lock(_mutex);
@@ -304,12 +310,13 @@ void StreamListener::acceptOne() {
     }
     const auto user = peerUser(socket.get());
     if (!user) return;
-    auto slot = ConnectionCounts::take(_counts, *user);
-    if (!slot) return;
+    auto place = _budgets->connections->shareOf(*user);
+    if (!place.resize(1)) return;
     auto peer = identifyPeer(socket.get());
     if (!peer) return;
     HandshakingPeer::begin(std::make_shared<HandshakingPeer>(_loop, weak_from_this(), std::move(socket),
-                                                             *std::move(peer), *std::move(slot)));
+                                                             *std::move(peer), std::move(place)),
+                           _handshake);
 }
 
 /// Out of descriptors: the first in line is turned away with the spare one, or it would stay in line and wake the
@@ -329,8 +336,8 @@ void StreamListener::rest() {
     });
 }
 
-void StreamListener::accepted(Descriptor socket, AuditToken peer, ConnectionCounts::Slot slot) {
-    deliver(std::make_shared<StreamConnection>(_loop, std::move(socket), std::move(peer), std::move(slot)));
+void StreamListener::accepted(Descriptor socket, AuditToken peer, Budget::Share place) {
+    deliver(std::make_shared<StreamConnection>(_loop, std::move(socket), std::move(peer), std::move(place), *_budgets));
 }
 
 void StreamListener::deliver(Event event) {

@@ -3,8 +3,10 @@
 #include "platform/Transport.h"
 #include "platform/linux/Descriptor.h"
 #include "platform/linux/TransportConnection.h"
+#include "platform/linux/TransportLimits.h"
 #include "platform/linux/TransportLoop.h"
 
+#include <chrono>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -17,14 +19,16 @@ class StreamListener final : public platform::Listener,
                              public Pollable,
                              public std::enable_shared_from_this<StreamListener> {
 public:
-    StreamListener(std::shared_ptr<Loop> loop, std::shared_ptr<ConnectionCounts> counts,
-                   std::shared_ptr<WorkQueue> queue);
+    /// Peers have `handshake` long to show who they are.
+    StreamListener(std::shared_ptr<Loop> loop, std::shared_ptr<const Budgets> budgets,
+                   std::chrono::milliseconds handshake, std::shared_ptr<WorkQueue> queue);
     ~StreamListener() override;
 
     /// Takes the name: the socket that the service manager passed in, else a new one in `directory`. Before `resume`,
     /// once. A failure is kept for the handler.
     void open(const std::string& directory, const std::string& serviceName);
 
+    std::optional<std::string> refusal() const override;
     void setEventHandler(EventHandler handler) override;
     void resume() override;
     void cancel() override;
@@ -33,7 +37,7 @@ public:
     void shutDown() override;
 
     /// A peer has shown who it is. On the loop's thread.
-    void accepted(Descriptor socket, AuditToken peer, ConnectionCounts::Slot slot);
+    void accepted(Descriptor socket, AuditToken peer, Budget::Share place);
 
 private:
     bool adopt(const std::string& path, const std::string& serviceName);
@@ -46,7 +50,8 @@ private:
     void close();
 
     const std::shared_ptr<Loop> _loop;
-    const std::shared_ptr<ConnectionCounts> _counts;
+    const std::shared_ptr<const Budgets> _budgets;
+    const std::chrono::milliseconds _handshake;
     const std::shared_ptr<WorkQueue> _queue;
 
     // Set by `open`, then belonging to whoever closes: the loop's thread once resumed, else the last owner.

@@ -43,6 +43,7 @@ void Loop::stop() {
     const auto kept = std::exchange(_kept, {});
     for (const auto& [pointer, pollable] : kept) pollable->shutDown();
     _timers.clear();
+    _deadlines.clear();
     _dropped.clear();
 }
 
@@ -67,6 +68,7 @@ void Loop::drop(Pollable* pollable) {
     const auto found = _kept.find(pollable);
     if (found == _kept.end()) return;
     pollable->_kept = false;
+    if (pollable->_deadline) _deadlines.erase({*pollable->_deadline, pollable});
     std::erase(_again, pollable);
     _dropped.push_back(std::move(found->second));
     _kept.erase(found);
@@ -92,12 +94,17 @@ void Loop::after(std::chrono::milliseconds delay, Task task) {
     _timers.emplace_back(Clock::now() + delay, std::move(task));
 }
 
+void Loop::expire(Pollable* pollable, std::chrono::milliseconds delay) {
+    pollable->_deadline = Clock::now() + delay;
+    _deadlines.emplace(*pollable->_deadline, pollable);
+}
+
 int Loop::timeout() {
     if (_hasTasks || !_again.empty()) return 0;
-    if (_timers.empty()) return -1;
-    const auto first = std::min_element(_timers.begin(), _timers.end(),
-                                        [](const auto& left, const auto& right) { return left.first < right.first; });
-    const auto left = std::chrono::ceil<std::chrono::milliseconds>(first->first - Clock::now()).count();
+    auto first = _deadlines.empty() ? Clock::time_point::max() : _deadlines.begin()->first;
+    for (const auto& timer : _timers) first = std::min(first, timer.first);
+    if (first == Clock::time_point::max()) return -1;
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(first - Clock::now()).count();
     return static_cast<int>(std::clamp<std::int64_t>(left, 0, 60'000));
 }
 
@@ -126,6 +133,17 @@ void Loop::runTimers() {
     for (Task& task : tasks) task();
 }
 
+void Loop::runDeadlines() {
+    if (_deadlines.empty()) return;
+    const auto now = Clock::now();
+    while (!_deadlines.empty() && _deadlines.begin()->first <= now) {
+        Pollable* const pollable = _deadlines.begin()->second;
+        _deadlines.erase(_deadlines.begin());
+        pollable->_deadline.reset();
+        pollable->onDeadline();
+    }
+}
+
 void Loop::run() {
     _threadId = std::this_thread::get_id();
     std::array<epoll_event, 64> events;
@@ -144,6 +162,7 @@ void Loop::run() {
         }
         runTasks();
         runTimers();
+        runDeadlines();
         turns.swap(_again);
         for (Pollable* pollable : turns) {
             if (pollable->_kept && !_stopping) pollable->onTurn();

@@ -9,6 +9,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <span>
 #include <thread>
 #include <unordered_map>
@@ -25,15 +26,18 @@ public:
     virtual void onEvents(std::uint32_t events) = 0;
     /// A turn that was asked for with `Loop::again`.
     virtual void onTurn() {}
+    /// The time that `Loop::expire` gave has passed.
+    virtual void onDeadline() {}
     /// The transport is going away and the thread has ended: let go of everything, call no handler.
     virtual void shutDown() = 0;
 
 private:
     friend class Loop;
     bool _kept = false;
+    std::optional<std::chrono::steady_clock::time_point> _deadline;
 };
 
-/// The one I/O thread of a transport: an epoll set, tasks from other threads, a few timers.
+/// The one I/O thread of a transport: an epoll set, tasks from other threads, deadlines, a few timers.
 class Loop {
 public:
     using Task = std::function<void()>;
@@ -64,6 +68,8 @@ public:
     /// Asks for another turn after the others had theirs. `pollable` must be kept.
     void again(Pollable* pollable) { _again.push_back(pollable); }
     void after(std::chrono::milliseconds delay, Task task);
+    /// Gives `pollable` this long until it is dropped. `pollable` must be kept and have no deadline yet.
+    void expire(Pollable* pollable, std::chrono::milliseconds delay);
     /// For bytes that are used up before the next call of anything.
     std::span<char> scratch() { return _scratch; }
 
@@ -76,6 +82,7 @@ private:
     void run();
     void runTasks();
     void runTimers();
+    void runDeadlines();
     int timeout();
 
     Descriptor _epoll;
@@ -93,6 +100,7 @@ private:
     std::vector<std::shared_ptr<Pollable>> _dropped; // still named by events of this round
     std::vector<Pollable*> _again;
     std::vector<std::pair<Clock::time_point, Task>> _timers; // a handful: retries only
+    std::set<std::pair<Clock::time_point, Pollable*>> _deadlines;
     std::vector<char> _scratch;
 };
 

@@ -1,58 +1,41 @@
 #include "tests/support/TransportFake.h"
 
-#include <atomic>
 #include <deque>
 #include <functional>
 #include <map>
 #include <optional>
-#include <variant>
+#include <set>
 #include <vector>
 
 namespace support {
 
 using namespace platform;
 
-/// What all ends of one transport share. Its mutex guards them too, and is held by no one who calls a handler.
-struct FakeExchange {
+/// What all ends of one transport share.
+struct FakeExchange : std::enable_shared_from_this<FakeExchange> {
     using Step = std::function<void()>;
 
-    std::recursive_mutex mutex; // ends are destroyed, and tell each other so, under it
-    FakeTransport::Mode mode = FakeTransport::Mode::manual;
-    std::atomic<bool> isStopped = false;
-    bool isDelivering = false;
+    bool isStopped = false;
     bool refuses = false;
     std::deque<Step> line;
     std::set<std::string> allowed;
     std::map<std::string, std::weak_ptr<FakeListener>> listeners;
-    std::set<std::shared_ptr<FakeConnection>> keptConnections; // resumed and not invalid yet
-    std::set<std::shared_ptr<FakeListener>> keptListeners;
+    std::set<std::shared_ptr<Connection>> keptConnections; // resumed and not invalid yet
+    std::set<std::shared_ptr<Listener>> keptListeners;
     AuditToken peer;
-    std::shared_ptr<std::atomic<std::size_t>> activities = std::make_shared<std::atomic<std::size_t>>(0);
+    const std::shared_ptr<const void> activityMark = std::make_shared<int>(); // held by each activity
 
     void add(Step step) {
-        const std::lock_guard lock(mutex);
         if (!isStopped) line.push_back(std::move(step));
     }
-    /// To be called without the lock, after steps were added.
-    void settle() {
-        if (mode == FakeTransport::Mode::inPlace) deliver();
-    }
-    std::size_t deliver() {
-        std::size_t count = 0;
-        std::unique_lock lock(mutex);
-        if (isDelivering) return 0;
-        isDelivering = true;
-        while (!line.empty()) {
-            Step step = std::move(line.front());
-            line.pop_front();
-            lock.unlock();
-            step();
-            step = nullptr;
-            ++count;
-            lock.lock();
-        }
-        isDelivering = false;
-        return count;
+    /// Calls `handler` on `queue` unless the transport is gone by then. Without a queue, now.
+    template <class Handler, class Event>
+    void call(const std::shared_ptr<WorkQueue>& queue, Handler handler, const Event& event) {
+        if (!handler || isStopped) return;
+        if (!queue) return handler(event);
+        queue->async([self = shared_from_this(), handler = std::move(handler), event] {
+            if (!self->isStopped) handler(event);
+        });
     }
 };
 
@@ -67,350 +50,218 @@ Value copied(const Value& value) {
 
 const TransportError invalidError{TransportErrorKind::connectionInvalid, "Connection invalid"};
 
-class FakeActivity final : public KeepAliveActivity {
-public:
-    explicit FakeActivity(std::shared_ptr<std::atomic<std::size_t>> count) : _count(std::move(count)) { ++*_count; }
-    ~FakeActivity() override { --*_count; }
-
-private:
-    const std::shared_ptr<std::atomic<std::size_t>> _count;
+struct FakeActivity final : KeepAliveActivity {
+    explicit FakeActivity(std::shared_ptr<const void> held) : mark(std::move(held)) {}
+    const std::shared_ptr<const void> mark;
 };
 
-} // namespace
-
-class FakeToken final : public ReplyToken {
-public:
+struct FakeToken final : ReplyToken {
     FakeToken(std::weak_ptr<FakeConnection> from, std::weak_ptr<FakeConnection> to, std::uint64_t number)
         : sender(std::move(from)), receiver(std::move(to)), id(number) {}
     const std::weak_ptr<FakeConnection> sender; // waits for the reply
     const std::weak_ptr<FakeConnection> receiver;
     const std::uint64_t id;
-    std::atomic<bool> isUsed = false;
+    bool isUsed = false;
 };
+
+} // namespace
 
 class FakeListener final : public Listener, public std::enable_shared_from_this<FakeListener> {
 public:
     FakeListener(std::shared_ptr<FakeExchange> exchange, std::shared_ptr<WorkQueue> queue)
         : _exchange(std::move(exchange)), _queue(std::move(queue)) {}
 
+    std::optional<std::string> refusal() const override { return _refusal; }
+    void refuse(const std::string& reason) {
+        _refusal = reason;
+        arrive(TransportError{TransportErrorKind::other, reason});
+    }
     void setEventHandler(EventHandler handler) override {
-        const std::lock_guard lock(_exchange->mutex);
-        if (!_isCancelled) _handler = std::make_shared<EventHandler>(std::move(handler));
+        if (!_isCancelled) _handler = std::move(handler);
     }
     void resume() override {
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (_isResumed || _isCancelled) return;
-            _isResumed = true;
-            _exchange->keptListeners.insert(shared_from_this());
-            for (Event& event : std::exchange(_waiting, {})) add(std::move(event));
-        }
-        _exchange->settle();
+        if (_isCancelled || std::exchange(_isResumed, true)) return;
+        _exchange->keptListeners.insert(shared_from_this());
+        for (Event& event : std::exchange(_waiting, {})) arrive(std::move(event));
     }
     void cancel() override {
-        std::shared_ptr<EventHandler> handler;
-        std::vector<Event> waiting; // connections among them end when this goes
-        const std::lock_guard lock(_exchange->mutex);
         _isCancelled = true;
-        waiting.swap(_waiting);
-        handler.swap(_handler);
+        _waiting.clear(); // connections among them end
+        _handler = nullptr;
         _exchange->keptListeners.erase(shared_from_this());
     }
     bool isCancelled() const { return _isCancelled; }
 
-    /// With the lock held.
     void arrive(Event event) {
         if (_isCancelled) return;
-        if (_isResumed) return add(std::move(event));
-        _waiting.push_back(std::move(event));
-    }
-
-private:
-    void add(Event event) {
+        if (!_isResumed) return _waiting.push_back(std::move(event));
         _exchange->add([self = shared_from_this(), event = std::move(event)] {
-            self->_queue->async([self, event] {
-                std::shared_ptr<EventHandler> handler;
-                {
-                    const std::lock_guard lock(self->_exchange->mutex);
-                    if (!self->_exchange->isStopped) handler = self->_handler;
-                }
-                if (handler) (*handler)(event);
-            });
+            const EventHandler handle = [self](const Event& each) {
+                const EventHandler handler = self->_handler; // it may cancel this
+                if (handler) handler(each);
+            };
+            self->_exchange->call(self->_queue, handle, event);
         });
     }
 
+private:
     const std::shared_ptr<FakeExchange> _exchange;
     const std::shared_ptr<WorkQueue> _queue;
-    std::shared_ptr<EventHandler> _handler;
+    EventHandler _handler;
     std::vector<Event> _waiting;
+    std::optional<std::string> _refusal;
     bool _isResumed = false;
     bool _isCancelled = false;
 };
 
 class FakeConnection final : public Connection {
 public:
-    /// Without a queue it is an accepted one.
-    FakeConnection(std::shared_ptr<FakeExchange> exchange, std::shared_ptr<WorkQueue> queue)
-        : _exchange(std::move(exchange)), _queue(std::move(queue)) {}
-
+    /// Without a queue it is an accepted one. `service` is looked up when it is resumed.
+    FakeConnection(std::shared_ptr<FakeExchange> exchange, std::shared_ptr<WorkQueue> queue, AuditToken token,
+                   std::optional<std::string> service = std::nullopt)
+        : _exchange(std::move(exchange)),
+          _queue(std::move(queue)),
+          _service(std::move(service)),
+          _token(std::move(token)) {}
     ~FakeConnection() override {
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (!_isClosed) endOther();
-        }
-        _exchange->settle();
-        for (auto& [id, pending] : _pending) {
-            pending.queue->async([handler = std::move(pending.handler)] { handler(invalidError); });
-        }
-        finalize(std::move(_context), std::move(_finalizer));
+        _remains.handler = nullptr; // it never was resumed, or has heard its end
+        close();
     }
-
-    void join(const std::shared_ptr<FakeConnection>& other) { _other = other; }
-    void setService(std::string name) { _service = std::move(name); }
-    void setToken(AuditToken token) { _token = std::move(token); }
+    static void join(const std::shared_ptr<FakeConnection>& one, const std::shared_ptr<FakeConnection>& other) {
+        one->_other = other;
+        other->_other = one;
+    }
     std::shared_ptr<FakeConnection> other() const { return _other.lock(); }
 
-    std::int32_t peerPid() const override { return peerAuditToken().pid; }
-    AuditToken peerAuditToken() const override {
-        const std::lock_guard lock(_exchange->mutex);
-        return _token;
-    }
+    std::int32_t peerPid() const override { return _token.pid; }
+    AuditToken peerAuditToken() const override { return _token; }
+    std::string description() const override { return "<fake connection, pid " + std::to_string(_token.pid) + ">"; }
     void setContext(std::shared_ptr<void> context, std::function<void(std::shared_ptr<void>)> finalizer) override {
-        const std::lock_guard lock(_exchange->mutex);
-        _context.swap(context);
-        _finalizer.swap(finalizer);
+        _remains.context = std::move(context);
+        _remains.finalizer = std::move(finalizer);
     }
     void setEventHandler(EventHandler handler) override {
-        const std::lock_guard lock(_exchange->mutex);
-        if (!_isClosed) _handler = std::make_shared<EventHandler>(std::move(handler));
+        if (!_isClosed) _remains.handler = std::move(handler);
     }
-    std::string description() const override { return "<fake connection, pid " + std::to_string(peerPid()) + ">"; }
-
     void resume() override {
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (_isResumed) return;
-            _isResumed = true;
-            _exchange->keptConnections.insert(self());
-            if (_service) lookUp();
-            for (auto& step : std::exchange(_unsent, {})) step();
-            for (Arrival& arrival : std::exchange(_waiting, {})) arrive(std::move(arrival));
-        }
-        _exchange->settle();
+        if (std::exchange(_isResumed, true)) return;
+        _exchange->keptConnections.insert(self());
+        if (_service) lookUp();
+        for (auto& step : std::exchange(_unsent, {})) step();
+        for (auto& step : std::exchange(_waiting, {})) arrive(std::move(step));
     }
-
     void cancel() override {
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (_isCancelled) return;
-            _isCancelled = true;
-            endOther();
-            end();
-        }
-        _exchange->settle();
+        if (std::exchange(_isCancelled, true)) return;
+        endOther();
+        end();
     }
-
     void send(const ReplyMessage& reply) override {
         const auto token = std::dynamic_pointer_cast<FakeToken>(reply.token);
-        if (!token || token->receiver.lock().get() != this || token->isUsed.exchange(true)) return;
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            const auto sender = token->sender.lock();
-            if (!sender || _isClosed || _isCancelled) return;
-            sender->arrive(Answer{token->id, copied(reply.content)});
-        }
-        _exchange->settle();
+        if (!token || token->receiver.lock().get() != this || std::exchange(token->isUsed, true)) return;
+        const auto sender = token->sender.lock();
+        if (!sender || _isClosed || _isCancelled) return;
+        sender->arrive(
+            [to = sender.get(), id = token->id, content = copied(reply.content)] { to->answer(id, content); });
     }
-
     void sendWithReply(const Dictionary& message, std::shared_ptr<WorkQueue> queue, ReplyHandler handler) override {
         sendValue(message, std::move(queue), std::move(handler));
     }
-
     void sendValue(const Value& content, std::shared_ptr<WorkQueue> queue, ReplyHandler handler) {
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (_isClosed || _isCancelled) {
-                if (handler) queue->async([handler = std::move(handler)] { handler(invalidError); });
-                return;
-            }
-            const std::uint64_t id = _nextId++;
-            const bool expectsReply = handler != nullptr;
-            if (expectsReply) _pending.emplace(id, Pending{std::move(queue), std::move(handler)});
-            std::function<void()> step = [this, id, expectsReply, content = copied(content)] {
-                transmit(id, expectsReply, content);
-            };
-            if (_isResumed || !_service) {
-                step();
-            } else {
-                _unsent.push_back(std::move(step));
-            }
-        }
-        _exchange->settle();
+        if (_isClosed || _isCancelled) return _exchange->call(queue, std::move(handler), ReplyOrError(invalidError));
+        const std::uint64_t id = _nextId++;
+        const bool expectsReply = handler != nullptr;
+        if (expectsReply) _remains.pending.emplace(id, Pending{std::move(queue), std::move(handler)});
+        auto step = [this, id, expectsReply, content = copied(content)] { transmit(id, expectsReply, content); };
+        if (_isResumed || !_service) return step();
+        _unsent.emplace_back(std::move(step));
     }
 
-    void shutDownSending() {
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (const auto receiver = other()) {
-                receiver->hear(TransportError{TransportErrorKind::terminationImminent, "Peer sends no more"});
-            }
-        }
-        _exchange->settle();
+    /// `event` comes after all that was sent before.
+    void hear(ConnectionEvent event) {
+        arrive([this, event = std::move(event)] {
+            if (!_isClosed && !_isCancelled) _exchange->call(_queue, _remains.handler, event);
+        });
     }
-
-    /// With the lock held: `event` comes after all that was sent before.
-    void hear(ConnectionEvent event) { arrive(std::move(event)); }
-    /// With the lock held: this end becomes invalid after all that was sent before.
+    /// This end becomes invalid after all that was sent before.
     void end() {
-        if (_isEnding) return;
-        _isEnding = true;
-        arrive(End{});
-    }
-    void endOther() {
-        if (const auto receiver = other()) receiver->end();
+        if (!std::exchange(_isEnding, true)) arrive([this] { close(); });
     }
 
-    void drop() {
-        std::shared_ptr<EventHandler> handler;
-        std::map<std::uint64_t, Pending> pending;
-        std::shared_ptr<void> context;
-        std::function<void(std::shared_ptr<void>)> finalizer;
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            _isClosed = true;
-            handler.swap(_handler);
-            pending.swap(_pending);
-            context.swap(_context);
-            finalizer.swap(_finalizer);
+    /// Errors in place of replies, the last event, the finalizer.
+    void close() {
+        if (std::exchange(_isClosed, true)) return;
+        endOther();
+        Remains remains = std::exchange(_remains, {});
+        for (auto& [id, pending] : remains.pending) {
+            _exchange->call(pending.queue, std::move(pending.handler), ReplyOrError(invalidError));
         }
-        finalize(std::move(context), std::move(finalizer));
+        const bool isOnQueue = _queue && remains.handler && !_exchange->isStopped;
+        auto last = [exchange = _exchange, remains = std::move(remains)]() mutable {
+            if (remains.handler && !exchange->isStopped) remains.handler(invalidError);
+            remains.handler = nullptr;
+            if (remains.finalizer) remains.finalizer(std::move(remains.context));
+        };
+        if (isOnQueue) {
+            _queue->async(std::move(last));
+        } else {
+            last();
+        }
+        std::erase_if(_exchange->keptConnections, [this](const auto& each) { return each.get() == this; });
     }
 
 private:
-    struct Answer {
-        std::uint64_t id;
-        Value content;
-    };
-    struct End {};
-    using Arrival = std::variant<ConnectionEvent, Answer, End>;
     struct Pending {
         std::shared_ptr<WorkQueue> queue;
         ReplyHandler handler;
     };
+    /// What is given up when the connection becomes invalid.
+    struct Remains {
+        EventHandler handler;
+        std::map<std::uint64_t, Pending> pending;
+        std::shared_ptr<void> context;
+        std::function<void(std::shared_ptr<void>)> finalizer;
+    };
 
     std::shared_ptr<FakeConnection> self() { return std::static_pointer_cast<FakeConnection>(shared_from_this()); }
 
-    static void finalize(std::shared_ptr<void> context, std::function<void(std::shared_ptr<void>)> finalizer) {
-        if (finalizer) finalizer(std::move(context));
+    void endOther() {
+        if (const auto other = _other.lock()) other->end();
     }
-
-    // With the lock held.
-    void arrive(Arrival arrival) {
-        if (!_isResumed) return _waiting.push_back(std::move(arrival));
-        _exchange->add([receiver = self(), arrival = std::move(arrival)] { receiver->take(arrival); });
+    void arrive(FakeExchange::Step step) {
+        if (!_isResumed) return _waiting.push_back(std::move(step));
+        _exchange->add([receiver = self(), step = std::move(step)] { step(); });
     }
     void lookUp() {
         const auto found = _exchange->listeners.find(*_service);
         const auto listener = found == _exchange->listeners.end() ? nullptr : found->second.lock();
         if (!listener || listener->isCancelled() || _exchange->refuses) return end();
-        auto accepted = std::make_shared<FakeConnection>(_exchange, nullptr);
-        accepted->setToken(_exchange->peer);
-        accepted->join(self());
-        join(accepted);
+        auto accepted = std::make_shared<FakeConnection>(_exchange, nullptr, _exchange->peer);
+        join(accepted, self());
         listener->arrive(std::shared_ptr<Connection>(accepted));
     }
     void transmit(std::uint64_t id, bool expectsReply, const Value& content) {
         const auto receiver = other();
         if (!receiver) return end();
-        auto token = expectsReply ? std::make_shared<FakeToken>(weak(), receiver->weak(), id) : nullptr;
-        receiver->hear(ReceivedMessage{content, std::move(token)});
+        receiver->hear(
+            ReceivedMessage{content, expectsReply ? std::make_shared<FakeToken>(self(), receiver, id) : nullptr});
     }
-    std::weak_ptr<FakeConnection> weak() { return self(); }
-
-    void take(const Arrival& arrival) {
-        if (const auto* event = std::get_if<ConnectionEvent>(&arrival)) {
-            callHandler(*event);
-        } else if (const auto* reply = std::get_if<Answer>(&arrival)) {
-            answer(reply->id, reply->content);
-        } else {
-            becomeInvalid();
-        }
-    }
-
-    void callHandler(const ConnectionEvent& event) {
-        std::shared_ptr<EventHandler> handler;
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (_isClosed || _isCancelled) return;
-            handler = _handler;
-        }
-        if (!handler) return;
-        if (!_queue) return (*handler)(event);
-        _queue->async([exchange = _exchange, handler, event] {
-            if (!exchange->isStopped) (*handler)(event);
-        });
-    }
-
     void answer(std::uint64_t id, const Value& content) {
-        std::optional<Pending> pending;
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            const auto found = _pending.find(id);
-            if (found == _pending.end() || _isCancelled) return;
-            pending = std::move(found->second);
-            _pending.erase(found);
-        }
-        pending->queue->async([exchange = _exchange, handler = std::move(pending->handler), content] {
-            if (!exchange->isStopped) handler(*content.dictionary());
-        });
+        const auto found = _isCancelled ? decltype(_remains.pending)::node_type() : _remains.pending.extract(id);
+        if (found) _exchange->call(found.mapped().queue, found.mapped().handler, ReplyOrError(*content.dictionary()));
     }
-
-    void becomeInvalid() {
-        std::shared_ptr<EventHandler> handler;
-        std::map<std::uint64_t, Pending> pending;
-        {
-            const std::lock_guard lock(_exchange->mutex);
-            if (_isClosed) return;
-            _isClosed = true;
-            endOther();
-            handler.swap(_handler);
-            pending.swap(_pending);
-            _exchange->keptConnections.erase(self());
-        }
-        for (auto& [id, waiting] : pending) {
-            waiting.queue->async([exchange = _exchange, reply = std::move(waiting.handler)] {
-                if (!exchange->isStopped) reply(invalidError);
-            });
-        }
-        auto last = [connection = self(), handler = std::move(handler)]() mutable {
-            if (handler && !connection->_exchange->isStopped) (*handler)(invalidError);
-            handler.reset();
-            connection->drop();
-        };
-        if (_queue) {
-            _queue->async(std::move(last));
-        } else {
-            last();
-        }
-    }
-
     const std::shared_ptr<FakeExchange> _exchange;
     const std::shared_ptr<WorkQueue> _queue;
-    // Guarded by the exchange's mutex.
-    std::optional<std::string> _service; // still to be looked up when resumed
+    const std::optional<std::string> _service;
+    const AuditToken _token;
     std::weak_ptr<FakeConnection> _other;
-    AuditToken _token;
     bool _isResumed = false;
     bool _isCancelled = false;
     bool _isEnding = false;
     bool _isClosed = false;
     std::uint64_t _nextId = 1;
-    std::map<std::uint64_t, Pending> _pending;
-    std::vector<std::function<void()>> _unsent;
-    std::vector<Arrival> _waiting;
-    std::shared_ptr<EventHandler> _handler;
-    std::shared_ptr<void> _context;
-    std::function<void(std::shared_ptr<void>)> _finalizer;
+    std::vector<FakeExchange::Step> _unsent;
+    std::vector<FakeExchange::Step> _waiting;
+    Remains _remains;
 };
 
 namespace {
@@ -421,90 +272,63 @@ std::shared_ptr<FakeConnection> fake(const std::shared_ptr<Connection>& connecti
 
 } // namespace
 
-FakeTransport::FakeTransport(Mode mode) : _exchange(std::make_shared<FakeExchange>()) { _exchange->mode = mode; }
+FakeTransport::FakeTransport() : _exchange(std::make_shared<FakeExchange>()) {}
 
 FakeTransport::~FakeTransport() {
-    std::deque<FakeExchange::Step> line;
-    std::set<std::shared_ptr<FakeConnection>> connections;
-    std::set<std::shared_ptr<FakeListener>> listeners;
-    {
-        const std::lock_guard lock(_exchange->mutex);
-        _exchange->isStopped = true;
-        line.swap(_exchange->line);
-        connections.swap(_exchange->keptConnections);
-        listeners.swap(_exchange->keptListeners);
+    _exchange->isStopped = true;
+    _exchange->line.clear();
+    for (const auto& connection : std::exchange(_exchange->keptConnections, {})) fake(connection)->close();
+    for (const auto& listener : std::exchange(_exchange->keptListeners, {})) listener->cancel();
+}
+
+void FakeTransport::allowService(const std::string& name) { _exchange->allowed.insert(name); }
+void FakeTransport::setPeer(AuditToken peer) { _exchange->peer = std::move(peer); }
+void FakeTransport::refuseConnections() { _exchange->refuses = true; }
+
+std::size_t FakeTransport::deliver() {
+    std::size_t count = 0;
+    for (; !_exchange->line.empty(); ++count) {
+        const FakeExchange::Step step = std::move(_exchange->line.front());
+        _exchange->line.pop_front();
+        step();
     }
-    for (const auto& connection : connections) connection->drop();
-    for (const auto& listener : listeners) listener->cancel();
+    return count;
 }
-
-void FakeTransport::allowService(const std::string& name) {
-    const std::lock_guard lock(_exchange->mutex);
-    _exchange->allowed.insert(name);
-}
-
-void FakeTransport::setPeer(AuditToken peer) {
-    const std::lock_guard lock(_exchange->mutex);
-    _exchange->peer = std::move(peer);
-}
-
-void FakeTransport::refuseConnections(bool refuse) {
-    const std::lock_guard lock(_exchange->mutex);
-    _exchange->refuses = refuse;
-}
-
-std::size_t FakeTransport::deliver() { return _exchange->deliver(); }
 
 std::pair<std::shared_ptr<Connection>, std::shared_ptr<Connection>>
 FakeTransport::makePair(AuditToken peer, std::shared_ptr<WorkQueue> queue) {
-    auto client = std::make_shared<FakeConnection>(_exchange, std::move(queue));
-    auto accepted = std::make_shared<FakeConnection>(_exchange, nullptr);
-    accepted->setToken(std::move(peer));
-    client->join(accepted);
-    accepted->join(client);
+    const auto client = std::make_shared<FakeConnection>(_exchange, std::move(queue), AuditToken());
+    const auto accepted = std::make_shared<FakeConnection>(_exchange, nullptr, std::move(peer));
+    FakeConnection::join(client, accepted);
     return {client, accepted};
 }
 
-void FakeTransport::sendValue(const std::shared_ptr<Connection>& from, const Value& content,
-                              std::shared_ptr<WorkQueue> queue, Connection::ReplyHandler handler) {
-    fake(from)->sendValue(content, std::move(queue), std::move(handler));
+void FakeTransport::sendValue(const std::shared_ptr<Connection>& from, const Value& content) {
+    fake(from)->sendValue(content, nullptr, nullptr);
 }
 
-void FakeTransport::shutDownSending(const std::shared_ptr<Connection>& from) { fake(from)->shutDownSending(); }
-
-void FakeTransport::inject(const std::shared_ptr<Connection>& to, ConnectionEvent event) {
-    {
-        const std::lock_guard lock(_exchange->mutex);
-        const auto* error = std::get_if<TransportError>(&event);
-        if (error && error->kind == TransportErrorKind::connectionInvalid) {
-            fake(to)->end();
-        } else {
-            fake(to)->hear(std::move(event));
-        }
-    }
-    _exchange->settle();
+void FakeTransport::shutDownSending(const std::shared_ptr<Connection>& from) {
+    const auto to = fake(from)->other();
+    if (to) to->hear(TransportError{TransportErrorKind::terminationImminent, "Peer sends no more"});
 }
 
 void FakeTransport::inject(const std::shared_ptr<Listener>& to, Listener::Event event) {
-    {
-        const std::lock_guard lock(_exchange->mutex);
-        std::dynamic_pointer_cast<FakeListener>(to)->arrive(std::move(event));
-    }
-    _exchange->settle();
+    std::dynamic_pointer_cast<FakeListener>(to)->arrive(std::move(event));
 }
 
-std::size_t FakeTransport::activityCount() const { return *_exchange->activities; }
+std::size_t FakeTransport::activityCount() const {
+    return static_cast<std::size_t>(_exchange->activityMark.use_count()) - 1;
+}
 
 std::shared_ptr<Listener> FakeTransport::createListener(const std::string& serviceName,
                                                         std::shared_ptr<WorkQueue> queue) {
-    const std::lock_guard lock(_exchange->mutex);
     auto listener = std::make_shared<FakeListener>(_exchange, std::move(queue));
     auto& place = _exchange->listeners[serviceName];
     const auto owner = place.lock();
     if (owner && !owner->isCancelled()) {
-        listener->arrive(TransportError{TransportErrorKind::other, "service name taken: " + serviceName});
+        listener->refuse("service name taken: " + serviceName);
     } else if (!_exchange->allowed.contains(serviceName)) {
-        listener->arrive(TransportError{TransportErrorKind::other, "service not allowed: " + serviceName});
+        listener->refuse("service not allowed: " + serviceName);
     } else {
         place = listener;
     }
@@ -512,13 +336,11 @@ std::shared_ptr<Listener> FakeTransport::createListener(const std::string& servi
 }
 
 std::shared_ptr<Connection> FakeTransport::connect(const std::string& serviceName, std::shared_ptr<WorkQueue> queue) {
-    auto connection = std::make_shared<FakeConnection>(_exchange, std::move(queue));
-    connection->setService(serviceName);
-    return connection;
+    return std::make_shared<FakeConnection>(_exchange, std::move(queue), AuditToken(), serviceName);
 }
 
 std::unique_ptr<KeepAliveActivity> FakeTransport::beginActivity(const std::string&) {
-    return std::make_unique<FakeActivity>(_exchange->activities);
+    return std::make_unique<FakeActivity>(_exchange->activityMark);
 }
 
 } // namespace support

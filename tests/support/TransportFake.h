@@ -4,8 +4,6 @@
 
 #include <cstddef>
 #include <memory>
-#include <mutex>
-#include <set>
 #include <string>
 #include <utility>
 
@@ -16,15 +14,10 @@ class FakeListener;
 struct FakeExchange;
 
 /// A transport within the process. What is sent is copied as over a wire and waits in one line, in the order sent,
-/// until it is delivered. Callable from any thread; handlers of accepted connections run on the thread that delivers.
+/// until it is delivered. On the test's thread alone; handlers of accepted connections run in `deliver`.
 class FakeTransport final : public platform::Transport {
 public:
-    enum class Mode {
-        manual,  // `deliver` delivers
-        inPlace, // everything is delivered at once, by the thread that sent it or one that is delivering already
-    };
-
-    explicit FakeTransport(Mode mode = Mode::manual);
+    FakeTransport();
     ~FakeTransport() override;
 
     /// Nobody may listen for a service that was not allowed.
@@ -32,7 +25,7 @@ public:
     /// Whom connections made from now on show to the other end.
     void setPeer(platform::AuditToken peer);
     /// As if nobody listened anywhere: connections that are resumed from now on are invalid.
-    void refuseConnections(bool refuse = true);
+    void refuseConnections();
 
     /// Delivers all that waits, and what is sent meanwhile. Answers how much.
     std::size_t deliver();
@@ -44,14 +37,11 @@ public:
 
     // What only a test does to an end of a connection, or to a listener. Everything waits in the line as messages do.
 
-    /// A message with any content; without a handler no reply is expected.
-    void sendValue(const std::shared_ptr<platform::Connection>& from, const platform::Value& content,
-                   std::shared_ptr<platform::WorkQueue> queue = nullptr,
-                   platform::Connection::ReplyHandler handler = nullptr);
+    /// A message with any content, without reply.
+    void sendValue(const std::shared_ptr<platform::Connection>& from, const platform::Value& content);
     /// The other end hears termination-imminent, and still replies.
     void shutDownSending(const std::shared_ptr<platform::Connection>& from);
-    /// `to` hears `event`, whatever that is. A connection-invalid error ends both ends.
-    void inject(const std::shared_ptr<platform::Connection>& to, platform::ConnectionEvent event);
+    /// `to` hears `event`, whatever that is.
     void inject(const std::shared_ptr<platform::Listener>& to, platform::Listener::Event event);
 
     std::size_t activityCount() const;
