@@ -58,6 +58,14 @@ struct FakePlatform {
         containers.allow("com.nordane.zbd", "/containers/com.nordane.zbd");
         processLog.clear();
     }
+
+    /// This platform, but with services that do their work on other threads.
+    platform::Platform with(platform::WorkQueues& otherQueues, platform::Transport& otherTransport,
+                            platform::Notifications& otherNotifications) {
+        return {otherQueues, runLoop,         otherTransport,  registry,       serviceManager,     sandbox, codeSigning,
+                bundles,     interfaces,      preferences,     containers,     otherNotifications, locale,  processes,
+                files,       typeConformance, activationRules, privacyConsent, processAssertions};
+    }
 };
 
 /// The text of a file URL, or a path: what most tests say of a plug-in.
