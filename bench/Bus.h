@@ -94,19 +94,9 @@ public:
     bool isAvailable() const { return _client != nullptr; }
 
     double roundTrip(double seconds) {
-        const auto call = [&] {
+        return meanMicroseconds(seconds, [&] {
             if (!callBus(_client.get(), _replySize)) fail("the bus call failed");
-        };
-        for (int i = 0; i < 20; ++i) call();
-        std::size_t count = 0;
-        const double start = secondsNow();
-        double end = start;
-        do {
-            for (int i = 0; i < 20; ++i) call();
-            count += 20;
-            end = secondsNow();
-        } while (end - start < seconds);
-        return (end - start) / static_cast<double>(count) * 1e6;
+        });
     }
 
 private:

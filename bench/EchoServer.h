@@ -1,5 +1,6 @@
 #pragma once
 
+#include "bench/Load.h"
 #include "bench/Socket.h"
 
 #include <condition_variable>
@@ -125,6 +126,24 @@ private:
     std::mutex _mutex;
     std::condition_variable _arrived;
     std::vector<Request> _requests; // guarded by _mutex
+};
+
+/// The echo in a process of its own.
+class EchoProcess {
+public:
+    /// `self` is this program, which knows the role "echo".
+    EchoProcess(const std::string& self, std::string path, std::size_t replySize)
+        : _path(std::move(path)),
+          _replySize(replySize),
+          _process({self, "echo", _path, std::to_string(replySize)}, {}) {}
+
+    /// The same requests, answered by the echo.
+    Target targetLike(const Target& target) { return {_path, _process, target.requests, _replySize}; }
+
+private:
+    std::string _path;
+    std::size_t _replySize;
+    Process _process;
 };
 
 } // namespace bench

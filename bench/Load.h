@@ -1,6 +1,7 @@
 #pragma once
 
 #include "bench/Socket.h"
+#include "bench/Timing.h"
 
 #include <functional>
 #include <list>
@@ -14,37 +15,29 @@ namespace bench {
 struct Target {
     std::string path;
     Process& server;
-    const std::vector<std::string>& requests;
+    std::vector<std::string> requests;
     std::size_t replySize; // of every reply; another size means that something else was measured
 };
 
 /// Mean microseconds from request to reply, one client that waits for each. `use` gets each reply's body.
-inline double roundTrip(const Target& target, double seconds, const std::function<void(std::string_view)>& use) {
+inline double roundTrip(const Target& target, double seconds,
+                        const std::function<void(std::string_view)>& use = nullptr) {
     const Descriptor socket = connectTo(target.path, target.server);
     FrameReader reader;
     std::size_t count = 0;
-    const auto ask = [&] {
+    return meanMicroseconds(seconds, [&] {
         sendAll(socket.get(), target.requests[count++ % target.requests.size()]);
         const qmx::Frame reply = reader.next(socket.get());
         if (reader.frameSize() != target.replySize) fail("a reply of another size");
         if (use) use(reply.body);
-    };
-    for (int i = 0; i < 100; ++i) ask();
-    count = 0;
-    const double start = secondsNow();
-    double end = start;
-    do {
-        for (int i = 0; i < 50; ++i) ask();
-        end = secondsNow();
-    } while (end - start < seconds);
-    return (end - start) / static_cast<double>(count) * 1e6;
+    });
 }
 
 /// Replies per second to `clients` connections that each keep `depth` requests waiting.
 inline double throughput(const Target& target, std::size_t clients, std::size_t depth, double seconds) {
     struct Client {
         Descriptor socket;
-        std::string buffer;
+        Inbox inbox;
     };
     const Descriptor epoll(epoll_create1(EPOLL_CLOEXEC));
     std::list<Client> all;
@@ -74,13 +67,12 @@ inline double throughput(const Target& target, std::size_t clients, std::size_t 
         const int count = epoll_wait(epoll.get(), events.data(), static_cast<int>(events.size()), -1);
         for (int i = 0; i < count; ++i) {
             Client& client = *static_cast<Client*>(events[static_cast<std::size_t>(i)].data.ptr);
-            receiveSome(client.socket.get(), client.buffer);
-            const std::size_t replies = client.buffer.size() / target.replySize;
+            client.inbox.receive(client.socket.get());
+            const std::size_t replies = client.inbox.bytes().size() / target.replySize;
             for (std::size_t reply = 0; reply < replies; ++reply) {
-                const auto scan = qmx::scanFrame(std::string_view(client.buffer).substr(reply * target.replySize));
-                if (scan.size != target.replySize) fail("a reply of another size");
+                if (qmx::scanFrame(client.inbox.bytes()).size != target.replySize) fail("a reply of another size");
+                client.inbox.take(target.replySize);
             }
-            client.buffer.erase(0, replies * target.replySize);
             waiting -= replies;
             if (isOver) continue;
             answered += replies;

@@ -47,6 +47,7 @@ public:
     Process(const Process&) = delete;
     Process& operator=(const Process&) = delete;
 
+    pid_t pid() const { return _pid; }
     bool isRunning() {
         if (_pid > 0 && waitpid(_pid, &_status, WNOHANG) == _pid) _pid = -1;
         return _pid > 0;

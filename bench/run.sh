@@ -4,4 +4,7 @@ set -euo pipefail
 
 build=$(cd "${1:?usage: bench/run.sh BUILD-DIRECTORY [ROUNDS [SECONDS]]}" && pwd)
 shift
-exec "$build/bench/FindBench" "$build/bin/zbd" "$@"
+for name in Find Discovery Activation; do
+    printf "\n### %s\n\n" "$name"
+    "$build/bench/${name}Bench" "$build/bin/zbd" "$@"
+done
