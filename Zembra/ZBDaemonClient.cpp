@@ -18,8 +18,8 @@ using platform::Value;
 
 namespace {
 
-/// A buffer beyond this is given back: an answer of thousands of forms is rare.
-constexpr std::size_t keptBufferSize = std::size_t{1} << 20U;
+/// A buffer beyond this is given back: an answer of thousands of forms is rare, one of a thousand is not.
+constexpr std::size_t keptBufferSize = std::size_t{4} << 20U;
 
 bool hasPropertyListEncoding(std::uint64_t version) { return version == currentVersion; }
 
@@ -77,7 +77,7 @@ std::optional<Value> ZBDaemonClient::convertToQMX(const Value& value, std::uint6
     bytes.clear();
     platform::appendCompact(bytes, value);
     Value data = Value::data(bytes);
-    if (bytes.capacity() > keptBufferSize) bytes = std::string();
+    if (bytes.capacity() > keptBufferSize) std::string().swap(bytes); // assigning a short text would keep the buffer
     return data;
 }
 

@@ -455,7 +455,6 @@ void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, C
         }
     }
     std::vector<std::shared_ptr<InstalledPlugIn>> added;
-    PlugIns replaced; // what plug-ins were that stay who they are with another content
     for (const auto& [path, seen] : found.plugIns) {
         const auto known = lookUp(_plugIns, path);
         const auto application = lookUp(_applications, seen.application);
@@ -475,7 +474,10 @@ void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, C
             plugIn->uuid = known->uuid;
             plugIn->originalIdentifier = known->originalIdentifier;
             plugIn->registered = known->registered;
-            if (known->facts->fingerprint != seen.facts->fingerprint) replaced.emplace(path, known);
+            if (known->facts->fingerprint != seen.facts->fingerprint) {
+                change.replaced.emplace(path, known);
+                change.renewed.emplace(path, plugIn);
+            }
             _plugIns[path] = std::move(plugIn);
             _unsavedPlugIns.insert(path);
             change.isChanged = true;
@@ -493,12 +495,6 @@ void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, C
         _plugIns[plugIn->path] = plugIn;
         _unsavedPlugIns.insert(plugIn->path);
         change.installed.emplace(plugIn->path, plugIn);
-    }
-    // Whoever made something of the old content has to hear that it is gone: an entitlement that was withdrawn must not
-    // live on in a record.
-    for (const auto& [path, plugIn] : replaced) {
-        change.removed.emplace(path, plugIn);
-        change.installed.emplace(path, _plugIns[path]);
     }
     if (!change.removed.empty() || !change.installed.empty()) change.isChanged = true;
 

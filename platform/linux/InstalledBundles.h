@@ -24,6 +24,10 @@ public:
     struct Change {
         PlugIns removed;
         PlugIns installed;
+        // Plug-ins that stay who they are with another content, which shows from one moment to the next: what they
+        // were, and what they are.
+        PlugIns replaced;
+        PlugIns renewed;
         bool isChanged = false; // anything that the registry tells about anything
     };
 

@@ -300,7 +300,11 @@ private:
         const auto observers =
             show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
         if (change.installed.empty() || isStart) tellRemoved(observers, change.removed);
+        // Whoever made something of the old content has to hear that it is gone: an entitlement that was withdrawn must
+        // not live on in a record.
+        tellRemoved(observers, change.replaced);
         tellInstalled(observers, change.installed);
+        tellInstalled(observers, change.renewed);
         if (!change.removed.empty()) discardContainers();
     }
 
