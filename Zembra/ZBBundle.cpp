@@ -94,4 +94,9 @@ std::optional<std::string> ZBBundle::executablePath() const {
 
 std::optional<std::string> ZBBundle::plugInsPath() const { return bundleDirectory("PlugIns"); }
 
+std::string ZBBundle::description() const {
+    const auto bundle = _bundle.get();
+    return bundle ? bundle->description() : std::string();
+}
+
 } // namespace zembra

@@ -37,6 +37,8 @@ public:
     /// The path itself for a bundle without an executable.
     std::optional<std::string> executablePath() const;
     std::optional<std::string> plugInsPath() const;
+    /// For messages; empty for no bundle.
+    std::string description() const;
 
 private:
     explicit ZBBundle(std::shared_ptr<const platform::BundleObject> bundle);

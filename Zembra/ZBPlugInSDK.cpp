@@ -5,7 +5,9 @@
 #include "Zembra/ZBUtilities.h"
 #include "platform/Registry.h"
 
-#include <algorithm>
+#include <string>
+#include <unordered_set>
+#include <utility>
 #include <vector>
 
 namespace zembra {
@@ -66,9 +68,14 @@ bool ZBPlugInCore::sdkOverridesKey(std::string_view key) { return key == manifes
 
 Array ZBPlugInCore::mergeSharedResources(const Array& sdk, const Array& plugIn) {
     std::vector<Value> united;
+    // Told apart by their encodings: a manifest holds tens of thousands of elements, too many to compare with each
+    // other.
+    std::unordered_set<std::string> known;
     for (const Array& side : {plugIn, sdk}) {
         for (const Value& resource : side) {
-            if (std::find(united.begin(), united.end(), resource) == united.end()) united.push_back(resource);
+            std::string encoding;
+            platform::appendCompact(encoding, resource);
+            if (known.insert(std::move(encoding)).second) united.push_back(resource);
         }
     }
     return Array(std::move(united));

@@ -5,17 +5,25 @@
 
 namespace zembra {
 
+namespace {
+
+/// What stands in messages for a token: it is worth what it names to whoever reads it, also where logs show what is
+/// private.
+constexpr const char* hiddenToken = "<token>";
+
+} // namespace
+
 platform::Result<std::string> issueFileReadToken(platform::Sandbox& sandbox, const platform::URL& url,
                                                  const std::string& within) {
     auto token =
         sandbox.issueFile(platform::sandboxReadExtensionClass, url.path(), platform::SandboxFlag::canonical, within);
-    if (token) log::sandbox().debug("issued file extension for %s -> %s", url.path(), *token);
+    if (token) log::sandbox().debug("issued file extension for %s -> %s", url.path(), hiddenToken);
     return token;
 }
 
 platform::Result<std::string> issueServiceLookupToken(platform::Sandbox& sandbox, const std::string& service) {
     auto token = sandbox.issueService(serviceExtensionClass, service);
-    if (token) log::sandbox().debug("issued mach extension for %s -> %s", service, *token);
+    if (token) log::sandbox().debug("issued mach extension for %s -> %s", service, hiddenToken);
     return token;
 }
 
@@ -35,9 +43,9 @@ void ZBSandboxExtension::consume() {
     int errorNumber = 0;
     _handle = _sandbox.consume(token, errorNumber);
     if (_handle != -1) {
-        log::sandbox().debug("consuming extension %s -> %ld", token, _handle);
+        log::sandbox().debug("consuming extension %s -> %ld", hiddenToken, _handle);
     } else {
-        log::sandbox().notice("failed to consume extension %s - errno=%d", token, errorNumber);
+        log::sandbox().notice("failed to consume extension %s - errno=%d", hiddenToken, errorNumber);
     }
 }
 

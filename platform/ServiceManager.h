@@ -1,9 +1,9 @@
 #pragma once
 
 #include "platform/PropertyList.h"
+#include "platform/Transport.h"
 #include "platform/WorkQueue.h"
 
-#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -21,7 +21,7 @@ public:
     /// Registers the executable as a service that the host process, and no other, may start until it ends. `overlay`
     /// is the plug-in's service description ("QMXService") with environment and sandbox profile. A later registration
     /// of the same executable for the same host replaces the earlier one. Returns 0 or an error number (errno.h).
-    virtual int addExternalServiceForHost(std::int32_t host, const std::string& executablePath,
+    virtual int addExternalServiceForHost(const AuditToken& host, const std::string& executablePath,
                                           const Dictionary& overlay) = 0;
     /// Ends the running instances of the service of that bundle identifier and version. `completion` runs exactly
     /// once, on `queue`, after the instances ended. Returns at once.

@@ -26,7 +26,7 @@ struct Selection {
 
 /// Why a candidate is dropped.
 struct Rejection {
-    std::string reason;                     // for people
+    std::string reason;                                  // for people
     std::optional<RuleMismatch> mismatch = std::nullopt; // when rules decided
 };
 

@@ -103,12 +103,15 @@ platform::Failure ZBDPlugIn::enableForClient(const ZBDQmxClient& host,
     const auto executable = bundle ? bundle->stringProperty(platform::BundleProperty::executablePath) : std::nullopt;
     if (!executable) {
         log::ops().error("failed to obtain execPath for plug-in %@(%{public}@) bundle=%@", *this, uuidText(),
-                         bundle ? zembra::valueOrAbsent(bundle->path()) : Value());
+                         bundle ? Value(bundle->description()) : Value());
         return zembra::errorWithCode(zembra::code::malformed, "cannot obtain executable path for plug-in %@(%@)",
                                      identifier(), uuidText());
     }
     log::ops().debug("activation overlay=%@", overlay);
-    const int error = _platform.serviceManager.addExternalServiceForHost(host.pid(), *executable, overlay);
+    // A host that is gone has no token; its pid may be another process's by now.
+    const auto connection = host.connection();
+    const auto process = connection ? connection->peerAuditToken() : platform::AuditToken();
+    const int error = _platform.serviceManager.addExternalServiceForHost(process, *executable, overlay);
     if (error == 0) return std::nullopt;
     log::ops().error("ignitd error %d trying to allow %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", error,
                      host.pid(), host.path(), identifier(), version(), uuidText(), path());

@@ -81,7 +81,6 @@ Failure LandlockRules::allow(int place, unsigned rights) {
     if (::fstat(place, &status) != 0) return systemError(errno, "landlock");
     std::uint64_t allowed = 0;
     if ((rights & readFiles) != 0) allowed |= readRights;
-    if ((rights & listDirectories) != 0) allowed |= LANDLOCK_ACCESS_FS_READ_DIR;
     if ((rights & writeFiles) != 0) allowed |= writeRights;
     if ((rights & executeFiles) != 0) allowed |= LANDLOCK_ACCESS_FS_EXECUTE;
     if ((rights & changeFiles) != 0) allowed |= changeRights;

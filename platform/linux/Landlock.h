@@ -20,7 +20,6 @@ enum FileRights : unsigned {
     writeFiles = 2,   // that exist
     executeFiles = 4, // also as the loader of another program
     changeFiles = 8,  // write, make, rename and remove anything but devices
-    listDirectories = 16,
 };
 
 /// A set of Landlock rules: everything that has no rule is forbidden, and so are signals to processes outside and

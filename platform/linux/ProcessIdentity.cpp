@@ -5,6 +5,7 @@
 #include <charconv>
 #include <fcntl.h>
 #include <poll.h>
+#include <sstream>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -12,15 +13,15 @@ namespace platform::linux_ {
 
 namespace {
 
-constexpr std::size_t maximumStatSize = 4096; // of /proc/<pid>/stat
-// Fields of that file, see proc(5).
+constexpr std::size_t maximumFileSize = 8192; // of what is read here below /proc/<pid>
+// Fields of "stat", see proc(5).
 constexpr int parentField = 4;
 constexpr int startTimeField = 22;
 
-std::optional<std::string> readStat(pid_t pid) {
-    const Descriptor file(::open(("/proc/" + std::to_string(pid) + "/stat").c_str(), O_RDONLY | O_CLOEXEC));
+std::optional<std::string> readFileOf(pid_t pid, const char* name) {
+    const Descriptor file(::open(("/proc/" + std::to_string(pid) + '/' + name).c_str(), O_RDONLY | O_CLOEXEC));
     if (!file) return std::nullopt;
-    std::string text(maximumStatSize, '\0');
+    std::string text(maximumFileSize, '\0');
     ssize_t size = 0;
     do size = ::read(file.get(), text.data(), text.size());
     while (size < 0 && errno == EINTR);
@@ -47,7 +48,7 @@ std::optional<pid_t> pidOf(std::string_view text) {
 } // namespace
 
 std::optional<ProcessIdentity> ProcessIdentity::of(pid_t pid) {
-    const auto stat = readStat(pid);
+    const auto stat = readFileOf(pid, "stat");
     auto time = stat ? fieldOf(*stat, startTimeField) : std::nullopt;
     if (!time) return std::nullopt;
     return ProcessIdentity{pid, *std::move(time)};
@@ -66,7 +67,7 @@ std::optional<ProcessIdentity> ProcessIdentity::named(std::string_view name) {
 
 std::optional<ProcessIdentity> parentOf(const ProcessIdentity& process) {
     const auto parentNow = [&process]() -> std::optional<pid_t> {
-        const auto stat = readStat(process.pid);
+        const auto stat = readFileOf(process.pid, "stat");
         if (!stat || fieldOf(*stat, startTimeField) != process.startTime) return std::nullopt;
         const auto text = fieldOf(*stat, parentField);
         return text ? pidOf(*text) : std::nullopt;
@@ -76,6 +77,19 @@ std::optional<ProcessIdentity> parentOf(const ProcessIdentity& process) {
     // A process whose parent ends gets another one at once. So if it is the same now, that pid was the parent's when
     // the start time was read.
     return parentNow() == pid ? parent : std::nullopt;
+}
+
+std::optional<uid_t> ownerOf(pid_t pid) {
+    const auto status = readFileOf(pid, "status");
+    // The program's name comes before, and cannot hold the line break that would let it pass for this line.
+    const std::size_t line = status ? status->find("\nUid:") : std::string::npos;
+    if (line == std::string::npos) return std::nullopt;
+    std::istringstream fields(status->substr(line + std::string_view("\nUid:").size()));
+    uid_t real = 0;
+    uid_t effective = 0;
+    uid_t saved = 0;
+    if (!(fields >> real >> effective >> saved) || real != effective || real != saved) return std::nullopt;
+    return real;
 }
 
 Descriptor openProcess(pid_t pid) { return Descriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0))); }

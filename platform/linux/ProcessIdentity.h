@@ -27,6 +27,10 @@ struct ProcessIdentity {
 /// The parent of the process, in the same moment. None when one of them is gone.
 std::optional<ProcessIdentity> parentOf(const ProcessIdentity& process);
 
+/// The user whom the process belongs to, now. None when it is gone, or is between users: its real, effective and saved
+/// one differ while it runs, or did run, a set-user-id program.
+std::optional<uid_t> ownerOf(pid_t pid);
+
 /// A pidfd; not open, with errno set, on failure. Unlike the library's wrapper it is declared for C++ everywhere.
 Descriptor openProcess(pid_t pid);
 /// A pidfd of this very process. ESRCH when it has ended.

@@ -72,6 +72,9 @@ Failure RequestSocket::listen(const Root& root) {
     _listener = Descriptor(socket(AF_UNIX, _address.type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     Descriptor probe(socket(AF_UNIX, _address.type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!_stop || !_listener || !probe) return systemError(errno, path);
+    // Accepted connections have it from the listener: every request comes with its sender.
+    const int isOn = 1;
+    if (setsockopt(_listener.get(), SOL_SOCKET, SO_PASSCRED, &isOn, sizeof isOn) != 0) return systemError(errno, path);
 
     // Nobody listens at what a killed daemon left behind.
     if (connectTo(probe.get(), _directory.get(), _address.name) == ECONNREFUSED)
@@ -140,11 +143,25 @@ void RequestSocket::acceptWaiting() {
     }
 }
 
-std::optional<std::string> receiveRequest(int connection, std::size_t limit) {
-    std::string request(limit + 1, '\0');
-    const ssize_t size = recv(connection, request.data(), request.size(), MSG_DONTWAIT);
+std::optional<Request> receiveRequest(int connection, std::size_t limit) {
+    Request request{std::string(limit + 1, '\0')};
+    // The sender comes first and fills it; descriptors that a peer sends along have no room and are closed.
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))] = {};
+    iovec part{request.text.data(), request.text.size()};
+    msghdr message{};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    const ssize_t size = recvmsg(connection, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
     if (size < 0 && (errno == EAGAIN || errno == EINTR)) return std::nullopt;
-    request.resize(size < 0 ? 0 : static_cast<std::size_t>(size));
+    request.text.resize(size < 0 ? 0 : static_cast<std::size_t>(size));
+    const cmsghdr* header = size < 0 ? nullptr : CMSG_FIRSTHDR(&message);
+    if (header != nullptr && header->cmsg_level == SOL_SOCKET && header->cmsg_type == SCM_CREDENTIALS) {
+        ucred sender{};
+        std::memcpy(&sender, CMSG_DATA(header), sizeof sender);
+        request.sender = sender.pid;
+    }
     return request;
 }
 

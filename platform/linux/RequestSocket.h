@@ -10,13 +10,17 @@
 #include <deque>
 #include <functional>
 #include <memory>
+#include <optional>
+#include <string>
 #include <string_view>
+#include <sys/types.h>
 #include <thread>
 
 namespace platform::linux_ {
 
-/// Connections that have not yet sent their request. One more drops the oldest, so silent peers only hurt each other:
-/// who sends at once, as every client of ours does, is served when accepted.
+/// Connections that have not yet sent their request. One more drops the oldest. Who sends at once is mostly served when
+/// accepted, before silent peers can matter; one that is accepted between its connecting and its sending may be
+/// dropped.
 inline constexpr std::size_t maximumSilentConnections = 64;
 
 /// Where a socket is, and of which type.
@@ -60,9 +64,13 @@ private:
     std::thread _thread;
 };
 
+struct Request {
+    std::string text;  // empty when the peer hung up
+    pid_t sender = -1; // the process that sent it, as the kernel attests; not always the one that connected
+};
 /// The whole request that waits on `connection`, at most `limit` bytes; longer ones come back cut, one byte over it.
-/// Empty when the peer hung up, none while nothing has come.
-std::optional<std::string> receiveRequest(int connection, std::size_t limit);
+/// None while nothing has come.
+std::optional<Request> receiveRequest(int connection, std::size_t limit);
 /// Answers with an errno value (32 bits, native order) and, when it is open, a descriptor. A peer that does not take it
 /// gets nothing.
 void sendAnswer(int connection, std::int32_t number, const Descriptor& opened);

@@ -74,10 +74,10 @@ private:
         bool tokenCanonical = false;
         std::string token;
     };
-    /// Zero, or an errno value.
     static std::string resolutionKey(const std::string& path, const std::string& within);
     std::optional<std::string> knownToken(const std::string& key, const std::string& path,
                                           const std::string& extensionClass, bool canonical);
+    /// Zero, or an errno value.
     static int resolve(const std::string& path, const std::string& within, Resolution& resolution);
 
     const Root _root;

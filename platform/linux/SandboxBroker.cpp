@@ -21,7 +21,7 @@ namespace platform::linux_ {
 
 namespace {
 
-/// Of packets, so that services confined to such sockets reach it (see ConfinementProfiles.cpp).
+/// Of packets, so that services confined to such sockets reach it (see SystemCallFilter.cpp).
 constexpr RequestSocketAddress address{"com.nordane.sandbox", SOCK_SEQPACKET};
 
 /// A token, NUL, and the longest path.
@@ -75,10 +75,11 @@ Result<Descriptor> SandboxBroker::connect(const Root& root) { return connectToRe
 bool SandboxBroker::serve(int connection) {
     const auto request = receiveRequest(connection, maximumRequestSize);
     if (!request) return false;
-    if (request->empty()) return true; // hung up
-    const std::size_t end = std::min(request->find('\0'), request->size());
-    const auto token = std::string_view(*request).substr(0, end);
-    const std::string below = request->substr(std::min(end + 1, request->size()));
+    const std::string& text = request->text;
+    if (text.empty()) return true; // hung up
+    const std::size_t end = std::min(text.find('\0'), text.size());
+    const auto token = std::string_view(text).substr(0, end);
+    const std::string below = text.substr(std::min(end + 1, text.size()));
     Descriptor opened;
     int number = EPERM;
     if (token.size() > maximumTokenSize || below.size() >= PATH_MAX || below.find('\0') != std::string::npos) {

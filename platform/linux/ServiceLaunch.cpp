@@ -70,6 +70,7 @@ Outcome askManager(const Root& root, const std::string& name, Granted& granted) 
         return LaunchRefusal{LaunchStatus::notRegistered,
                              name + " is not registered for process " + std::to_string(::getppid())};
     }
+    if (number == EDQUOT || number == EPERM) return LaunchRefusal{LaunchStatus::refused, textOf(number)};
     if (number != 0) return LaunchRefusal{LaunchStatus::noManager, textOf(number)};
     const auto bytes = readAll(file, maximumRegistrationSize);
     auto registration = bytes ? ServiceRegistration::decoded(*bytes) : std::nullopt;
@@ -116,19 +117,14 @@ void resetSignals() {
     ::sigprocmask(SIG_SETMASK, &none, nullptr);
 }
 
-/// The file that tells "vigild" of a busy instance, made here so that the service needs no right to make others.
-struct BusyFile {
-    Descriptor directory;
-    Descriptor file;
-};
-
-BusyFile openBusyFile(const Root& root, const std::string& identifier) {
+/// The file that tells "vigild" of a busy instance, made here so that the service needs no right to make others, nor to
+/// see those of others.
+Descriptor openBusyFile(const Root& root, const std::string& identifier) {
     const std::string users = busyDirectory(root);
     const auto own = openUserDirectory(users, ::geteuid(), {}, MissingDirectory::made);
     if (!own) return {};
-    return {Descriptor(::open(users.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)),
-            Descriptor(::openat(own->get(), identifier.c_str(),
-                                O_RDONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, 0600))};
+    return Descriptor(::openat(own->get(), identifier.c_str(),
+                               O_RDONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, 0600));
 }
 
 Outcome confineService(const ServiceDescription& service, const std::vector<OwnPlace>& own) {
@@ -186,22 +182,21 @@ LaunchRefusal becomeService(const Root& root, const std::string& name, const std
     }
 
     const std::string& identifier = registration.service.identifier;
-    const auto path = Containers(root).userContainer(identifier);
+    const auto path = Containers(root).userContainer(registration.container);
     if (!path) return {LaunchStatus::refused, path.error().text()};
     const auto container = openContainer(*path);
     if (!container) return {LaunchStatus::refused, container.error().text()};
     std::vector<OwnPlace> own{{opened->bundle.get(), readFiles | executeFiles},
                               {container->get(), readFiles | changeFiles}};
-    const BusyFile busy = openBusyFile(root, identifier);
-    if (busy.directory && busy.file) {
-        own.push_back({busy.directory.get(), listDirectories});
-        own.push_back({busy.file.get(), readFiles | writeFiles});
+    const Descriptor busy = openBusyFile(root, identifier);
+    if (busy) {
+        own.push_back({busy.get(), readFiles | writeFiles});
     } else {
         systemLog().defaultHandle().error("%{public}s will never count as busy: its file cannot be made",
                                           identifier.c_str());
     }
     const std::string managersContainer =
-        root.users() + '/' + std::to_string(granted.manager) + "/Containers/" + identifier;
+        root.users() + '/' + std::to_string(granted.manager) + "/Containers/" + registration.container;
     auto environment = serviceEnvironment(service, managersContainer, *path);
     std::vector<std::string> texts{registration.executablePath};
     texts.insert(texts.end(), arguments.begin(), arguments.end());

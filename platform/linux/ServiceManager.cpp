@@ -2,12 +2,14 @@
 
 #include "platform/linux/DirectoryFiles.h"
 #include "platform/linux/FileTrust.h"
+#include "platform/linux/PeerProcess.h"
 #include "platform/linux/ServiceThread.h"
 #include "platform/linux/SystemError.h"
 #include "platform/linux/UserDirectory.h"
 
 #include <algorithm>
 #include <cerrno>
+#include <charconv>
 #include <climits>
 #include <csignal>
 #include <dirent.h>
@@ -27,10 +29,18 @@ namespace platform::linux_ {
 
 namespace {
 
-constexpr char separator = '@'; // between bundle identifier and version
+constexpr char separator = '@';               // between bundle identifier and version
+constexpr std::size_t maximumUserLength = 10; // of an id's digits
 
-int signalProcess(const Descriptor& process, int signal) {
-    return static_cast<int>(::syscall(SYS_pidfd_send_signal, process.get(), signal, nullptr, 0));
+/// The user that an instance's file names. None for a file that a crash left empty; that instance was never told that
+/// it may start.
+std::optional<uid_t> recordedUser(int directory, const std::string& name) {
+    const auto text = readFile(directory, name, maximumUserLength);
+    if (!text || !*text) return std::nullopt;
+    uid_t user = 0;
+    const char* const end = (*text)->data() + (*text)->size();
+    const auto parsed = std::from_chars((*text)->data(), end, user);
+    return parsed.ec == std::errc() && parsed.ptr == end ? std::optional(user) : std::nullopt;
 }
 
 /// The name of a service's directory; an errno value for names that give none. The identifier holds no separator, so
@@ -45,27 +55,43 @@ Result<std::string> directoryName(const std::string& bundleIdentifier, const std
     return name;
 }
 
-/// The process that connected. None when it has ended.
-std::optional<ProcessIdentity> peerOf(int connection) {
+/// The process that connected. None when it has ended, or is not the one that sent the request: who takes over another
+/// one's connection must not ask in its name.
+std::optional<ProcessIdentity> peerOf(int connection, pid_t sender) {
     ucred peer{};
     socklen_t size = sizeof peer;
-    if (::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return std::nullopt;
+    if (::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0 || peer.pid != sender) {
+        return std::nullopt;
+    }
     int pidfd = -1;
     size = sizeof pidfd;
     const bool isKnown = ::getsockopt(connection, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) == 0;
+    // Only an older kernel lacks the option. Any other failure may say that the process has ended, and then its pid may
+    // be another one's.
+    if (!isKnown && errno != ENOPROTOOPT) return std::nullopt;
     const Descriptor process = isKnown ? Descriptor(pidfd) : openProcess(peer.pid);
     auto identity = ProcessIdentity::of(peer.pid);
     return process && !hasEnded(process) ? identity : std::nullopt;
 }
 
+/// The process that the token names. None when it has ended.
+std::optional<ProcessIdentity> identityOf(const AuditToken& token) {
+    const auto process = std::dynamic_pointer_cast<const LinuxPeerProcess>(token.process);
+    auto identity = process ? ProcessIdentity::of(process->pid()) : std::nullopt;
+    // While the process lives its pid is its own, so that the start time read before was its own too.
+    return identity && process->isAlive() ? identity : std::nullopt;
+}
+
 } // namespace
 
-ServiceManager::ServiceManager(const Root& root, platform::Files& files, std::chrono::milliseconds grace)
+ServiceManager::ServiceManager(const Root& root, platform::Files& files, std::chrono::milliseconds grace,
+                               const ServiceLimits& limits)
     : _root(root),
       _directory(root.runtime() + "/ignitd"),
       _files(files),
       _grace(grace),
-      _registrations(_directory + "/hosts", _watch) {}
+      _limits(limits),
+      _registrations(_directory + "/hosts", _watch, limits) {}
 
 ServiceManager::~ServiceManager() {
     _launchSocket.reset(); // first, for its thread uses everything
@@ -120,7 +146,10 @@ void ServiceManager::loadInstances() {
             const auto identity = ProcessIdentity::named(name);
             Descriptor process = identity ? openProcess(*identity) : Descriptor();
             if (process) {
-                static_cast<void>(_watch.add(std::move(process), _directory + '/' + service + '/' + name));
+                const std::string path = _directory + '/' + service + '/' + name;
+                if (_watch.add(std::move(process), path) != 0) continue;
+                const std::lock_guard lock(_launching);
+                _instances[path] = recordedUser(records.get(), name).value_or(0);
             } else if (!identity || errno == ESRCH) {
                 ::unlinkat(records.get(), name.c_str(), 0);
             }
@@ -129,8 +158,10 @@ void ServiceManager::loadInstances() {
     }
 }
 
-int ServiceManager::addExternalServiceForHost(pid_t host, const std::string& executablePath,
+int ServiceManager::addExternalServiceForHost(const AuditToken& host, const std::string& executablePath,
                                               const Dictionary& overlay) {
+    const auto process = identityOf(host);
+    if (!process) return ESRCH;
     const auto code = [](const Error& error) { return static_cast<int>(error.code); };
     const auto registration = registrationOf(_files, executablePath, overlay);
     if (!registration) return code(registration.error());
@@ -141,25 +172,25 @@ int ServiceManager::addExternalServiceForHost(pid_t host, const std::string& exe
         const std::lock_guard lock(_mutex);
         if (!startThread()) return EAGAIN;
     }
-    return _registrations.add(host, *registration);
+    return _registrations.add(*process, host.uid, *registration);
 }
 
 bool ServiceManager::serveLaunch(int connection) {
-    const auto name = receiveRequest(connection, PATH_MAX);
-    if (!name) return false;
-    if (name->empty()) return true; // hung up
+    const auto request = receiveRequest(connection, PATH_MAX);
+    if (!request) return false;
+    if (request->text.empty()) return true; // hung up
     Descriptor registration;
-    const int number = name->size() > PATH_MAX ? ENAMETOOLONG : launch(*name, connection, registration);
+    const int number = request->text.size() > PATH_MAX ? ENAMETOOLONG : launch(*request, connection, registration);
     sendAnswer(connection, number, registration);
     return true;
 }
 
-int ServiceManager::launch(const std::string& name, int connection, Descriptor& registration) {
-    const auto process = peerOf(connection);
+int ServiceManager::launch(const Request& request, int connection, Descriptor& registration) {
+    const auto process = peerOf(connection, request.sender);
     const auto host = process ? parentOf(*process) : std::nullopt;
     if (!host) return ESRCH;
     const std::lock_guard lock(_launching);
-    auto found = _registrations.find(*host, name);
+    auto found = _registrations.find(*host, request.text);
     if (!found) return static_cast<int>(found.error().code);
     if (const auto failure = noteInstance(found->service, *process)) return static_cast<int>(failure->code);
     registration = std::move((*found).file);
@@ -233,7 +264,11 @@ void ServiceManager::run() {
 
 void ServiceManager::forgetEnded() {
     for (const auto& path : _watch.takeEnded()) {
-        if (!_registrations.end(path)) ::unlink(path.c_str());
+        if (_registrations.end(path)) continue;
+        const std::lock_guard lock(_launching);
+        _instances.erase(path);
+        ::unlink(path.c_str());
+        ::rmdir(path.substr(0, path.rfind('/')).c_str()); // when that was the last one
     }
 }
 
@@ -254,13 +289,21 @@ void ServiceManager::begin(Removal& removal) {
         removal.firstError = errno == ENOENT ? 0 : errno;
         return;
     }
-    while (const dirent* entry = ::readdir(directory.get())) terminate(removal, entry->d_name);
+    while (const dirent* entry = ::readdir(directory.get())) {
+        terminate(removal, ::dirfd(directory.get()), entry->d_name);
+    }
 }
 
-void ServiceManager::terminate(Removal& removal, const std::string& name) {
+int ServiceManager::Instance::signal(int number) const {
+    if (ownerOf(pid) != user) return ESRCH;
+    return ::syscall(SYS_pidfd_send_signal, process.get(), number, nullptr, 0) == 0 ? 0 : errno;
+}
+
+void ServiceManager::terminate(Removal& removal, int directory, const std::string& name) {
     const auto identity = ProcessIdentity::named(name);
     if (!identity) return; // no record of an instance
-    Instance instance{openProcess(*identity), removal.directory + '/' + name};
+    const auto user = recordedUser(directory, name);
+    Instance instance{openProcess(*identity), identity->pid, user.value_or(0), removal.directory + '/' + name};
     const auto note = [&removal](int number) {
         if (removal.firstError == 0) removal.firstError = number;
     };
@@ -269,13 +312,22 @@ void ServiceManager::terminate(Removal& removal, const std::string& name) {
         ::unlink(instance.path.c_str());
         return;
     }
-    if (signalProcess(instance.process, SIGTERM) != 0 && errno != ESRCH) return note(errno);
+    if (!user) return; // it never started
+    if (const int number = instance.signal(SIGTERM)) {
+        if (number != ESRCH) note(number);
+        return;
+    }
     removal.hadInstances = true;
     removal.instances.push_back(std::move(instance));
 }
 
 /// True when the removal has been answered.
 bool ServiceManager::advance(Removal& removal) {
+    if (!removal.isKilled && std::chrono::steady_clock::now() >= removal.deadline) {
+        removal.isKilled = true;
+        // One that has become another user's since is not waited for.
+        std::erase_if(removal.instances, [](const Instance& instance) { return instance.signal(SIGKILL) == ESRCH; });
+    }
     std::erase_if(removal.instances, [](const Instance& instance) {
         if (!hasEnded(instance.process)) return false;
         ::unlink(instance.path.c_str());
@@ -288,21 +340,7 @@ bool ServiceManager::advance(Removal& removal) {
         answer(removal, removal.firstError != 0 ? removal.firstError : result);
         return true;
     }
-    if (!removal.isKilled && std::chrono::steady_clock::now() >= removal.deadline) {
-        removal.isKilled = true;
-        for (const auto& instance : removal.instances) signalProcess(instance.process, SIGKILL);
-    }
     return false;
-}
-
-Failure ServiceManager::noteInstance(const std::string& bundleIdentifier, const std::string& version, pid_t pid) {
-    const auto process = ProcessIdentity::of(pid);
-    if (!process) return systemError(ESRCH, "process " + std::to_string(pid));
-    {
-        const std::lock_guard lock(_mutex);
-        if (!startThread()) return systemError(EAGAIN, "ignitd");
-    }
-    return noteInstance({bundleIdentifier, version}, *process);
 }
 
 Failure ServiceManager::noteInstance(const ServiceName& service, const ProcessIdentity& process) {
@@ -310,8 +348,16 @@ Failure ServiceManager::noteInstance(const ServiceName& service, const ProcessId
     if (!name) return name.error();
     const std::string directory = _directory + '/' + *name;
     const std::string path = directory + '/' + process.name();
-    Descriptor pidfd = openProcess(process);
+    const auto user = ownerOf(process.pid);
+    Descriptor pidfd = openProcess(process); // after the user, who is that very process's then
     if (!pidfd) return systemError(errno, path);
+    if (!user) return systemError(EPERM, path);
+    const auto known = _instances.find(path);
+    if (known != _instances.end() && known->second == *user) return std::nullopt; // asks once more
+    const auto isTheUsers = [&user](const auto& instance) { return instance.second == *user; };
+    if (static_cast<std::size_t>(std::ranges::count_if(_instances, isTheUsers)) >= _limits.instancesOfUser) {
+        return systemError(EDQUOT, path);
+    }
     if (auto failure = makeDirectory()) return failure;
     // A removal may take the empty directory away between its making and the recording.
     Descriptor record;
@@ -319,15 +365,19 @@ Failure ServiceManager::noteInstance(const ServiceName& service, const ProcessId
         if (::mkdir(directory.c_str(), 0755) != 0 && errno != EEXIST) return systemError(errno, directory);
         const auto trusted = openTrustedDirectory(directory);
         if (!trusted && trusted.error().code != ENOENT) return trusted.error();
-        record = Descriptor(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
-        // It is watched already. One that asks again and again costs one descriptor.
-        if (!record && errno == EEXIST) return std::nullopt;
+        // One that an earlier daemon could not take up may be there.
+        record = Descriptor(::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
     }
     if (!record) return systemError(errno, path);
-    if (const int number = _watch.add(std::move(pidfd), path)) {
+    const std::string text = std::to_string(*user);
+    const ssize_t written = ::write(record.get(), text.data(), text.size());
+    int number = written < 0 ? errno : ENOSPC;
+    if (written == static_cast<ssize_t>(text.size())) number = _watch.add(std::move(pidfd), path);
+    if (number != 0) {
         ::unlink(path.c_str());
         return systemError(number, path);
     }
+    _instances[path] = *user;
     return std::nullopt;
 }
 

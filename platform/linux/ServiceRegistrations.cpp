@@ -3,10 +3,12 @@
 #include "platform/linux/Bundles.h"
 #include "platform/linux/DirectoryFiles.h"
 #include "platform/linux/SystemError.h"
+#include "platform/linux/UserDirectory.h"
 
 #include <algorithm>
 #include <cerrno>
 #include <charconv>
+#include <climits>
 #include <fcntl.h>
 #include <filesystem>
 #include <linux/openat2.h>
@@ -20,12 +22,20 @@ namespace {
 
 constexpr std::string_view identifierKey = "identifier";
 constexpr std::string_view versionKey = "version";
+constexpr std::string_view containerKey = "container";
 constexpr std::string_view bundlePathKey = "bundlePath";
 constexpr std::string_view executablePathKey = "executablePath";
 constexpr std::string_view bundleKey = "bundle";
 constexpr std::string_view executableKey = "executable";
 constexpr std::string_view changeKey = "executableChange";
 constexpr std::string_view overlayKey = "overlay";
+
+/// Directories above an executable. Each one is searched for a manifest, so that a deep path must not be costly.
+constexpr int maximumDepth = 64;
+
+constexpr std::size_t pageSize = 4096; // the least that a file in memory takes
+
+std::size_t chargeOf(std::size_t bytes) { return (bytes + pageSize - 1) / pageSize * pageSize; }
 
 Array numbersOf(const FileIdentity& file) {
     return Array{Value(file.device), Value(file.inode), Value(file.bornSeconds), Value(file.bornNanoseconds)};
@@ -84,6 +94,16 @@ std::optional<std::uint64_t> numberOf(std::string_view text) {
     return number;
 }
 
+constexpr int directoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+
+/// Zero for a directory of this process's user, or the superuser, that is closed to all others: environments are in it.
+int privacyError(const Descriptor& directory) {
+    struct stat status{};
+    if (!directory || ::fstat(directory.get(), &status) != 0) return errno;
+    if (status.st_uid != 0 && status.st_uid != ::geteuid()) return EPERM;
+    return (status.st_mode & 077) != 0 ? EACCES : 0;
+}
+
 /// Under a new name. What a crash leaves cut off is no registration, for it does not decode.
 int writeNew(const std::string& path, std::string_view bytes) {
     const Descriptor file(::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
@@ -107,6 +127,7 @@ std::string ServiceRegistration::encoded() const {
     std::string bytes(compactMagic);
     appendCompact(bytes, Dictionary{{identifierKey, service.identifier},
                                     {versionKey, service.version},
+                                    {containerKey, container},
                                     {bundlePathKey, bundlePath},
                                     {executablePathKey, executablePath},
                                     {bundleKey, numbersOf(bundle)},
@@ -123,14 +144,17 @@ std::optional<ServiceRegistration> ServiceRegistration::decoded(std::string_view
     if (!fields) return std::nullopt;
     const auto identifier = fields->string(identifierKey);
     const auto version = fields->string(versionKey);
+    const auto container = fields->string(containerKey);
     const auto bundlePath = fields->string(bundlePathKey);
     const auto executablePath = fields->string(executablePathKey);
     const auto change = fields->array(changeKey);
     const auto overlay = fields->dictionary(overlayKey);
-    if (!identifier || !version || !bundlePath || !executablePath || !change || change->size() != 3 || !overlay) {
+    if (!identifier || !version || !container || !bundlePath || !executablePath || !change || change->size() != 3 ||
+        !overlay) {
         return std::nullopt;
     }
     ServiceRegistration registration{{std::string(*identifier), std::string(*version)},
+                                     std::string(*container),
                                      std::string(*bundlePath),
                                      std::string(*executablePath),
                                      {},
@@ -144,19 +168,48 @@ std::optional<ServiceRegistration> ServiceRegistration::decoded(std::string_view
     return isComplete ? std::optional(std::move(registration)) : std::nullopt;
 }
 
+namespace {
+
+/// The bundle whose executable this canonical path is. None when there are two, for who is meant cannot be told.
+std::shared_ptr<const BundleObject> onlyBundleOf(platform::Files& files, const std::string& executable) {
+    std::shared_ptr<const BundleObject> found;
+    std::string directory = executable;
+    for (int depth = 0; depth <= maximumDepth; ++depth) {
+        directory.resize(directory.rfind('/'));
+        if (directory.empty()) return found;
+        auto bundle = Bundles(files).fromPath(directory, BundleMode::directory);
+        if (bundle->property(BundleProperty::executablePath) != executable) continue;
+        if (found) return nullptr;
+        found = std::move(bundle);
+    }
+    return nullptr;
+}
+
+/// The identifier under which the registry makes the plug-in's data container: the plug-in's own, else the bundle's.
+std::string containerOf(const Dictionary& info, const std::string& bundleIdentifier) {
+    auto plugIn = info.dictionary("VKExtension");
+    if (!plugIn) plugIn = info.dictionary("Zembra");
+    const auto own = plugIn ? plugIn->string("VKExtensionIdentifier") : std::nullopt;
+    return own ? std::string(*own) : bundleIdentifier;
+}
+
+} // namespace
+
 Result<ServiceRegistration> registrationOf(platform::Files& files, const std::string& executablePath,
                                            const Dictionary& overlay) {
-    const auto bundle = Bundles(files).fromPath(executablePath, BundleMode::executable);
-    const auto path = bundle->property(BundleProperty::path);
-    const auto executable = bundle->property(BundleProperty::executablePath);
-    const auto info = bundle->infoDictionary();
+    const auto executable = files.realPath(executablePath, PATH_MAX);
+    const auto bundle = executable ? onlyBundleOf(files, *executable) : nullptr;
+    const auto path = bundle ? bundle->property(BundleProperty::path) : std::nullopt;
+    const auto info = bundle ? bundle->infoDictionary() : std::nullopt;
     const auto identifier = info ? info->string("VBBundleIdentifier") : std::nullopt;
-    if (!path || !executable || !identifier) return systemError(EINVAL, executablePath);
+    if (!path || !identifier) return systemError(EINVAL, executablePath);
+    const std::string container = containerOf(*info, std::string(*identifier));
+    if (const int number = pathComponentError(container)) return systemError(number, executablePath);
     // Removals name a service whose manifest has no version so.
     const auto version = info->string("VBBundleVersion").value_or("1");
 
     ServiceRegistration registration{
-        {std::string(*identifier), std::string(version)}, *path, *executable, {}, {}, overlay};
+        {std::string(*identifier), std::string(version)}, container, *path, *executable, {}, {}, overlay};
     OpenedFile openedBundle;
     OpenedFile openedExecutable;
     if (const int number = openBoth(*path, *executable, openedBundle, openedExecutable)) {
@@ -182,41 +235,49 @@ Result<OpenedService> openService(const ServiceRegistration& registration) {
 int ServiceRegistrations::load() {
     const Descriptor directory = openDirectory(AT_FDCWD, _directory);
     if (!directory) return errno == ENOENT ? 0 : errno;
+    if (const int number = privacyError(directory)) return number;
     const auto listing = listDirectory(directory.get());
     if (!listing) return errno;
     const std::lock_guard lock(_mutex);
-    for (const auto& name : listing->directories) loadHost(name);
+    for (const auto& name : listing->directories) {
+        const auto identity = ProcessIdentity::named(name);
+        Host* loaded = nullptr;
+        // A host that lives keeps what it has, also when this process is short of something: it is taken up with the
+        // next registration.
+        if (identity && host(*identity, ownerOf(identity->pid).value_or(0), loaded) != ESRCH) continue;
+        std::error_code ignored; // tried again at the next start
+        std::filesystem::remove_all(pathOf(name), ignored);
+    }
     return 0;
 }
 
-void ServiceRegistrations::loadHost(const std::string& name) {
-    const auto identity = ProcessIdentity::named(name);
-    Host* entry = nullptr;
-    if (!identity || host(*identity, entry) != 0) {
-        std::error_code ignored; // tried again at the next start
-        std::filesystem::remove_all(pathOf(name), ignored);
-        return;
-    }
+void ServiceRegistrations::loadServices(const std::string& name, Host& host) {
     const Descriptor directory = openDirectory(AT_FDCWD, pathOf(name));
     const auto listing = directory ? listDirectory(directory.get()) : std::nullopt;
     if (!listing) return;
     for (const auto& file : listing->others) {
         const auto number = numberOf(file).value_or(0); // they begin with 1
         const auto bytes = readFile(directory.get(), file, maximumRegistrationSize);
+        _next = std::max(_next, number + 1);
+        if (!bytes && isShortage(static_cast<int>(bytes.error().code))) continue;
         const auto registration = number != 0 && bytes && *bytes ? ServiceRegistration::decoded(**bytes) : std::nullopt;
-        Entry* known = registration ? &(*entry)[registration->executablePath] : nullptr;
+        Entry* known = registration ? &host.services[registration->executablePath] : nullptr;
         // The one that was replaced may be left.
         if (known == nullptr || known->number > number) {
             ::unlinkat(directory.get(), file.c_str(), 0);
             continue;
         }
-        if (known->number != 0) ::unlinkat(directory.get(), std::to_string(known->number).c_str(), 0);
-        *known = {registration->service, number};
-        _next = std::max(_next, number + 1);
+        replace(name, host, *known, {registration->service, number, chargeOf((*bytes)->size())});
     }
 }
 
-int ServiceRegistrations::host(const ProcessIdentity& identity, Host*& host) {
+void ServiceRegistrations::replace(const std::string& name, Host& host, Entry& known, const Entry& entry) {
+    if (known.number != 0) ::unlink((pathOf(name) + '/' + std::to_string(known.number)).c_str());
+    for (std::size_t* bytes : {&host.bytes, &_users[host.user].bytes}) *bytes = *bytes - known.bytes + entry.bytes;
+    known = entry;
+}
+
+int ServiceRegistrations::host(const ProcessIdentity& identity, uid_t user, Host*& host) {
     const std::string name = identity.name();
     const auto known = _hosts.find(name);
     if (known != _hosts.end()) {
@@ -225,42 +286,54 @@ int ServiceRegistrations::host(const ProcessIdentity& identity, Host*& host) {
     }
     Descriptor process = openProcess(identity);
     if (!process) return errno;
-    for (const auto& directory : {_directory, pathOf(name)}) {
-        if (::mkdir(directory.c_str(), 0700) != 0 && errno != EEXIST) return errno;
-    }
+    const auto usage = _users.find(user);
+    if ((usage == _users.end() ? 0 : usage->second.hosts) >= _limits.hostsOfUser) return EDQUOT;
+    if (::mkdir(_directory.c_str(), 0700) != 0 && errno != EEXIST) return errno;
+    if (const int number = privacyError(Descriptor(::open(_directory.c_str(), directoryFlags)))) return number;
+    const bool isNew = ::mkdir(pathOf(name).c_str(), 0700) == 0;
+    if (!isNew && errno != EEXIST) return errno;
     if (const int number = _watch.add(std::move(process), pathOf(name))) {
         ::rmdir(pathOf(name).c_str());
         return number;
     }
-    host = &_hosts[name];
+    ++_users[user].hosts;
+    host = &_hosts.emplace(name, Host{user, 0, {}}).first->second;
+    if (!isNew) loadServices(name, *host);
     return 0;
 }
 
-int ServiceRegistrations::add(pid_t host, const ServiceRegistration& registration) {
-    const auto identity = ProcessIdentity::of(host);
-    if (!identity) return ESRCH;
+int ServiceRegistrations::add(const ProcessIdentity& host, uid_t user, const ServiceRegistration& registration) {
     const std::string bytes = registration.encoded();
     if (bytes.size() > maximumRegistrationSize) return E2BIG;
+    // The encoding holds values that no property list has; then the host learns it now, not at every launch.
+    if (!ServiceRegistration::decoded(bytes)) return EINVAL;
     const std::lock_guard lock(_mutex);
     Host* entry = nullptr;
-    if (const int number = this->host(*identity, entry)) return number;
-    const std::string directory = pathOf(identity->name()) + '/';
+    if (const int number = this->host(host, user, entry)) return number;
+    const auto known = entry->services.find(registration.executablePath);
+    const std::size_t freed = known == entry->services.end() ? 0 : known->second.bytes;
+    const std::size_t charge = chargeOf(bytes.size());
+    if (entry->bytes - freed + charge > _limits.bytesOfHost ||
+        _users[entry->user].bytes - freed + charge > _limits.bytesOfUser) {
+        return EDQUOT;
+    }
     const std::uint64_t number = _next++;
-    if (const int failure = writeNew(directory + std::to_string(number), bytes)) return failure;
-    Entry& known = (*entry)[registration.executablePath];
-    if (known.number != 0) ::unlink((directory + std::to_string(known.number)).c_str());
-    known = {registration.service, number};
+    if (const int failure = writeNew(pathOf(host.name()) + '/' + std::to_string(number), bytes)) return failure;
+    replace(host.name(), *entry, entry->services[registration.executablePath], {registration.service, number, charge});
     return 0;
 }
 
 void ServiceRegistrations::remove(const ServiceName& service) {
     const std::lock_guard lock(_mutex);
     for (auto& [name, host] : _hosts) {
-        std::erase_if(host, [&](const auto& item) {
-            if (item.second.service != service) return false;
-            ::unlink((pathOf(name) + '/' + std::to_string(item.second.number)).c_str());
-            return true;
-        });
+        for (auto at = host.services.begin(); at != host.services.end();) {
+            const auto next = std::next(at);
+            if (at->second.service == service) {
+                replace(name, host, at->second, {});
+                host.services.erase(at);
+            }
+            at = next;
+        }
     }
 }
 
@@ -270,7 +343,7 @@ Result<ServiceRegistrations::Found> ServiceRegistrations::find(const ProcessIden
     const Entry* found = nullptr;
     if (known != _hosts.end()) {
         const bool isPath = name.find('/') != std::string_view::npos;
-        for (const auto& [path, entry] : known->second) {
+        for (const auto& [path, entry] : known->second.services) {
             const bool isMeant = isPath ? path == name : entry.service.identifier == name;
             if (isMeant && (found == nullptr || entry.number > found->number)) found = &entry;
         }
@@ -285,7 +358,11 @@ Result<ServiceRegistrations::Found> ServiceRegistrations::find(const ProcessIden
 bool ServiceRegistrations::end(const std::string& path) {
     if (!path.starts_with(_directory + '/')) return false;
     const std::lock_guard lock(_mutex);
-    _hosts.erase(path.substr(_directory.size() + 1));
+    if (const auto ended = _hosts.extract(path.substr(_directory.size() + 1))) {
+        const auto usage = _users.find(ended.mapped().user);
+        usage->second.bytes -= ended.mapped().bytes;
+        if (--usage->second.hosts == 0) _users.erase(usage);
+    }
     std::error_code ignored; // what is left belongs to a process that is no more, and goes at the next start
     std::filesystem::remove_all(path, ignored);
     return true;

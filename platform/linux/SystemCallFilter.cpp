@@ -3,10 +3,12 @@
 #include "platform/linux/SystemError.h"
 
 #include <cerrno>
+#include <fcntl.h>
 #include <memory>
 #include <sched.h>
 #include <seccomp.h>
 #include <sys/ioctl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -74,6 +76,12 @@ constexpr RefusedCall refusedCalls[] = {
     {"chown"},
     {"lchown"},
     {"fchownat"},
+    {"getxattr"}, // some hold secrets, and a program's entitlements
+    {"lgetxattr"},
+    {"getxattrat", 464},
+    {"listxattr"},
+    {"llistxattr"},
+    {"listxattrat", 465},
     {"setxattr"},
     {"lsetxattr"},
     {"setxattrat", 463},
@@ -121,6 +129,16 @@ constexpr int namespaceFlags[] = {CLONE_NEWNS,   CLONE_NEWCGROUP, CLONE_NEWUTS, 
                                   CLONE_NEWUSER, CLONE_NEWPID,    CLONE_NEWNET};
 
 constexpr std::uint64_t typingRequests[] = {TIOCSTI, TIOCLINUX};
+
+/// Who gets the signals of a socket or a pipe; the kernel sends them past what forbids sending any.
+constexpr std::uint64_t signalReceiverRequests[] = {FIOSETOWN, SIOCSPGRP};
+constexpr std::uint64_t signalReceiverCommands[] = {F_SETOWN, F_SETOWN_EX};
+
+/// Of the process that their first argument names, where zero is the calling thread.
+constexpr const char* schedulingCalls[] = {"sched_setaffinity", "sched_setscheduler", "sched_setparam",
+                                           "sched_setattr"};
+
+constexpr int ioPriorityOfProcess = 1; // no header of the library has it
 
 /// The kernel reads arguments of type int from the lower half of a register alone, so the upper half must not make a
 /// difference here either.
@@ -184,6 +202,44 @@ void refuseSockets(Filter& filter, Network network) {
     if (network != Network::server) filter.refuse({"listen"}, EACCES);
 }
 
+/// Of other processes: the host would run when and where its plug-in wants.
+void refuseScheduling(Filter& filter) {
+    for (const char* name : schedulingCalls) filter.refuse({name}, EPERM, argument(0, SCMP_CMP_NE, 0));
+    filter.refuse({"setpriority"}, EPERM, argument(0, SCMP_CMP_NE, PRIO_PROCESS));
+    filter.refuse({"setpriority"}, EPERM, argument(1, SCMP_CMP_NE, 0));
+    filter.refuse({"ioprio_set"}, EPERM, argument(0, SCMP_CMP_NE, ioPriorityOfProcess));
+    filter.refuse({"ioprio_set"}, EPERM, argument(1, SCMP_CMP_NE, 0));
+}
+
+/// Landlock before version 3 knows nothing of truncating: who may open a file to read it may empty it so. Access mode 3
+/// is for neither reading nor writing, and passes any rule.
+void refuseTruncating(Filter& filter) {
+    filter.refuse({"truncate"}, EPERM);
+    for (const int access : {O_RDONLY, O_ACCMODE}) {
+        const auto truncates = [access](unsigned index) {
+            return argument(index, SCMP_CMP_MASKED_EQ, static_cast<std::uint64_t>(access | O_TRUNC),
+                            O_ACCMODE | O_TRUNC);
+        };
+        filter.refuse({"open"}, EPERM, truncates(1));
+        filter.refuse({"openat"}, EPERM, truncates(2));
+    }
+    filter.refuse({"openat2", 437}, ENOSYS); // its flags lie in memory
+}
+
+/// Landlock before version 6 knows nothing of signals.
+void refuseSignals(Filter& filter) {
+    for (const char* name : {"kill", "tkill", "rt_sigqueueinfo", "pidfd_send_signal"}) filter.refuse({name}, EPERM);
+    const auto own = static_cast<std::uint64_t>(::getpid());
+    for (const char* name : {"tgkill", "rt_tgsigqueueinfo"})
+        filter.refuse({name}, EPERM, argument(0, SCMP_CMP_NE, own));
+    for (const std::uint64_t command : signalReceiverCommands) {
+        filter.refuse({"fcntl"}, EPERM, argument(1, SCMP_CMP_MASKED_EQ, command, lowerHalf));
+    }
+    for (const std::uint64_t request : signalReceiverRequests) {
+        filter.refuse({"ioctl"}, EPERM, argument(1, SCMP_CMP_MASKED_EQ, request, lowerHalf));
+    }
+}
+
 } // namespace
 
 Failure filterSystemCalls(Network network, int landlock) {
@@ -203,16 +259,9 @@ Failure filterSystemCalls(Network network, int landlock) {
         filter.refuse({"ioctl"}, EPERM, argument(1, SCMP_CMP_MASKED_EQ, request, lowerHalf));
     }
     refuseSockets(filter, network);
-    if (landlock < 3) filter.refuse({"truncate"}, EPERM);
-    if (landlock < 6) {
-        for (const char* name : {"kill", "tkill", "rt_sigqueueinfo", "pidfd_send_signal"}) {
-            filter.refuse({name}, EPERM);
-        }
-        const auto own = static_cast<std::uint64_t>(::getpid());
-        for (const char* name : {"tgkill", "rt_tgsigqueueinfo"}) {
-            filter.refuse({name}, EPERM, argument(0, SCMP_CMP_NE, own));
-        }
-    }
+    refuseScheduling(filter);
+    if (landlock < 3) refuseTruncating(filter);
+    if (landlock < 6) refuseSignals(filter);
     if (const int number = filter.load()) return systemError(number, "system call filter");
     return std::nullopt;
 }

@@ -12,7 +12,15 @@ namespace platform::linux_ {
 namespace {
 
 constexpr std::size_t maximumComponent = 255; // NAME_MAX of the file systems in use
-constexpr int openFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+constexpr int openFlags = O_DIRECTORY | O_CLOEXEC;
+
+/// Not open, with errno set, on failure. A confined service may not list these directories; to go through them to a
+/// file of its own, a mere reference does.
+Descriptor open(int parent, const std::string& name, int flags) {
+    Descriptor directory(::openat(parent, name.c_str(), openFlags | O_RDONLY | flags));
+    if (!directory && errno == EACCES) directory.reset(::openat(parent, name.c_str(), openFlags | O_PATH | flags));
+    return directory;
+}
 
 } // namespace
 
@@ -34,7 +42,7 @@ Result<Descriptor> openUsersDirectory(const std::string& path, uid_t user, Missi
             return systemError(errno, path);
         }
     }
-    Descriptor directory(::open(path.c_str(), openFlags));
+    Descriptor directory = open(AT_FDCWD, path, 0);
     struct stat status{};
     if (!directory || ::fstat(directory.get(), &status) != 0) return systemError(errno, path);
     // Whoever may rename entries here could put one user's directory in the place of another's.
@@ -57,7 +65,7 @@ Result<Descriptor> openUserDirectory(const std::string& users, uid_t user,
             errno != EEXIST) {
             return systemError(errno, path);
         }
-        Descriptor next(::openat(directory.get(), name.c_str(), openFlags | O_NOFOLLOW));
+        Descriptor next = open(directory.get(), name, O_NOFOLLOW);
         struct stat status{};
         if (!next || ::fstat(next.get(), &status) != 0) return systemError(errno, path);
         if (status.st_uid != user) return systemError(EPERM, path);

@@ -19,7 +19,8 @@ enum class MissingDirectory { refused, made };
 
 /// Opens `path`, a directory that holds a private one for every user, named by the user's id. It must belong to the
 /// superuser or to `user`, and others may add their own to it but not touch what is there (as in /tmp). A missing one
-/// is made, by the superuser for every user, else for the caller alone. Errors as below.
+/// is made, by the superuser for every user, else for the caller alone. One that this process may not list is opened as
+/// a mere reference (O_PATH). Errors as below.
 Result<Descriptor> openUsersDirectory(const std::string& path, uid_t user, MissingDirectory missing);
 
 /// Opens the directory `components` below the private directory of `user` in the directory `users`. From that private

@@ -93,7 +93,8 @@ class Launch(unittest.TestCase):
         self.addCleanup(self.platform.__exit__, None, None, None)
         self.application = bundles.application(self.platform.root, "Lab", {
             "Free.appex": manifest("free"),
-            "Keys.appex": manifest("keys", extension={"VKExtensionPointIdentifier": "com.nordane.keyboard-service"}),
+            "Keys.appex": manifest("keys", extension={"VKExtensionPointIdentifier": "com.nordane.keyboard-service",
+                                                      "VKExtensionIdentifier": "com.example.own-keys"}),
             "Wrong.appex": manifest("wrong", QMXService={"EnvironmentVariables": {"OWN": 1}}),
             "Script.appex": manifest("script"),
         })
@@ -150,7 +151,10 @@ class Launch(unittest.TestCase):
         with open(home, "w", encoding="utf-8") as file:
             file.write("secret")
         self.ready("Free", "Keys")
-        container = self.launch("Keys", "import os; open('file', 'w'); print(os.getcwd())").stdout.strip()
+        container, given = self.launch(
+            "Keys", "import os; open('file', 'w'); print(os.getcwd(), os.environ['HOME'])").stdout.split()
+        self.assertEqual(given, container)
+        self.assertEqual(os.path.basename(container), "com.example.own-keys")
         with socket.create_server(("127.0.0.1", 0)) as listener:
             for plugin, other, network in (("Free", "Keys", {"connect"}), ("Keys", "Free", set())):
                 facts = {"home": home, "container": container + "/file", "bundle": self.bundle(plugin),

@@ -9,17 +9,20 @@
 #include <climits>
 #include <fstream>
 #include <linux/keyctl.h>
+#include <linux/openat2.h>
 #include <sched.h>
 #include <sys/inotify.h>
 #include <sys/ioctl.h>
 #include <sys/mman.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
 #include <sys/ptrace.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/uio.h>
+#include <sys/xattr.h>
 
 using namespace platform;
 namespace fs = std::filesystem;
@@ -89,7 +92,12 @@ protected:
     sockaddr_in _address{};
 };
 
-enum class Keeper { filter, landlock, nobody };
+enum class Keeper {
+    filter,
+    landlock,
+    signalFilter, // before version 6; from then on Landlock, when the signal is due
+    nobody,
+};
 
 struct Attempt {
     const char* name;
@@ -123,6 +131,9 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
     char byte = 0;
     iovec own{&byte, 1};
     iovec foreign{&byte, 1};
+    int pair[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
+    const Descriptor ends[] = {Descriptor(pair[0]), Descriptor(pair[1])};
     const std::vector<Attempt> attempts = {
         {"read the bundle", Keeper::nobody, [&] { return opens(at("Bundle/Resource")); }},
         {"execute the bundle's program", Keeper::nobody, [&] { return executes(at("Bundle/Program")); }},
@@ -133,6 +144,7 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
         {"write to nothing", Keeper::nobody, [] { return opens("/dev/null", O_WRONLY); }},
         {"look at itself", Keeper::nobody, [] { return opens("/proc/self/maps"); }},
         {"signal itself", Keeper::nobody, [] { return result(raise(SIGCHLD)); }},
+        {"be nicer", Keeper::nobody, [] { return result(setpriority(PRIO_PROCESS, 0, 1)); }},
         {"make a packet socket", Keeper::nobody, [] { return makesSocket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC); }},
 
         {"read the home", Keeper::landlock, [&] { return opens(at("home/secret")); }},
@@ -142,9 +154,18 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
          [&] { return result(link(at("other/secret").c_str(), at("own/link").c_str())); }},
         {"write to the bundle", Keeper::landlock, [&] { return opens(at("Bundle/Resource"), O_WRONLY); }},
         {"truncate the bundle", Keeper::landlock, [&] { return result(truncate(at("Bundle/Resource").c_str(), 0)); }},
+        {"truncate the bundle by opening it to read", Keeper::landlock,
+         [&] { return opens(at("Bundle/Resource"), O_RDONLY | O_TRUNC); }},
+        {"truncate the home by opening it for nothing", Keeper::landlock,
+         [&] { return opens(at("home/secret"), O_ACCMODE | O_TRUNC); }},
+        {"truncate the bundle anew", Keeper::landlock,
+         [&] {
+             const open_how how{O_RDONLY | O_TRUNC, 0, 0};
+             return result(syscall(SYS_openat2, AT_FDCWD, at("Bundle/Resource").c_str(), &how, sizeof how));
+         }},
         {"read the users", Keeper::landlock, [] { return opens("/etc/passwd"); }},
         {"execute a system program", Keeper::landlock, [] { return executes("/bin/true"); }},
-        {"execute what it made", Keeper::landlock,
+        {"execute a script that it made", Keeper::landlock,
          [&] {
              std::ofstream(at("own/script")) << "#!/bin/true\n";
              return result(fchmod(Descriptor(open(at("own/script").c_str(), O_RDONLY)).get(), 0700)) +
@@ -154,7 +175,26 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
         {"signal its parent", Keeper::filter, [&] { return result(kill(parent, 0)); }},
         {"signal its parent's thread", Keeper::filter, [&] { return result(syscall(SYS_tgkill, parent, parent, 0)); }},
 
-        {"trace its parent", Keeper::filter, [&] { return result(ptrace(PTRACE_SEIZE, parent, nullptr, nullptr)); }},
+        {"have its parent signalled", Keeper::signalFilter, [&] { return result(fcntl(pair[0], F_SETOWN, parent)); }},
+        {"have its parent signalled anew", Keeper::signalFilter,
+         [&] {
+             const f_owner_ex owner{F_OWNER_PID, parent};
+             return result(fcntl(pair[0], F_SETOWN_EX, &owner));
+         }},
+        {"have its parent signalled by a socket's call", Keeper::signalFilter,
+         [&] { return result(ioctl(pair[0], FIOSETOWN, &parent)); }},
+        // A child, for some kernels let nobody trace a parent anyway.
+        {"trace its child", Keeper::filter,
+         [] {
+             const pid_t child = fork();
+             if (child == 0) {
+                 prctl(PR_SET_PDEATHSIG, SIGKILL);
+                 alarm(30);
+                 pause();
+             }
+             const int number = result(ptrace(PTRACE_SEIZE, child, nullptr, nullptr));
+             return number;
+         }},
         {"read its parent's memory", Keeper::filter,
          [&] { return result(process_vm_readv(parent, &own, 1, &foreign, 1, 0)); }},
         {"take its parent's descriptors", Keeper::filter,
@@ -167,6 +207,24 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
              const rlimit limit{0, 0};
              return result(prlimit(parent, RLIMIT_CORE, &limit, nullptr));
          }},
+        {"move its parent to another processor", Keeper::filter,
+         [&] {
+             const unsigned long processors = 1;
+             return result(syscall(SYS_sched_setaffinity, parent, sizeof processors, &processors));
+         }},
+        {"set its parent back", Keeper::filter,
+         [&] {
+             const sched_param none{};
+             return result(sched_setscheduler(parent, SCHED_IDLE, &none));
+         }},
+        {"set its parent's priority", Keeper::filter,
+         [&] { return result(setpriority(PRIO_PROCESS, static_cast<id_t>(parent), 0)); }},
+        {"set its group's priority", Keeper::filter, [] { return result(setpriority(PRIO_PGRP, 0, 0)); }},
+        {"set its user's disk priority", Keeper::filter,
+         [] { return result(syscall(SYS_ioprio_set, 3, geteuid(), 0)); }},
+        {"read an attribute", Keeper::filter,
+         [&] { return result(getxattr(at("home/secret").c_str(), "user.secret", nullptr, 0)); }},
+        {"list attributes", Keeper::filter, [&] { return result(listxattr(at("home/secret").c_str(), nullptr, 0)); }},
         {"change a mode", Keeper::filter, [&] { return result(chmod(at("home/secret").c_str(), 0777)); }},
         {"change a mode anew", Keeper::filter,
          [&] { return result(syscall(452, AT_FDCWD, at("home/secret").c_str(), 0777, 0)); }},
@@ -198,6 +256,7 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
         if (version > current) continue;
         std::vector<Attempt> tried = attempts;
         if (version == 0) std::erase_if(tried, [](const Attempt& one) { return one.keeper == Keeper::landlock; });
+        if (version >= 6) std::erase_if(tried, [](const Attempt& one) { return one.keeper == Keeper::signalFilter; });
         const auto results = resultsConfined(tried, [&] { return confine("keyboard", version); });
         for (std::size_t index = 0; index < tried.size(); ++index) {
             const bool isRight =

@@ -1,6 +1,8 @@
 #include "platform/linux/ServiceLaunch.h"
+#include "platform/linux/BusyAssertion.h"
 #include "platform/linux/Containers.h"
 #include "platform/linux/Files.h"
+#include "platform/linux/PeerProcess.h"
 #include "platform/linux/ProcessAssertions.h"
 #include "platform/linux/ServiceEnvironment.h"
 #include "platform/linux/ServiceManager.h"
@@ -13,10 +15,12 @@
 
 #include <climits>
 #include <future>
+#include <linux/sched.h>
 #include <poll.h>
 #include <seccomp.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 
 namespace fs = std::filesystem;
 using namespace platform;
@@ -25,10 +29,27 @@ using linux_::LaunchStatus;
 namespace {
 
 constexpr const char* identifier = "com.example.plug-in";
+constexpr const char* containerIdentifier = "com.example.plug-in.own"; // the plug-in's, not its bundle's
 
 Dictionary overlay(const Dictionary& variables = {}, const Value& profile = "plugin") {
     return {{"VBBundlePackageType", "QMX!"},
             {"QMXService", Dictionary{{"EnvironmentVariables", variables}, {"_SandboxProfile", profile}}}};
+}
+
+AuditToken tokenOf(pid_t pid) { return {pid, geteuid(), getegid(), linux_::LinuxPeerProcess::look(pid)}; }
+
+/// A child with that very pid, which waits for a signal; -1 when this process may not choose.
+pid_t startAs(pid_t pid) {
+    clone_args arguments{};
+    arguments.exit_signal = SIGCHLD;
+    arguments.set_tid = reinterpret_cast<std::uintptr_t>(&pid);
+    arguments.set_tid_size = 1;
+    const auto child = static_cast<pid_t>(syscall(SYS_clone3, &arguments, sizeof arguments));
+    if (child == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        for (;;) pause();
+    }
+    return child;
 }
 
 std::size_t entriesOf(const std::string& directory) {
@@ -103,11 +124,14 @@ protected:
     void makeBundle() const {
         fs::remove_all(bundle());
         support::writeManifest(bundle(),
-                               Dictionary{{"VBBundleIdentifier", identifier}, {"VBBundleExecutable", "Program"}});
+                               Dictionary{{"VBBundleIdentifier", identifier},
+                                          {"VBBundleExecutable", "Program"},
+                                          {"VKExtension", Dictionary{{"VKExtensionIdentifier", containerIdentifier}}}});
         fs::copy_file(fs::canonical("/bin/sh"), program());
     }
-    void startManager() {
-        _manager = std::make_unique<linux_::ServiceManager>(_root, _files, std::chrono::hours(1));
+    void startManager(const linux_::ServiceLimits& limits = {}) {
+        _manager.reset();
+        _manager = std::make_unique<linux_::ServiceManager>(_root, _files, std::chrono::hours(1), limits);
         const auto failure = _manager->startServing();
         EXPECT_FALSE(failure) << failure->text();
     }
@@ -115,7 +139,7 @@ protected:
     std::string program() const { return bundle() + "/Program"; }
     std::string hosts() const { return _root.runtime() + "/ignitd/hosts"; }
     int add(const Dictionary& given = overlay(), pid_t host = getpid()) const {
-        return _manager->addExternalServiceForHost(host, program(), given);
+        return _manager->addExternalServiceForHost(tokenOf(host), program(), given);
     }
     int remove() {
         std::promise<int> answer;
@@ -139,7 +163,7 @@ protected:
 } // namespace
 
 TEST_F(ServiceLaunch, GivesWhatWasRegisteredAndNothingElse) {
-    const auto container = linux_::Containers(_root).userContainer(identifier);
+    const auto container = linux_::Containers(_root).userContainer(containerIdentifier);
     ASSERT_TRUE(container);
     ASSERT_EQ(add(overlay({{"HOME", *container},
                            {"MESSAGE", "two words"},
@@ -180,6 +204,14 @@ TEST_F(ServiceLaunch, LetsAServiceCountAsBusyAndNoOther) {
     if (linux_::landlockVersion() == 0) GTEST_SKIP() << "this kernel has no Landlock";
     std::ofstream(busy + "com.example.other").flush();
     for (const char* other : {"com.example.other", "com.example.new"}) EXPECT_NE(launch("true >> " + busy + other), 0);
+    EXPECT_EQ(launch("[ \"$(echo " + busy + "*)\" = '" + busy + "*' ]"), 0) << "who else ran is not shown";
+    EXPECT_EQ(support::resultInChild([&] {
+                  const linux_::Descriptor file(open((busy + identifier).c_str(), O_PATH | O_CLOEXEC));
+                  const linux_::OwnPlace own[] = {{file.get(), linux_::readFiles | linux_::writeFiles}};
+                  if (linux_::confine(*linux_::findConfinementProfile("plugin"), own)) return 1;
+                  return linux_::BusyAssertion(_root, identifier).failure() ? 2 : 0;
+              }),
+              0);
 }
 
 TEST_F(ServiceLaunch, IsForTheHostsOwnChildrenAlone) {
@@ -193,6 +225,15 @@ TEST_F(ServiceLaunch, IsForTheHostsOwnChildrenAlone) {
     EXPECT_EQ(launch("", std::string(PATH_MAX, 'x')), status(LaunchStatus::usage));
     // Another process gets nothing of what this one was granted, not even a child of it.
     EXPECT_EQ(support::resultInChild([&] { return launch(); }), status(LaunchStatus::notRegistered));
+    // Nor does who takes over the connection of a process that might ask.
+    EXPECT_EQ(support::resultInChild([&] {
+                  const auto connection = linux_::connectToRequestSocket(_root, linux_::launchSocketAddress);
+                  return support::resultInChild([&] {
+                      linux_::Descriptor registration;
+                      return linux_::exchangeRequest(connection->get(), identifier, registration);
+                  });
+              }),
+              ESRCH);
     _manager.reset();
     EXPECT_EQ(launch(), status(LaunchStatus::noManager));
 }
@@ -231,7 +272,24 @@ TEST_F(ServiceLaunch, RegistersOnlyBundlesExecutablesForProcesses) {
     EXPECT_EQ(add(overlay(), 0x7fffffff), ESRCH);
     EXPECT_EQ(add(overlay(), 0), ESRCH);
     EXPECT_EQ(add(overlay({{"LONG", std::string(linux_::maximumRegistrationSize, 'x')}})), E2BIG);
-    EXPECT_EQ(_manager->addExternalServiceForHost(getpid(), bundle() + "/Info.vlist", overlay()), EINVAL);
+    Value nested = 1;
+    for (std::size_t depth = 0; depth + 3 < maximumNesting; ++depth) nested = Array{nested};
+    for (const Value& unreadable : {Value(UUID::random()), nested})
+        EXPECT_EQ(add(overlay({{"A", unreadable}})), EINVAL);
+    const auto addProgram = [&](const std::string& path) {
+        return _manager->addExternalServiceForHost(tokenOf(getpid()), path, overlay());
+    };
+    EXPECT_EQ(addProgram(bundle() + "/Info.vlist"), EINVAL);
+    for (const std::string inner : {"Inner", "1/2/3/4/Inner"}) {
+        // Its program would get the container of whoever the inner bundle says it is.
+        support::writeManifest(
+            bundle(), Dictionary{{"VBBundleIdentifier", identifier}, {"VBBundleExecutable", inner + "/Program"}});
+        support::writeManifest(bundle() + '/' + inner, Dictionary{{"VBBundleIdentifier", "com.example.victim"},
+                                                                  {"VBBundleExecutable", "Program"}});
+        fs::copy_file(program(), bundle() + '/' + inner + "/Program");
+        EXPECT_EQ(addProgram(bundle() + '/' + inner + "/Program"), EINVAL) << inner;
+    }
+    makeBundle();
     fs::remove(program());
     EXPECT_EQ(add(), EINVAL);
     fs::create_symlink(fs::canonical("/bin/sh"), program());
@@ -240,9 +298,62 @@ TEST_F(ServiceLaunch, RegistersOnlyBundlesExecutablesForProcesses) {
     support::writeManifest(bundle(), Dictionary{{"VBBundleIdentifier", "a@b"}, {"VBBundleExecutable", "Program"}});
     EXPECT_EQ(add(), EINVAL);
     makeBundle();
-    ASSERT_EQ(chmod((_root.runtime() + "/ignitd").c_str(), 0777), 0);
-    EXPECT_EQ(add(), EACCES);
+    EXPECT_EQ(add(), 0);
+    for (const auto& [directory, open, closed] :
+         {std::tuple("/ignitd", 0777U, 0755U), {"/ignitd/hosts", 0755U, 0700U}}) {
+        startManager();
+        ASSERT_EQ(chmod((_root.runtime() + directory).c_str(), open), 0);
+        EXPECT_EQ(add({}, getppid()), EACCES) << directory;
+        ASSERT_EQ(chmod((_root.runtime() + directory).c_str(), closed), 0);
+    }
+}
+
+TEST_F(ServiceLaunch, BoundsWhatAUserMayHaveKept) {
+    startManager({8192, 8192, 1, 1});
+    const std::string page(4096, 'x');
+    EXPECT_EQ(add(overlay({{"A", page}})), 0);
+    EXPECT_EQ(add(overlay({{"A", page + page}})), EDQUOT);
+    EXPECT_EQ(add(overlay({{"A", page}})), 0) << "in its own place";
+    EXPECT_EQ(remove(), serviceHasNoInstances);
+    EXPECT_EQ(add(overlay({{"A", page}})), 0) << "what was removed does not count";
+    const support::WaitingProgram other("/bin/cat");
+    EXPECT_EQ(add(overlay(), other.pid()), EDQUOT) << "a second host";
+    {
+        Launcher running(_root, identifier, {"-c", "echo up; read line"});
+        ASSERT_EQ(running.readLine(), "up");
+        EXPECT_EQ(launch(), status(LaunchStatus::refused)) << "a second instance";
+        EXPECT_EQ(remove(), serviceInstancesTerminated);
+    }
+    startManager({8192, 4096, 2, 1});
+    EXPECT_EQ(add(), 0);
+    EXPECT_EQ(add(overlay(), other.pid()), EDQUOT) << "beyond the user's bytes";
+
+    // Who is shorter of room than the one before takes nothing away from hosts that live.
+    startManager({8192, 8192, 0, 1});
     EXPECT_EQ(launch(), status(LaunchStatus::notRegistered));
+    startManager();
+    EXPECT_EQ(launch(), 0);
+}
+
+TEST_F(ServiceLaunch, ARecycledPidInheritsNothing) {
+    support::WaitingProgram host("/bin/cat");
+    const pid_t pid = host.pid();
+    const AuditToken token = tokenOf(pid);
+    const auto identity = *linux_::ProcessIdentity::of(pid);
+    linux_::ProcessWatch watch; // nobody takes what it tells, as in the moment of the host's end
+    linux_::ServiceRegistrations registrations(_scratch / "hosts", watch);
+    ASSERT_EQ(registrations.add(identity, 0, *linux_::registrationOf(_files, program(), overlay())), 0);
+    ASSERT_TRUE(registrations.find(identity, identifier));
+    // Start times count in ticks: one must have passed.
+    while (linux_::ProcessIdentity::of(support::WaitingProgram("/bin/cat").pid())->startTime == identity.startTime) {
+    }
+    host.end();
+    if (startAs(pid) != pid) GTEST_SKIP() << "this process may not choose the pid of another one";
+    EXPECT_EQ(_manager->addExternalServiceForHost(token, program(), overlay()), ESRCH);
+    const auto recycled = *linux_::ProcessIdentity::of(pid);
+    EXPECT_FALSE(registrations.find(recycled, identifier));
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
 }
 
 TEST_F(ServiceLaunch, RemovalEndsInstancesAndRegistrations) {
@@ -295,7 +406,7 @@ TEST_F(ServiceLaunch, TenThousandRegistrationsEndWithTheirHost) {
         directory = memory / "hosts/" + linux_::ProcessIdentity::of(host.pid())->name();
         for (int number = 0; number < 10000; ++number) {
             registration.executablePath = program() + std::to_string(number);
-            ASSERT_EQ(registrations.add(host.pid(), registration), 0);
+            ASSERT_EQ(registrations.add(*linux_::ProcessIdentity::of(host.pid()), 0, registration), 0);
         }
         EXPECT_EQ(entriesOf(directory), 10000U);
         EXPECT_TRUE(watch.takeEnded().empty());
@@ -306,11 +417,14 @@ TEST_F(ServiceLaunch, TenThousandRegistrationsEndWithTheirHost) {
     EXPECT_TRUE(registrations.end(directory));
     EXPECT_FALSE(fs::exists(directory));
     EXPECT_TRUE(watch.takeEnded().empty()) << "one descriptor for all";
+
+    for (int number = 0; number < 10000; ++number) ASSERT_EQ(add(), 0);
+    EXPECT_EQ(entriesOf(fs::directory_iterator(hosts())->path()), 1U) << "each takes the place of the one before";
 }
 
 TEST_F(ServiceLaunch, ServicesOfAnotherUserLiveInThatUsersContainer) {
     if (geteuid() != 0) GTEST_SKIP() << "only root's manager serves other users";
-    const auto managers = linux_::Containers(_root).userContainer(identifier);
+    const auto managers = linux_::Containers(_root).userContainer(containerIdentifier);
     ASSERT_TRUE(managers);
     int registered[2];
     ASSERT_EQ(pipe2(registered, O_CLOEXEC), 0);
@@ -321,7 +435,7 @@ TEST_F(ServiceLaunch, ServicesOfAnotherUserLiveInThatUsersContainer) {
         if (!support::becomeOrdinaryUser() || read(registered[0], &byte, 1) != 1) _exit(1);
         Launcher launcher(_root, identifier, {"-c", "echo $TMPDIR; echo > tmp/file && pwd"});
         const std::string own =
-            _root.users() + '/' + std::to_string(support::ordinaryUser) + "/Containers/" + identifier;
+            _root.users() + '/' + std::to_string(support::ordinaryUser) + "/Containers/" + containerIdentifier;
         const std::string output = launcher.readAll();
         _exit(output == own + "/tmp\n" + own + "\n" && launcher.end() == 0 ? 0 : 2);
     }

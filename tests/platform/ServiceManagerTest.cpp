@@ -1,13 +1,13 @@
 #include "platform/linux/ServiceManager.h"
 #include "platform/linux/Files.h"
 #include "platform/linux/WorkQueue.h"
+#include "tests/support/BundleTree.h"
 #include "tests/support/ScratchDirectory.h"
 #include "tests/support/ServiceManagerFake.h"
 
 #include <cerrno>
 #include <csignal>
 #include <filesystem>
-#include <fstream>
 #include <future>
 #include <gtest/gtest.h>
 #include <spawn.h>
@@ -69,7 +69,12 @@ public:
 
     void startInstance(const std::string& version) {
         sleepers.push_back(std::make_unique<Sleeper>());
-        EXPECT_FALSE(manager->noteInstance(identifier, version, sleepers.back()->pid()));
+        record(version, sleepers.back()->pid());
+    }
+    /// As an earlier daemon left it.
+    void record(const std::string& version, pid_t pid, uid_t user = geteuid()) const {
+        support::writeFile(directory(version) + '/' + platform::linux_::ProcessIdentity::of(pid)->name(),
+                           std::to_string(user));
     }
     std::string directory(const std::string& version) const {
         return root.runtime() + "/ignitd/" + identifier + "@" + version;
@@ -127,16 +132,17 @@ TEST(FakeServiceManager, RefusesUntilAllowedAndFailsWhenTold) {
     std::vector<int> results;
     {
         support::FakeServiceManager manager;
-        EXPECT_EQ(manager.addExternalServiceForHost(7, "/program", {}), EPERM);
+        const platform::AuditToken host;
+        EXPECT_EQ(manager.addExternalServiceForHost(host, "/program", {}), EPERM);
         const auto remove = [&](const char* version) {
             manager.removeExternalService(identifier, version, queue, [&](int result) { results.push_back(result); });
         };
         remove("1");
         manager.allow();
         manager.failAdditions(EIO);
-        EXPECT_EQ(manager.addExternalServiceForHost(7, "/program", {}), EIO);
+        EXPECT_EQ(manager.addExternalServiceForHost(host, "/program", {}), EIO);
         manager.failAdditions(0);
-        EXPECT_EQ(manager.addExternalServiceForHost(7, "/program", {}), 0);
+        EXPECT_EQ(manager.addExternalServiceForHost(host, "/program", {}), 0);
         EXPECT_EQ(manager.additions().size(), 1U);
         manager.fail(identifier, "2", EIO);
         remove("2");
@@ -147,8 +153,6 @@ TEST(FakeServiceManager, RefusesUntilAllowedAndFailsWhenTold) {
     }
     queue->sync([&] { EXPECT_EQ(results, (std::vector<int>{EPERM, EIO, EIO, ECANCELED})); });
 }
-
-std::int64_t codeOf(const platform::Failure& failure) { return failure ? failure->code : 0; }
 
 class ServiceManagerOnLinux : public ServiceManagerConformance<LinuxServices> {};
 
@@ -169,19 +173,19 @@ TEST_F(ServiceManagerOnLinux, RemoveAnswersAfterTheInstancesEnded) {
 TEST_F(ServiceManagerOnLinux, RemoveKillsWhatLivesOnAfterTheGracePeriod) {
     LinuxServices world(milliseconds(20));
     const Sleeper stubborn(Sleeper::OnTerm::ignores);
-    ASSERT_FALSE(world.manager->noteInstance(identifier, "1", stubborn.pid()));
+    world.record("1", stubborn.pid());
     EXPECT_EQ(remove(*world.manager, "1").get(), 0);
     EXPECT_EQ(stubborn.endingSignal(), SIGKILL);
 }
 
-TEST_F(ServiceManagerOnLinux, RemoveNeverSignalsARecycledPid) {
+TEST_F(ServiceManagerOnLinux, RemoveNeverSignalsWhatIsNoInstanceAnyMore) {
     LinuxServices world;
     const Sleeper innocent;
-    std::filesystem::create_directories(world.directory("1"));
-    const std::string record = world.directory("1") + "/" + std::to_string(innocent.pid()) + "-1";
-    std::ofstream(record).flush();
+    const std::string recycled = world.directory("1") + "/" + std::to_string(innocent.pid()) + "-1";
+    support::writeFile(recycled, std::to_string(geteuid()));
+    world.record("1", innocent.pid(), geteuid() + 1); // as one that runs a set-user-id program by now
     EXPECT_EQ(remove(*world.manager, "1").get(), platform::serviceHasNoInstances);
-    EXPECT_FALSE(std::filesystem::exists(record)) << "stale";
+    EXPECT_FALSE(std::filesystem::exists(recycled)) << "stale";
     EXPECT_TRUE(innocent.isRunning());
 }
 
@@ -201,7 +205,6 @@ TEST_F(ServiceManagerOnLinux, RemoveDoesNotBelieveOpenDirectories) {
 
 TEST_F(ServiceManagerOnLinux, RefusesNamesThatAreNoNames) {
     LinuxServices world;
-    const Sleeper sleeper;
     const std::tuple<std::string, std::string, int> cases[] = {
         {"", "1", EINVAL},       {"..", "1", EINVAL},
         {"a/../b", "1", EINVAL}, {"a@b", "1", EINVAL},
@@ -209,20 +212,14 @@ TEST_F(ServiceManagerOnLinux, RefusesNamesThatAreNoNames) {
         {"a", "1\n", EINVAL},    {std::string(200, 'a'), std::string(200, '1'), ENAMETOOLONG}};
     for (const auto& [bundleIdentifier, version, error] : cases) {
         EXPECT_EQ(remove(*world.manager, version, bundleIdentifier).get(), error) << bundleIdentifier << " " << version;
-        EXPECT_EQ(codeOf(world.manager->noteInstance(bundleIdentifier, version, sleeper.pid())), error);
     }
-    EXPECT_FALSE(world.manager->noteInstance("a", "1 @ beta", sleeper.pid()));
-}
-
-TEST_F(ServiceManagerOnLinux, NoteInstanceRefusesWhatDoesNotRun) {
-    LinuxServices world;
-    EXPECT_EQ(codeOf(world.manager->noteInstance(identifier, "1", 0x7fffffff)), ESRCH);
+    EXPECT_EQ(remove(*world.manager, "1 @ beta", "a").get(), platform::serviceHasNoInstances);
 }
 
 TEST_F(ServiceManagerOnLinux, DestructionCancelsWhatWaits) {
     LinuxServices world;
     const Sleeper stubborn(Sleeper::OnTerm::ignores);
-    ASSERT_FALSE(world.manager->noteInstance(identifier, "1", stubborn.pid()));
+    world.record("1", stubborn.pid());
     auto answer = remove(*world.manager, "1");
     auto same = remove(*world.manager, "1");
     world.manager.reset();

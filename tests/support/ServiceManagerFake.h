@@ -74,12 +74,12 @@ public:
         for (const auto& answer : _held) answer.send(ECANCELED);
     }
 
-    int addExternalServiceForHost(pid_t host, const std::string& executablePath,
+    int addExternalServiceForHost(const platform::AuditToken& host, const std::string& executablePath,
                                   const platform::Dictionary& overlay) override {
         const std::lock_guard lock(_mutex);
         if (_additionFailure != 0) return _additionFailure;
         if (!_isAllowed) return EPERM;
-        _additions.push_back({host, executablePath, overlay});
+        _additions.push_back({host.pid, executablePath, overlay});
         return 0;
     }
     void removeExternalService(const std::string& bundleIdentifier, const std::string& version,

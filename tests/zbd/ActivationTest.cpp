@@ -75,6 +75,7 @@ TEST_F(Activation, TheServiceManagerLearnsHostExecutableAndOverlay) {
                                       {"_OmitSandboxParameters", true}}},
                           {"VBBundlePackageType", "QMX!"}}));
     EXPECT_TRUE(logged(LogLevel::info, "no QMXService for plug-in; database returned (null)"));
+    EXPECT_TRUE(logged(LogLevel::debug, "activation overlay=" + Value(additions[0].overlay).description()));
     EXPECT_TRUE(
         logged(LogLevel::info, "assigning plug-in com.example.code(1) " + plugIn.uuid->text() + " to plugin sandbox"));
     EXPECT_TRUE(logged(LogLevel::standard,
@@ -88,18 +89,19 @@ TEST_F(Activation, LaterSourcesOfTheEnvironmentReplaceEarlierOnes) {
     const Dictionary fromHost{{"HOME", "host"}, {"LANG", "host"}, {"ZBTEST_SDK", "host"}, {"OWN", "host"}};
     const auto plain = install("plain");
     EXPECT_EQ(ready({*plain.uuid}, fromHost), Dictionary());
+    EXPECT_TRUE(logged(LogLevel::debug, "pid 77 provided 4 environment entries"));
     EXPECT_EQ(service()["EnvironmentVariables"], Value(Dictionary{{"HOME", "/containers/any"},
                                                                   {"LANG", "host"},
                                                                   {"ZBTEST_SDK", "daemon"},
                                                                   {"OWN", "host"},
                                                                   {"VBFIXED_USER_HOME", "/containers/any"},
                                                                   {"TMPDIR", "/containers/any/tmp"}}));
-    const auto own = install(
-        "own", {},
-        {{"QMXService", Dictionary{{"Kept", 1},
-                                   {"_SandboxProfile", "none"},
-                                   {"EnvironmentVariables", Dictionary{{"HOME", "own"}, {"ZBTEST_SDK", "own"}}}}}});
+    const Dictionary declared{{"Kept", 1},
+                              {"_SandboxProfile", "none"},
+                              {"EnvironmentVariables", Dictionary{{"HOME", "own"}, {"ZBTEST_SDK", "own"}}}};
+    const auto own = install("own", {}, {{"QMXService", declared}});
     EXPECT_EQ(ready({*own.uuid}, fromHost), Dictionary());
+    EXPECT_TRUE(processLog.contains(LogLevel::debug, "cx", "raw QMXService=" + Value(declared).description()));
     const auto variables = service().dictionary("EnvironmentVariables").value_or(Dictionary());
     EXPECT_EQ(variables["HOME"], Value("own"));
     EXPECT_EQ(variables["ZBTEST_SDK"], Value("own"));
@@ -107,9 +109,14 @@ TEST_F(Activation, LaterSourcesOfTheEnvironmentReplaceEarlierOnes) {
     EXPECT_EQ(service()["Kept"], Value(1));
     EXPECT_EQ(service()["_SandboxProfile"], Value("plugin"));
 
-    const auto odd = install("odd", {}, {{"QMXService", Dictionary{{"EnvironmentVariables", "x"}}}});
-    EXPECT_EQ(ready({*odd.uuid}), Dictionary());
-    EXPECT_TRUE(service().dictionary("EnvironmentVariables"));
+    const std::pair<const char*, Value> wrongTypes[] = {{"odd", Dictionary{{"EnvironmentVariables", "x"}}},
+                                                        {"text", "QMXService"}};
+    for (const auto& [name, value] : wrongTypes) {
+        const auto plugIn = install(name, {}, {{"QMXService", value}});
+        EXPECT_EQ(ready({*plugIn.uuid}), Dictionary());
+        EXPECT_TRUE(service().dictionary("EnvironmentVariables")) << name;
+    }
+    EXPECT_TRUE(logged(LogLevel::info, "no QMXService for plug-in; database returned QMXService"));
 }
 
 TEST_F(Activation, ExtensionPointsChooseTheProfile) {
@@ -202,7 +209,11 @@ TEST_F(Activation, AFailureIsToldAndStopsNoOther) {
         errorReply(4, "cannot obtain executable path for plug-in com.example.broken(" + broken.uuid->text() + ")");
     EXPECT_EQ(ready({*broken.uuid, *whole.uuid}), missing);
     EXPECT_EQ(daemon.fake.serviceManager.additions().size(), 1U);
+    EXPECT_TRUE(logged(LogLevel::error, "failed to obtain execPath for plug-in " +
+                                            daemon.server->findPlugIn(*broken.uuid)->description() + "(" +
+                                            broken.uuid->text() + ") bundle=<bundle " + broken.path + ">"));
     daemon.fake.serviceManager.failAdditions(EIO);
+    EXPECT_TRUE(ready({*broken.uuid, *whole.uuid})["error"]) << "two failures, one reply";
     EXPECT_EQ(ready({*whole.uuid}),
               errorReply(4, "unable to enable plug-in com.example.whole(" + whole.uuid->text() + ")"));
     EXPECT_TRUE(logged(LogLevel::error, "ignitd error 5 trying to allow 77 /Applications/Host.app/host to use plug-in "
@@ -218,6 +229,8 @@ TEST_F(Activation, AccessGivesATokenForEachBundleOrNone) {
     const auto access = [&] { return daemon.ask("access", {{"uuids", Array{*first.uuid, *second.uuid}}}); };
     EXPECT_EQ(access(), errorReply(4, "cannot create file extension to " + second.path + ": 1"));
     daemon.fake.sandbox.allowFile(second.path);
+    daemon.server->addHold(zbd::ZBDPlugInHold::initWithPlugIns(
+        daemon.fake.transport, {daemon.server->findPlugIn(*second.uuid)}, nullptr)); // a hold keeps nobody from reading
     const auto tokens = access().array("extensions").value_or(Array());
     ASSERT_EQ(tokens.size(), 2U);
     EXPECT_TRUE(tokens[0].string()->ends_with(first.path));
