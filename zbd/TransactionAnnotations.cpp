@@ -21,8 +21,17 @@ namespace {
 /// Saving costs as much for one change as for hundreds: the file is written as a whole.
 constexpr std::size_t changesPerTurn = 256;
 
-/// Annotations are kept in XML, which holds neither UUIDs nor control characters.
-bool canBeStored(const Value& extension) { return static_cast<bool>(platform::encodeXML(extension)); }
+/// Bytes of one extension as it is stored. Hosts keep settings there, and every answer that names the plug-in carries
+/// them: once for each of the versions that share them.
+constexpr std::size_t maximumExtension = std::size_t{64} << 10U;
+
+/// Annotations are kept in XML, which holds neither UUIDs nor control characters, some containers deep.
+bool canBeStored(const Value& extension) {
+    Value stored = extension;
+    for (int container = 0; container < 3; ++container) stored = Dictionary{{"", stored}};
+    const auto text = platform::encodeXML(stored);
+    return text && text->size() <= maximumExtension;
+}
 
 } // namespace
 

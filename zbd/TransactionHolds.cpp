@@ -4,6 +4,8 @@
 #include "zbd/ZBDQmxClient.h"
 #include "zbd/ZBDServer.h"
 
+#include <unordered_set>
+
 namespace zbd {
 
 namespace log = zembra::log;
@@ -77,6 +79,7 @@ void Transaction::releaseHolds(const Array& tokens) {
 bool Transaction::collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugInRef>& plugIns) {
     // Each once, however often it is named: checking and terminating cost more than naming.
     ZBDPlugInSet known;
+    std::unordered_set<std::string> paths;
     const auto collect = [&](const ZBDPlugInRef& plugIn) {
         if (known.insert(plugIn).second) plugIns.push_back(plugIn);
     };
@@ -85,6 +88,7 @@ bool Transaction::collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugI
             fail(code::badPath, platform::format("invalid path: %@", path));
             return false;
         }
+        if (!paths.insert(path).second) return true;
         if ((flags & zembra::ZBLockPlugInPaths) == 0) {
             const auto within = server()->plugInsWithinApplication(URL::file(path));
             for (const ZBDPlugInRef& plugIn : within.value_or(std::vector<ZBDPlugInRef>())) collect(plugIn);

@@ -77,12 +77,7 @@ void ZBDAnnotationStore::setAnnotations(std::span<const AnnotationChange> change
     const auto bytes = encodedDatabase(_annotations);
     if (!bytes) {
         _annotations = before;
-        if (changes.size() == 1) {
-            log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, bytes.error());
-        } else {
-            // One of them cannot be saved; the others can.
-            for (const AnnotationChange& change : changes) setAnnotations({&change, 1});
-        }
+        log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, bytes.error());
         return;
     }
     Error error;

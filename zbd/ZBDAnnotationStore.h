@@ -44,7 +44,8 @@ public:
     /// control characters, nesting without end, more than `maximumFileSize` in all) is logged and not taken, for no
     /// change could be saved after it.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
-    /// The same for many, in their order, saved together.
+    /// The same for many, in their order, saved together: all are taken or none. (Trying them one by one would encode
+    /// a full table for each.)
     void setAnnotations(std::span<const AnnotationChange> changes);
 
     /// False, with `error` set, when no table could be loaded; the present table then is as it was.

@@ -159,14 +159,17 @@ TEST_F(AnnotationStore, WhatNoFileCanHoldIsNotTaken) {
         EXPECT_TRUE(logged(LogLevel::error, unsaved));
         EXPECT_EQ(store->annotationForIdentifier("com.example.a"), elected);
     }
-    // Nor what is too much together; the rest of the same request is taken.
+    // Nor what is too much together.
     const Dictionary half{{"extension", Dictionary{{"k", std::string(ZBDAnnotationStore::maximumFileSize / 2, 'x')}}}};
-    const std::vector<zbd::AnnotationChange> changes{{half, plugIn("b")}, {half, plugIn("c")}, {elected, plugIn("d")}};
+    const std::vector<zbd::AnnotationChange> changes{{half, plugIn("b")}, {elected, plugIn("c")}};
     store->setAnnotations(changes);
     EXPECT_EQ(stored().size(), 3U);
-    EXPECT_EQ(store->annotationForIdentifier("com.example.b"), half);
-    EXPECT_FALSE(store->annotationForIdentifier("com.example.c"));
-    EXPECT_EQ(store->annotationForIdentifier("com.example.d"), elected);
+    const std::vector<zbd::AnnotationChange> tooMuch{{elected, plugIn("d")}, {half, plugIn("e")}};
+    store->setAnnotations(tooMuch);
+    EXPECT_FALSE(store->annotationForIdentifier("com.example.d"));
+    EXPECT_FALSE(store->annotationForIdentifier("com.example.e"));
+    store->setAnnotation(elected, *plugIn("f"));
+    EXPECT_EQ(stored().size(), 4U) << "others are saved on";
 }
 
 TEST_F(AnnotationStore, UnsavedChangeGoesOutWithTheNext) {

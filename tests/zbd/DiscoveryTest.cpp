@@ -239,6 +239,8 @@ TEST_F(Discovery, AnnotationRequestsCheckBeforeTheyChange) {
         {"annotate", Dictionary{{"extension", 1}}, errorReply(4, "invalid request format (annotation extension)"), 0},
         {"annotate", Dictionary{{"extension", Dictionary{{"id", uuid(1)}}}},
          errorReply(4, "invalid request format (annotation extension)"), 0},
+        {"annotate", Dictionary{{"extension", Dictionary{{"k", std::string(64 << 10, 'x')}}}},
+         errorReply(4, "invalid request format (annotation extension)"), 0},
         {"annotate", Dictionary{{"election", 7}, {"extension", 1}},
          errorReply(4, "invalid request format (annotation extension)"), 0},
         {"annotate", Dictionary{{"election", 2}}, Dictionary(), 1},
