@@ -146,6 +146,7 @@ Outcome confineService(const ServiceDescription& service, const std::vector<OwnP
 
 std::vector<char*> pointersTo(std::vector<std::string>& texts) {
     std::vector<char*> pointers;
+    pointers.reserve(texts.size() + 1);
     for (auto& text : texts) pointers.push_back(text.data());
     pointers.push_back(nullptr);
     return pointers;
