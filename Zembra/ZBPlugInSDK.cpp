@@ -28,10 +28,10 @@ void ZBPlugInCore::resolveSDK(platform::Registry& registry) {
     const auto bundleInfo = bundleInfoDictionary();
     if (!bundleInfo) fatalInternalError("cannot resolve SDK without materialized Info.vlist");
 
-    if (const Value spec = sdkSpec()) {
-        const auto extensionPoint = spec.string();
+    if (const Value extensionPointValue = sdkSpec()) {
+        const auto extensionPoint = extensionPointValue.string();
         if (!extensionPoint) {
-            log::ops().error("invalid SDK key:%{public}@", spec);
+            log::ops().error("invalid SDK key:%{public}@", extensionPointValue);
             return;
         }
         if (const auto sdk = readSDKDictionary(registry, *extensionPoint)) {

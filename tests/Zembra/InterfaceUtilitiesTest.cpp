@@ -22,8 +22,8 @@ struct InterfaceUtilities : testing::Test {
         }
         description = interfaces.describe(interfaces.find("A"));
     }
-    Failure specify(const std::string& operation, std::string_view specification) {
-        return zembra::interfaceClassSpecification(interfaces, *description, operation, specification);
+    Failure specify(const std::string& operation, std::string_view classes) {
+        return zembra::interfaceClassSpecification(interfaces, *description, operation, classes);
     }
 };
 

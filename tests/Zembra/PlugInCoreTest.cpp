@@ -95,9 +95,9 @@ TEST(OldStyleDeathTest, FollowsTheManifestDictionary) {
 TEST(DerivedProperties, AppExtensionsHaveDefaults) {
     const auto extension = recordAt(extensionURL, {});
     EXPECT_TRUE(extension->isAppExtension());
-    for (const Value& spec :
+    for (const Value& point :
          {extension->protocolSpec(), extension->principalSpec(), extension->embeddedProtocolSpec()}) {
-        EXPECT_EQ(spec, Value("VKObject"));
+        EXPECT_EQ(point, Value("VKObject"));
     }
     const auto other = recordAt(otherURL, {});
     EXPECT_FALSE(other->isAppExtension());
