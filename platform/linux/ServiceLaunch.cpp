@@ -10,6 +10,7 @@
 #include "platform/linux/ServiceRegistrations.h"
 #include "platform/linux/UserDirectory.h"
 
+#include <array>
 #include <cerrno>
 #include <climits>
 #include <csignal>
@@ -109,12 +110,16 @@ bool dropCapabilities() {
     return ::geteuid() != 0 || ::prctl(PR_CAPBSET_READ, CAP_SYS_ADMIN, 0, 0, 0) == 0;
 }
 
-/// A host that ignores or blocks signals must not have services that cannot be asked to end.
+/// A host that ignores or blocks signals must not have services that cannot be asked to end. Asks the kernel itself:
+/// the C library hides the two signals that it keeps for its threads, and those too are inherited as ignored or
+/// blocked.
 void resetSignals() {
-    for (int number = 1; number <= SIGRTMAX; ++number) (void)::signal(number, SIG_DFL); // not all can be set
-    sigset_t none;
-    sigemptyset(&none);
-    ::sigprocmask(SIG_SETMASK, &none, nullptr);
+    const std::array<std::uint64_t, 8> byDefault{}; // the kernel's action and its mask of signals: zeros mean SIG_DFL
+    const std::uint64_t none = 0;
+    for (int number = 1; number <= SIGRTMAX; ++number) {
+        ::syscall(SYS_rt_sigaction, number, byDefault.data(), nullptr, sizeof none); // not all can be set
+    }
+    ::syscall(SYS_rt_sigprocmask, SIG_SETMASK, &none, nullptr, sizeof none);
 }
 
 /// The file that tells "vigild" of a busy instance, made here so that the service needs no right to make others, nor to
