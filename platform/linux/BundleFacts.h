@@ -72,8 +72,9 @@ struct DirectoryIdentity {
 /// What the registry keeps of one bundle directory. Immutable but for `evidence`.
 struct BundleFacts {
     DirectoryIdentity identity;
-    /// A digest of the states (inode, size, times) of every file that was read. While the files still give the same
-    /// digest, nothing needs to be read again. 0: read again in any case.
+    /// A digest of the states (inode, size, times) of every file that was read, and of an application's folder of
+    /// plug-ins. While the files still give the same digest, nothing needs to be read again. The upper half is for what
+    /// a cursory look sees. 0: read again in any case.
     mutable std::atomic<std::uint64_t> evidence = 0;
     std::uint64_t fingerprint = 0; // a digest of the content: manifest, entitlements, string tables
     bool hasResources = false;     // most bundles have none, and need no look for localized names

@@ -6,9 +6,11 @@
 #include "platform/linux/Entitlements.h"
 
 #include <algorithm>
+#include <array>
 #include <cstring>
 #include <ctime>
 #include <fcntl.h>
+#include <functional>
 #include <sys/stat.h>
 
 namespace platform::linux_ {
@@ -55,24 +57,23 @@ std::int64_t fileClock() {
 /// recent and is read again another time.
 class BundleScanner::FileStates {
 public:
-    DirectoryIdentity add(int directory, const std::string& name, int flags = 0) {
+    /// Of the file at `path` below `directory`, or of `directory` itself when that is empty.
+    DirectoryIdentity add(Look look, int directory, const std::string& path) {
+        std::string& states = look == Look::cursory ? _cursory : _others;
+        constexpr int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_EMPTY_PATH;
         struct statx status{};
-        if (statx(directory, name.c_str(), flags | AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &status) !=
-            0) {
-            _states += "absent";
+        if (statx(directory, path.c_str(), flags, STATX_BASIC_STATS | STATX_BTIME, &status) != 0) {
+            states += "absent";
             return {};
         }
         const DirectoryIdentity identity{(std::uint64_t{status.stx_dev_major} << 32U) | status.stx_dev_minor,
                                          status.stx_ino,
                                          (status.stx_mask & STATX_BTIME) != 0 ? inNanoseconds(status.stx_btime) : 0};
         const std::int64_t changed = inNanoseconds(status.stx_ctime);
-        append(_states, identity.device);
-        append(_states, identity.inode);
-        append(_states, identity.birth);
-        append(_states, status.stx_size);
-        append(_states, inNanoseconds(status.stx_mtime));
-        append(_states, changed);
-        _states += name;
+        append(states,
+               std::array{identity.device, identity.inode, static_cast<std::uint64_t>(identity.birth),
+                          std::uint64_t{status.stx_size}, static_cast<std::uint64_t>(inNanoseconds(status.stx_mtime)),
+                          static_cast<std::uint64_t>(changed)});
         // A file that changes twice within one tick of its clock shows one time for both. Whole seconds are the ticks
         // of old file systems.
         const std::int64_t tick = changed % nanoseconds == 0 ? 2 * nanoseconds : nanoseconds / 10;
@@ -80,20 +81,49 @@ public:
         return identity;
     }
 
+    /// Of a string table in `directory`, whose own state, which would tell of another name, is not looked at.
+    void addTable(int directory, const std::string& name) {
+        add(Look::thorough, directory, name);
+        _others += name;
+    }
+
+    /// Of what every bundle of that kind has. Answers the identity of the bundle's directory.
+    DirectoryIdentity addBundle(const Place& place, BundleKind kind) {
+        addWhatIsChosenFrom(place, kind);
+        if (kind == BundleKind::application) add(Look::thorough, place.directory, place.below(manifestName));
+        return add(Look::thorough, place.directory, place.name);
+    }
+    void addWhatIsChosenFrom(const Place& place, BundleKind kind) {
+        add(Look::cursory, place.directory, place.below(kind == BundleKind::plugIn ? manifestName : plugInsName));
+    }
+
     /// As `BundleFacts::evidence`.
-    std::uint64_t evidence() const { return _isRecent ? 0 : digest(_states); }
+    std::uint64_t evidence() const {
+        if (_isRecent) return 0;
+        return std::max<std::uint64_t>((hash(_cursory) << 32U) | (hash(_others) & 0xffff'ffffU), 1);
+    }
+
+    bool agreesWith(std::uint64_t evidence, Look look) const {
+        if (_isRecent) return false;
+        return look == Look::thorough ? evidence == this->evidence()
+                                      : evidence >> 32U == (hash(_cursory) & 0xffff'ffffU);
+    }
 
 private:
+    // Not `digest`: tens of thousands are made at a start. One that another release hashed otherwise is no harm, for
+    // then the bundle is read again.
+    static std::uint64_t hash(const std::string& bytes) { return std::hash<std::string>()(bytes); }
+
     const std::int64_t _start = fileClock();
-    std::string _states;
+    std::string _cursory;
+    std::string _others;
     bool _isRecent = false;
 };
 
-bool BundleScanner::visitResources(int directory, const std::string& path, const Watch& watch, FileStates& states,
-                                   std::string* content) {
-    const Descriptor resources = openDirectory(directory, resourcesName);
+bool BundleScanner::visitResources(const Place& place, const Watch& watch, FileStates& states, std::string* content) {
+    const Descriptor resources = openDirectory(place.directory, place.below(resourcesName));
     if (!resources) return false;
-    const std::string resourcesPath = path + "/" + resourcesName;
+    const std::string resourcesPath = place.path + "/" + resourcesName;
     watch(resources.get(), resourcesPath);
     auto languages = listDirectory(resources.get()).value_or(DirectoryListing()).directories;
     if (languages.size() > maximumResourceEntries) languages.resize(maximumResourceEntries);
@@ -105,7 +135,7 @@ bool BundleScanner::visitResources(int directory, const std::string& path, const
         std::erase_if(tables, [](const auto& name) { return !name.ends_with(tableSuffix); });
         if (tables.size() > maximumResourceEntries) tables.resize(maximumResourceEntries);
         for (const auto& table : tables) {
-            states.add(folder.get(), table);
+            states.addTable(folder.get(), table);
             if (content == nullptr) continue;
             *content += language + "/" + table + "=";
             if (content->size() >= maximumTablesSize) continue;
@@ -116,33 +146,45 @@ bool BundleScanner::visitResources(int directory, const std::string& path, const
     return true;
 }
 
-bool BundleScanner::isUnchanged(int directory, const std::string& path, const BundleFacts& known, const Watch& watch) {
+bool BundleScanner::isUnchanged(const Place& place, BundleKind kind, const BundleFacts& known, Look look,
+                                const Watch& watch) {
     const std::uint64_t evidence = known.evidence;
     if (evidence == 0) return false;
     FileStates states;
-    const bool isSameDirectory = states.add(directory, "", AT_EMPTY_PATH) == known.identity;
-    states.add(directory, manifestName);
-    if (!known.executable.empty()) states.add(directory, known.executable);
+    if (look == Look::cursory) {
+        states.addWhatIsChosenFrom(place, kind);
+        return states.agreesWith(evidence, look);
+    }
+    const bool isSameDirectory = states.addBundle(place, kind) == known.identity;
+    if (!known.executable.empty()) states.add(look, place.directory, place.below(known.executable));
     // Where none were, the directory's own state tells that there are none.
-    if (known.hasResources) visitResources(directory, path, watch, states, nullptr);
-    return isSameDirectory && states.evidence() == evidence;
+    if (known.hasResources) visitResources(place, watch, states, nullptr);
+    return isSameDirectory && states.agreesWith(evidence, look);
 }
 
-bool BundleScanner::isUnchanged(const std::string& path, const BundleFacts& known) const {
+bool BundleScanner::isUnchanged(int directory, const std::string& name, BundleKind kind, const BundleFacts& known,
+                                Look look) {
+    return isUnchanged({directory, name, name}, kind, known, look, [](int, const std::string&) {});
+}
+
+bool BundleScanner::isUnchanged(const std::string& path, BundleKind kind, const BundleFacts& known) {
     const Descriptor directory = openDirectory(path);
-    return directory && isUnchanged(directory.get(), path, known, [](int, const std::string&) {});
+    return directory && isUnchanged({directory.get(), std::string(), path}, kind, known, Look::thorough,
+                                    [](int, const std::string&) {});
 }
 
 ScannedBundle BundleScanner::scan(int directory, const std::string& path, BundleKind kind,
                                   const BundleFactsRef& known) const {
     using State = ScannedBundle::State;
     _watch(directory, path);
-    if (known && isUnchanged(directory, path, *known, _watch)) return {State::unchanged, {}, known->identity, known};
+    const std::string itself;
+    const Place place{directory, itself, path};
+    if (known && isUnchanged(place, kind, *known, Look::thorough, _watch))
+        return {State::unchanged, {}, known->identity, known};
 
     FileStates states;
     auto facts = std::make_shared<BundleFacts>();
-    facts->identity = states.add(directory, "", AT_EMPTY_PATH);
-    states.add(directory, manifestName);
+    facts->identity = states.addBundle(place, kind);
     const auto bytes = readFile(directory, manifestName, maximumManifestSize);
     if (!bytes && isShortage(static_cast<int>(bytes.error().code)))
         return {State::unknown, bytes.error().text(), facts->identity, nullptr};
@@ -171,7 +213,7 @@ ScannedBundle BundleScanner::scan(int directory, const std::string& path, Bundle
     const auto executable = info->string("VBBundleExecutable");
     if (kind == BundleKind::plugIn && executable && isFileName(*executable)) {
         facts->executable = *executable;
-        states.add(directory, facts->executable);
+        states.add(Look::thorough, directory, facts->executable);
         const Descriptor program(openat(directory, facts->executable.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
         const auto entitlements = program ? readEntitlements(program.get()) : Result(std::optional<Dictionary>());
         // Entitlements that cannot be read entitle to nothing.
@@ -183,7 +225,7 @@ ScannedBundle BundleScanner::scan(int directory, const std::string& path, Bundle
                 std::string_view(content).substr(start), _strings, StoredDictionary::Keeps::whatWasAskedFor);
         }
     }
-    facts->hasResources = visitResources(directory, path, _watch, states, &content);
+    facts->hasResources = visitResources(place, _watch, states, &content);
     facts->evidence = states.evidence();
     facts->fingerprint = digest(content);
     return {State::read, {}, facts->identity, facts};

@@ -10,6 +10,7 @@ namespace platform::linux_ {
 
 inline constexpr const char* manifestName = "Info.vlist";
 inline constexpr const char* resourcesName = "Resources";
+inline constexpr const char* plugInsName = "PlugIns";
 inline constexpr std::string_view tableSuffix = ".vlist";
 
 /// A manifest is a page of text; what is larger is a mistake or an attack.
@@ -27,6 +28,12 @@ inline constexpr std::size_t maximumResourceEntries = 256;
 inline constexpr std::size_t maximumTablesSize = std::size_t{4} << 20U;
 
 enum class BundleKind { application, plugIn };
+
+/// How much of a bundle is compared with what is known of it.
+enum class Look {
+    cursory,  // what there is to choose from: an application's folder of plug-ins, a plug-in's manifest
+    thorough, // everything that was read
+};
 
 struct ScannedBundle {
     enum class State {
@@ -56,15 +63,26 @@ public:
     /// `directory` is open, `path` its name for `watch`. `known` are the facts of an earlier scan, or null.
     ScannedBundle scan(int directory, const std::string& path, BundleKind kind, const BundleFactsRef& known) const;
 
-    /// Whether the files of the bundle at `path` are still those that `known` were read from. False also for doubt.
-    bool isUnchanged(const std::string& path, const BundleFacts& known) const;
+    /// Whether the files of the bundle at `path` are still those that `known` were read from, and of an application
+    /// also whether the same plug-ins lie in it. False also for doubt.
+    static bool isUnchanged(const std::string& path, BundleKind kind, const BundleFacts& known);
+    /// The same for the bundle at `name`, a path below the open `directory`. Follows links on the way to the bundle.
+    static bool isUnchanged(int directory, const std::string& name, BundleKind kind, const BundleFacts& known,
+                            Look look);
 
 private:
     class FileStates;
-    static bool isUnchanged(int directory, const std::string& path, const BundleFacts& known, const Watch& watch);
+    /// A bundle by a path below an open directory, and by its name for `watch`.
+    struct Place {
+        int directory;
+        const std::string& name; // empty for the open directory itself
+        const std::string& path;
+        std::string below(const std::string& file) const { return name.empty() ? file : name + "/" + file; }
+    };
+    static bool isUnchanged(const Place& place, BundleKind kind, const BundleFacts& known, Look look,
+                            const Watch& watch);
     /// Goes through the string tables, and with `content` appends what they contain to it. False without resources.
-    static bool visitResources(int directory, const std::string& path, const Watch& watch, FileStates& states,
-                               std::string* content);
+    static bool visitResources(const Place& place, const Watch& watch, FileStates& states, std::string* content);
 
     const Watch _watch;
     SharedStrings& _strings;

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <chrono>
 #include <sys/inotify.h>
 #include <sys/stat.h>
@@ -16,7 +17,6 @@ namespace platform::linux_ {
 namespace {
 
 constexpr std::string_view applicationSuffix = ".app";
-constexpr std::string_view plugInsName = "PlugIns";
 /// Folders below an applications directory in which applications are looked for.
 constexpr std::size_t maximumFolderDepth = 4;
 /// Each registration by path is looked at with every change on disk.
@@ -24,6 +24,8 @@ constexpr std::size_t maximumRegistrations = 4096;
 /// Every directory on the way to one is watched, and walking there takes time for each.
 constexpr std::ptrdiff_t maximumRegistrationDepth = 64;
 constexpr const char* everything = ""; // every path is below it
+/// More places than these are found sooner on a walk through everything.
+constexpr std::size_t maximumPlacesByPath = 1000;
 
 LogHandle& cx() {
     // The log belongs to the process and is set before the first service is made.
@@ -84,13 +86,14 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     _exclusions = std::move(contents.exclusions);
     _isKnowledgeUnsaved = !contents.knowledge;
     _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
-    if (start == Start::verified || !contents.knowledge) rescan({everything}, Manifests::settled);
+    if (start == Start::watched || !contents.knowledge) rescan({everything}, Manifests::settled);
 }
 
 bool InstalledBundles::isUnchanged(const InstalledPlugIn& plugIn) const {
     const auto& application = plugIn.application;
-    return _scanner.isUnchanged(plugIn.path, *plugIn.facts) &&
-           (!application || _scanner.isUnchanged(application->path, *application->facts));
+    return BundleScanner::isUnchanged(plugIn.path, BundleKind::plugIn, *plugIn.facts) &&
+           (!application ||
+            BundleScanner::isUnchanged(application->path, BundleKind::application, *application->facts));
 }
 
 /// The application, the plug-in outside applications or the subfolder at or around `path`. None for what is no
@@ -114,7 +117,7 @@ bool InstalledBundles::isDiscovered(const std::string& path) const {
         const auto place = placeInFolder(folder, path);
         if (!place) return false;
         if (folder.kind == FolderKind::plugIns) return *place == path;
-        return path.substr(0, slash) == *place + "/" + std::string(plugInsName);
+        return path.substr(0, slash) == *place + "/" + plugInsName;
     });
 }
 
@@ -132,7 +135,8 @@ void InstalledBundles::touch(const std::string& path, Places& places) const {
 }
 
 InstalledBundles::Change InstalledBundles::catchUp() {
-    if (!_isVerified) return rescan({everything}, Manifests::settled);
+    if (_stage < Stage::verified) return compare();
+    if (_stage < Stage::watched) return rescan({everything}, Manifests::settled);
     std::vector<RegistryWatcher::Event> events;
     if (!_watcher.read(events)) {
         cx().info("too many changes at once; looking at all bundles");
@@ -155,8 +159,99 @@ InstalledBundles::Change InstalledBundles::catchUp() {
     return change;
 }
 
+/// The places that are not as they are known, and those of which that cannot be told. Registrations are not compared.
+InstalledBundles::Places InstalledBundles::changedPlaces(Look look) const {
+    Places changed;
+    for (const auto& folder : _folders) {
+        if (const Descriptor directory = openDirectory(folder.path))
+            compareFolder(directory.get(), folder, 0, look, changed);
+        else if (isShortage(errno) || !pathsBelow(_applications, folder.path).empty() ||
+                 !pathsBelow(_plugIns, folder.path).empty())
+            changed.insert(folder.path);
+    }
+    return changed;
+}
+
+void InstalledBundles::compareFolder(int directory, const Folder& folder, std::size_t depth, Look look,
+                                     Places& changed) const {
+    const auto listing = listDirectory(directory);
+    if (!listing) {
+        changed.insert(folder.path);
+        return;
+    }
+    const std::string prefix = folder.path + "/";
+    const auto& names = listing->directories;
+    const auto compareUnknown = [&](const std::string& name) {
+        const bool isPlain = folder.kind == FolderKind::applications && !isApplicationName(name);
+        if (isPlain && depth >= maximumFolderDepth) return;
+        const Descriptor subfolder = isPlain ? openDirectory(directory, name) : Descriptor();
+        if (subfolder)
+            compareFolder(subfolder.get(), {prefix + name, folder.kind}, depth + 1, look, changed);
+        else
+            changed.insert(prefix + name);
+    };
+    const auto compareAll = [&](const auto& allKnown, const auto& isUnchanged) {
+        auto name = names.begin();
+        for (auto known = allKnown.lower_bound(prefix); known != allKnown.end() && known->first.starts_with(prefix);
+             ++known) {
+            if (look == Look::cursory && !changed.empty()) return; // it takes a thorough look anyway
+            const auto rest = std::string_view(known->first).substr(prefix.size());
+            if (const auto slash = rest.find('/'); slash != std::string_view::npos) {
+                const auto subfolder = rest.substr(0, slash);
+                if (!std::ranges::binary_search(names, subfolder)) changed.insert(prefix + std::string(subfolder));
+                continue;
+            }
+            while (name != names.end() && *name < rest) compareUnknown(*name++);
+            const bool isThere = name != names.end() && *name == rest;
+            if (!isThere || !isUnchanged(*name, *known->second)) changed.insert(known->first);
+            if (isThere) ++name;
+        }
+        while (name != names.end()) compareUnknown(*name++);
+    };
+    if (folder.kind == FolderKind::plugIns) {
+        compareAll(_plugIns, [&](const std::string& name, const InstalledPlugIn& plugIn) {
+            return BundleScanner::isUnchanged(directory, name, BundleKind::plugIn, *plugIn.facts, look);
+        });
+        return;
+    }
+    auto plugIn = _plugIns.lower_bound(prefix);
+    compareAll(_applications, [&](const std::string& name, const InstalledApplication& application) {
+        if (!BundleScanner::isUnchanged(directory, name, BundleKind::application, *application.facts, look))
+            return false;
+        const std::string below = application.path + "/";
+        // Nearly always they follow those of the application before.
+        if (plugIn == _plugIns.end() || !plugIn->first.starts_with(below)) plugIn = _plugIns.lower_bound(below);
+        for (; plugIn != _plugIns.end() && plugIn->first.starts_with(below); ++plugIn) {
+            const std::string relative = plugIn->first.substr(prefix.size());
+            const auto& facts = *plugIn->second->facts;
+            if (!BundleScanner::isUnchanged(directory, relative, BundleKind::plugIn, facts, look)) return false;
+        }
+        return true;
+    });
+}
+
+/// Compares the disk with what is known, in as few system calls as there may be, for everyone waits.
+InstalledBundles::Change InstalledBundles::compare() {
+    // Few have registrations; what lies around these is looked at as always.
+    if (_stage == Stage::stored && _registrations.empty() && changedPlaces(Look::cursory).empty()) {
+        _stage = Stage::glanced;
+        return {};
+    }
+    Places changed = changedPlaces(Look::thorough);
+    if (changed.size() > maximumPlacesByPath) return rescan({everything}, Manifests::settled);
+    for (const auto& registration : _registrations) {
+        for (auto& directory : ancestors(registration)) {
+            if (isApplicationName(directory)) changed.insert(std::move(directory));
+        }
+        changed.insert(registration);
+    }
+    auto change = rescan(std::move(changed), Manifests::settled);
+    _stage = Stage::verified;
+    return change;
+}
+
 InstalledBundles::Change InstalledBundles::verify() {
-    if (!_isVerified) return catchUp();
+    if (_stage < Stage::watched) return catchUp();
     Places places = _incomplete;
     for (const auto& directory : _watcher.unwatched()) touch(directory, places);
     return rescan(std::move(places), Manifests::settled);
@@ -209,7 +304,7 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
         return all.contains(everything) ||
                std::ranges::any_of(ancestors(place), [&](const auto& directory) { return all.contains(directory); });
     });
-    if (places.contains(everything)) _isVerified = true;
+    if (places.contains(everything)) _stage = Stage::watched;
     _manifests = manifests;
     _isShort = false;
     Found found;
@@ -282,14 +377,20 @@ void InstalledBundles::scanApplication(int directory, const std::string& path, F
     if (!facts) return;
     _refusals.erase(path);
     found.applications[path] = facts;
-    const Descriptor plugIns = open(directory, std::string(plugInsName));
+    const Descriptor plugIns = open(directory, plugInsName);
     if (!plugIns) return;
-    const std::string plugInsPath = path + "/" + std::string(plugInsName);
+    const std::string plugInsPath = path + "/" + plugInsName;
+    bool isEachKnown = true;
     _watcher.watch(plugIns.get(), plugInsPath, RegistryWatcher::Role::content);
     for (const auto& name : directoriesIn(plugIns.get())) {
         const std::string plugInPath = plugInsPath + "/" + name;
         if (const Descriptor plugIn = open(plugIns.get(), name)) scanPlugIn(plugIn.get(), plugInPath, path, found);
+        isEachKnown = isEachKnown && (found.plugIns.contains(plugInPath) || _exclusions.contains(plugInPath));
     }
+    if (isEachKnown) return;
+    // Another directory there may become a plug-in, and the folder would not tell.
+    if (facts == knownFacts && facts->evidence != 0) _unsavedApplications.insert(path);
+    facts->evidence = 0;
 }
 
 void InstalledBundles::scanPlugIn(int directory, const std::string& path, const std::string& application,
@@ -335,6 +436,7 @@ void InstalledBundles::scanRegistration(const std::string& path, Found& found) {
         const auto scanned = _scanner.scan(around.get(), candidate, BundleKind::application, knownFacts);
         const auto facts = accept(candidate, scanned, knownFacts);
         if (!facts) continue;
+        if (facts != knownFacts) facts->evidence = 0; // the other plug-ins in it were not looked at
         found.applications[candidate] = facts;
         application = candidate;
         break;

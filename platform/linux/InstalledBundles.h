@@ -32,25 +32,34 @@ public:
     };
 
     enum class Start {
-        verified, // what is known then is true
-        stored,   // what the database tells, when it tells anything; the first `catchUp` makes it true
+        watched, // what is known then is true
+        stored,  // what the database tells, when it tells anything; a few calls of `catchUp` make it true
+    };
+
+    /// What was done since the start.
+    enum class Stage {
+        stored,   // nothing
+        glanced,  // no plug-in came or went, and no manifest of one changed: what queries select by is true
+        verified, // everything is true of the disk at the start, or later
+        watched,  // and whatever changes is noticed
     };
 
     /// Reads the database, and then, as `start` says, the disk. `root` has no symbolic links in it.
-    InstalledBundles(const Root& root, const RegistryLimits& limits, Start start = Start::verified);
+    InstalledBundles(const Root& root, const RegistryLimits& limits, Start start = Start::watched);
 
-    /// Whether the disk was looked at since the start.
-    bool isVerified() const { return _isVerified; }
+    Stage stage() const { return _stage; }
     /// Whether the plug-in's bundle, and its application's, are still on disk as they were read: for one that is asked
     /// for before everything is verified. Any thread.
     bool isUnchanged(const InstalledPlugIn& plugIn) const;
 
     /// Readable when `catchUp` has something to do; negative when there is no such descriptor.
     int descriptor() const { return _watcher.descriptor(); }
-    /// Takes in everything that happened on disk until now.
+    /// Takes in everything that happened on disk until now. Before that is watched, goes one stage further or more.
     Change catchUp();
     /// Something may have changed that `catchUp` does not hear of; `verify` finds it.
-    bool needsVerifying() const { return !_isVerified || !_watcher.unwatched().empty() || !_incomplete.empty(); }
+    bool needsVerifying() const {
+        return _stage < Stage::verified || !_watcher.unwatched().empty() || !_incomplete.empty();
+    }
     Change verify();
 
     using Tell = std::function<void(const Change&)>;
@@ -85,6 +94,11 @@ private:
     std::optional<std::string> placeInFolder(const Folder& folder, const std::string& path) const;
     bool isDiscovered(const std::string& path) const;
     void touch(const std::string& path, Places& places) const;
+
+    // Comparing the disk with what is known.
+    Places changedPlaces(Look look) const;
+    void compareFolder(int directory, const Folder& folder, std::size_t depth, Look look, Places& changed) const;
+    Change compare();
 
     // Reading the disk.
     Change rescan(Places places, Manifests manifests);
@@ -121,7 +135,7 @@ private:
     std::set<std::string> _registrations; // registered by path; installed or awaited
     Exclusions _exclusions;               // unregistered although they lie where plug-ins are looked for
     Knowledge _knowledge;
-    bool _isVerified = false;
+    Stage _stage = Stage::stored;
 
     Manifests _manifests = Manifests::settled;    // during a scan
     bool _isShort = false;                        // during a scan: something could not be looked at

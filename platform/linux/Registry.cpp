@@ -13,6 +13,7 @@
 #include "platform/linux/ServiceThread.h"
 #include "platform/linux/StringTables.h"
 
+#include <algorithm>
 #include <atomic>
 #include <condition_variable>
 #include <cstdlib>
@@ -30,6 +31,11 @@
 namespace platform::linux_ {
 
 namespace {
+
+using Stage = InstalledBundles::Stage;
+
+/// Candidates of one query that are looked at for it alone. Of more the registry's thread soon knows, too.
+constexpr std::size_t maximumLooks = 500;
 
 constexpr const char* placeholderKey = "VBBundleIsPlaceholder";
 
@@ -90,7 +96,8 @@ public:
           _wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
         show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
         _thread = startServiceThread("registry", [this] { run(); });
-        if (!_thread) publish(_bundles.catchUp());
+        if (_thread) return;
+        while (_bundles.stage() < Stage::watched) publish(_bundles.catchUp());
     }
 
     ~Implementation() {
@@ -113,13 +120,16 @@ public:
         return _snapshot;
     }
 
+    /// Asked many times for each answer, so it takes no share in the snapshot.
+    UUID knowledgeUUID() const {
+        const std::lock_guard lock(_mutex);
+        return _snapshot->knowledge().uuid;
+    }
+
     /// The snapshot for an answer, once the disk was looked at. What is not watched is verified soon after somebody
     /// asked.
     std::shared_ptr<const RegistrySnapshot> snapshotForAnswer() {
-        if (!_isVerified.load(std::memory_order_acquire)) {
-            std::unique_lock lock(_mutex);
-            _verified.wait(lock, [&] { return _isVerified.load(std::memory_order_relaxed); });
-        }
+        awaitStage(Stage::verified);
         if (_needsVerifying.load(std::memory_order_relaxed) && !_isVerifyWanted.exchange(true)) wake();
         return snapshot();
     }
@@ -127,11 +137,26 @@ public:
     /// The plug-in that `find` finds in the snapshot for an answer. While the disk is not looked at yet, one that was
     /// known before the start and is unchanged need not wait for that.
     template <class F> InstalledPlugInRef lookUp(F&& find) {
-        if (!_isVerified.load(std::memory_order_acquire)) {
+        if (_stage.load(std::memory_order_acquire) < Stage::verified) {
             const auto plugIn = find(*snapshot());
             if (plugIn && _bundles.isUnchanged(*plugIn)) return plugIn;
         }
         return find(*snapshotForAnswer());
+    }
+
+    /// The plug-ins that may match. Once every manifest was looked at, it is known which these are; while the rest of
+    /// the bundles is not, theirs are looked at here.
+    std::vector<InstalledPlugInRef> matching(const std::vector<EqualityTest>& tests) {
+        if (!tests.empty() && _stage.load(std::memory_order_acquire) < Stage::verified) {
+            auto plugIns = snapshot()->matching(tests); // meanwhile the other thread looks
+            awaitStage(Stage::glanced);
+            const auto isUnchanged = [&](const auto& plugIn) { return _bundles.isUnchanged(*plugIn); };
+            // Up to this stage there is one snapshot only.
+            if (_stage.load(std::memory_order_acquire) == Stage::glanced && plugIns.size() <= maximumLooks &&
+                std::ranges::all_of(plugIns, isUnchanged))
+                return plugIns;
+        }
+        return snapshotForAnswer()->matching(tests);
     }
 
     std::shared_ptr<const Languages> languages() {
@@ -158,7 +183,8 @@ public:
         if (auto made = madeOf(plugIn->proxy, languages)) return made;
         auto proxy = describe(*plugIn, languages);
         if (!isDataOnly(*proxy->infoDictionary) && proxy->plugInIdentifier) {
-            auto container = makeContainer(*proxy->plugInIdentifier);
+            auto container = _containers.userContainer(*proxy->plugInIdentifier);
+            noteContainer(*plugIn);
             // Not kept without its container: what prevents that may pass.
             if (!container) return proxy;
             proxy->dataContainerURL = URL::file(*container);
@@ -234,6 +260,12 @@ private:
         return answer;
     }
 
+    void awaitStage(Stage stage) {
+        if (_stage.load(std::memory_order_acquire) >= stage) return;
+        std::unique_lock lock(_mutex);
+        _stageReached.wait(lock, [&] { return _stage.load(std::memory_order_relaxed) >= stage; });
+    }
+
     void wake() const {
         const std::uint64_t one = 1;
         // Fails only when the counter is full, and then the thread is awake.
@@ -241,7 +273,7 @@ private:
     }
 
     void run() {
-        publish(_bundles.catchUp());
+        while (_bundles.stage() < Stage::watched) publish(_bundles.catchUp());
         while (true) {
             pollfd waiting[] = {{_bundles.descriptor(), POLLIN, 0}, {_wake.get(), POLLIN, 0}};
             (void)poll(waiting, 2, -1);
@@ -278,7 +310,8 @@ private:
 
     /// Before any notice, for observers ask, or wait for others who do. With the lock held.
     void releaseAnswers() {
-        if (_bundles.isVerified() && !_isVerified.exchange(true)) _verified.notify_all();
+        const Stage stage = _bundles.stage();
+        if (_stage.exchange(stage) != stage) _stageReached.notify_all();
     }
 
     void publish(const InstalledBundles::Change& change) {
@@ -289,7 +322,7 @@ private:
         }
         const auto& [uuid, sequence] = _bundles.knowledge();
         // At the start nobody was told of what went while the registry was not running.
-        const bool isStart = !_isVerified.load(std::memory_order_relaxed);
+        const bool isStart = _stage.load(std::memory_order_relaxed) < Stage::verified;
         if (!change.removed.empty() && !change.installed.empty() && !isStart) {
             // What takes the place of another one is seen only after that one's end was told: the two may share a UUID.
             const auto observers =
@@ -305,34 +338,32 @@ private:
         tellRemoved(observers, change.replaced);
         tellInstalled(observers, change.installed);
         tellInstalled(observers, change.renewed);
-        if (!change.removed.empty()) discardContainers();
+        if (!change.removed.empty()) discardContainers(change.removed);
     }
 
-    Result<std::string> makeContainer(const std::string& identifier) {
-        {
-            // First, so that none is ever there unnoticed.
-            const std::lock_guard lock(_madeMutex);
-            _containersMade.insert(identifier);
-        }
-        return _containers.userContainer(identifier);
+    /// After a container was made. That of a plug-in that went meanwhile nobody will discard with the plug-in.
+    void noteContainer(const InstalledPlugIn& plugIn) {
+        const auto current = snapshot()->plugIn(plugIn.uuid);
+        if (current && current->identifier == plugIn.identifier) return;
+        const std::lock_guard lock(_madeMutex);
+        _containersLeft.insert(*plugIn.identifier);
     }
 
-    /// What was made for plug-ins that went and left nothing in it goes too: a bundle whose identifier is rewritten
-    /// again and again would leave a directory for each. Those made meanwhile from an older snapshot go the next time.
-    void discardContainers() {
+    /// The containers of plug-ins that went without leaving anything in them go too: a bundle whose identifier is
+    /// rewritten again and again would leave a directory for each. Those made meanwhile go the next time.
+    void discardContainers(const PlugIns& removed) {
         std::set<std::string> unused;
         {
             const std::lock_guard lock(_madeMutex);
-            unused.swap(_containersMade);
+            unused.swap(_containersLeft);
         }
-        std::set<std::string> used;
+        for (const auto& [path, plugIn] : removed) {
+            if (plugIn->identifier) unused.insert(*plugIn->identifier);
+        }
         for (const auto& [path, plugIn] : _bundles.plugIns()) {
-            if (auto node = plugIn->identifier ? unused.extract(*plugIn->identifier) : decltype(unused)::node_type())
-                used.insert(std::move(node));
+            if (plugIn->identifier) unused.erase(*plugIn->identifier);
         }
         for (const auto& identifier : unused) _containers.discardEmpty(identifier);
-        const std::lock_guard lock(_madeMutex);
-        _containersMade.merge(used);
     }
 
     void tellRemoved(const Observers& observers, const PlugIns& plugIns) {
@@ -408,12 +439,12 @@ private:
     std::vector<std::weak_ptr<RegistryObserver>> _observers;
     std::vector<std::function<void()>> _actions;
     bool _isStopping = false;
-    std::atomic<bool> _isVerified = false; // the snapshot tells what is on disk, not what was there at the last stop
-    std::condition_variable _verified;
+    std::atomic<Stage> _stage = Stage::stored; // how far the snapshot tells what is on disk
+    std::condition_variable _stageReached;
 
     mutable std::mutex _madeMutex; // for everything that was made of records; innermost, too
     std::shared_ptr<const Languages> _languages;
-    std::set<std::string> _containersMade; // identifiers
+    std::set<std::string> _containersLeft; // identifiers of plug-ins that are gone
 
     std::atomic<bool> _needsVerifying = false;
     std::atomic<bool> _isVerifyWanted = false;
@@ -436,7 +467,7 @@ std::optional<std::vector<PlugInProxyRef>> Registry::installedPlugIns() {
 }
 
 std::optional<std::vector<PlugInProxyRef>> Registry::plugInsMatching(const Dictionary& query, const Filter& filter) {
-    auto plugIns = _implementation->snapshotForAnswer()->matching(equalityTests(query));
+    auto plugIns = _implementation->matching(equalityTests(query));
     std::erase_if(plugIns, [&](const auto& plugIn) {
         const auto& stored = plugIn->facts->entitlements;
         const auto entitlements = stored ? std::optional(stored->dictionary()) : std::nullopt;
@@ -486,7 +517,7 @@ bool Registry::unregisterPlugIn(const URL& url) {
 
 void Registry::clearSchemaCaches() { _implementation->clearSchemaCaches(); }
 
-std::optional<UUID> Registry::knowledgeUUID() { return _implementation->snapshot()->knowledge().uuid; }
+std::optional<UUID> Registry::knowledgeUUID() { return _implementation->knowledgeUUID(); }
 
 std::uint64_t Registry::knowledgeSequenceNumber() { return _implementation->snapshot()->knowledge().sequence; }
 

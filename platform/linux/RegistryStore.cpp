@@ -180,7 +180,8 @@ Failure RegistryStore::read(Contents& contents) {
         while ((code = sqlite3_step(statement.get())) == SQLITE_ROW) take(Row(statement.get()));
         return code == SQLITE_DONE;
     };
-    // In the order of their paths, so that each goes to the end of its map.
+    // In the order of the rows, which is nearly that of the paths, so that most go to the end of their map: the order
+    // of the paths would take a look-up of each row by its index.
     const bool isRead =
         rows("SELECT uuid, sequence FROM knowledge",
              [&](Row row) {
@@ -188,7 +189,7 @@ Failure RegistryStore::read(Contents& contents) {
                  if (uuid) contents.knowledge = Knowledge{*uuid, row.bits()};
              }) &&
         rows("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements "
-             "FROM application ORDER BY path",
+             "FROM application",
              [&](Row row) {
                  auto application = std::make_shared<InstalledApplication>();
                  application->path = row.text();
@@ -197,7 +198,7 @@ Failure RegistryStore::read(Contents& contents) {
                  contents.applications.emplace_hint(contents.applications.end(), path, application);
              }) &&
         rows("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements, "
-             "uuid, identifier, originalIdentifier, registered, application FROM plugIn ORDER BY path",
+             "uuid, identifier, originalIdentifier, registered, application FROM plugIn",
              [&](Row row) {
                  auto plugIn = std::make_shared<InstalledPlugIn>();
                  plugIn->path = row.text();

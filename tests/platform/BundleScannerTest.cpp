@@ -90,9 +90,9 @@ TEST_F(ScannedPlugIn, IsReadAgainAfterEachChangeAndOnlyThen) {
         const auto unchanged = scan(known);
         EXPECT_EQ(unchanged.state, State::unchanged) << "before " << what;
         EXPECT_EQ(unchanged.facts, known);
-        EXPECT_TRUE(scanner.isUnchanged(bundle, *known)) << "before " << what;
+        EXPECT_TRUE(BundleScanner::isUnchanged(bundle, BundleKind::plugIn, *known)) << "before " << what;
         make();
-        EXPECT_FALSE(scanner.isUnchanged(bundle, *known)) << what;
+        EXPECT_FALSE(BundleScanner::isUnchanged(bundle, BundleKind::plugIn, *known)) << what;
         const auto changed = scan(known);
         ASSERT_EQ(changed.state, State::read) << what;
         EXPECT_EQ(changed.facts->fingerprint != known->fingerprint, changesContent) << what;
