@@ -18,9 +18,6 @@ using platform::Value;
 
 namespace {
 
-/// A buffer beyond this is given back: an answer of thousands of forms is rare, one of a thousand is not.
-constexpr std::size_t keptBufferSize = std::size_t{4} << 20U;
-
 bool hasPropertyListEncoding(std::uint64_t version) { return version == currentVersion; }
 
 std::string descriptionOf(const ConnectionEvent& event) {
@@ -72,13 +69,7 @@ Failure ZBDaemonClient::errorInReply(const ReplyOrError& reply) {
 
 std::optional<Value> ZBDaemonClient::convertToQMX(const Value& value, std::uint64_t version) {
     if (!hasPropertyListEncoding(version)) return std::nullopt;
-    // One buffer for all replies of a thread: growing a new one costs more than the encoding.
-    thread_local std::string bytes;
-    bytes.clear();
-    platform::appendCompact(bytes, value);
-    Value data = Value::data(bytes);
-    if (bytes.capacity() > keptBufferSize) std::string().swap(bytes); // assigning a short text would keep the buffer
-    return data;
+    return platform::compactData(value);
 }
 
 Value ZBDaemonClient::convertFromQMX(const Value& value) const {

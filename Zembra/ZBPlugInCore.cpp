@@ -92,20 +92,25 @@ bool ZBPlugInCore::setDictionaries(const Value& dictionary) {
 }
 
 void ZBPlugInCore::setLocation(LocationField& field, const std::optional<URL>& url) {
-    field.set(url ? std::make_shared<const Location>(Location{*url, url->path()}) : nullptr);
+    Location location;
+    if (url) {
+        location.path = url->path();
+        if (!(URL::file(*location.path.string()) == *url)) location.text = url->absoluteString();
+    }
+    field.set(std::move(location));
 }
 
-std::optional<URL> ZBPlugInCore::url() const {
-    const auto location = _url.get();
-    return location ? std::optional<URL>(location->url) : std::nullopt;
+std::optional<URL> ZBPlugInCore::urlOf(const Location& location) {
+    if (const auto text = location.text.string()) return URL::parse(*text);
+    const auto path = location.path.string();
+    return path ? std::optional(URL::file(*path)) : std::nullopt;
 }
+
+std::optional<URL> ZBPlugInCore::url() const { return urlOf(_url.get()); }
 
 void ZBPlugInCore::setUrl(const std::optional<URL>& value) { setLocation(_url, value); }
 
-std::optional<URL> ZBPlugInCore::containingUrl() const {
-    const auto location = _containingUrl.get();
-    return location ? std::optional<URL>(location->url) : std::nullopt;
-}
+std::optional<URL> ZBPlugInCore::containingUrl() const { return urlOf(_containingUrl.get()); }
 
 void ZBPlugInCore::setContainingUrl(const std::optional<URL>& value) { setLocation(_containingUrl, value); }
 
@@ -139,14 +144,23 @@ bool ZBPlugInCore::oldStyle() const {
     fatalInternalError("unknown plug-in configuration style");
 }
 
-std::string ZBPlugInCore::path() const {
-    const auto location = _url.get();
-    return location ? location->url.path() : std::string();
+/// As the file system has it: a path that is no UTF-8 is in the URL alone.
+std::string ZBPlugInCore::pathOf(const Location& location) {
+    if (location.text) return urlOf(location)->path();
+    return std::string(location.path.string().value_or(""));
 }
 
+std::string ZBPlugInCore::path() const { return pathOf(_url.get()); }
+
 Value ZBPlugInCore::containingPath() const {
-    const auto location = _containingUrl.get();
-    return location ? location->path : Value();
+    return _containingUrl.read([](const Location& location) { return location.path; });
+}
+
+bool ZBPlugInCore::beginsWithContainingPath(std::string_view path) const {
+    const Location location = _containingUrl.get();
+    if (location.text) return path.starts_with(pathOf(location));
+    const auto containing = location.path.string();
+    return containing && path.starts_with(*containing);
 }
 
 std::optional<Dictionary> ZBPlugInCore::attributes() const { return pluginKey(manifest::attributes).dictionary(); }
@@ -171,8 +185,8 @@ Value ZBPlugInCore::embeddedProtocolSpec() const {
 }
 
 bool ZBPlugInCore::isAppExtension() const {
-    const auto location = _url.get();
-    return location && location->url.path().ends_with(manifest::appExtensionSuffix);
+    const Value path = _url.get().path;
+    return path && path.string()->ends_with(manifest::appExtensionSuffix);
 }
 
 bool ZBPlugInCore::isHybrid() const { return static_cast<bool>(pluginKey(manifest::embeddedCode)); }
@@ -228,16 +242,15 @@ void ZBPlugInCore::canonicalize() {
     MutableDictionary plugIn = MutableDictionary::copyOf(plugInDictionary().value_or(Dictionary()));
     plugIn.set(manifest::attributes, attributes);
     setPlugInDictionary(plugIn);
-    if (version()) return;
+    if (this->attribute(manifest::version)) return;
     const Value bundleVersion = infoKey(manifest::bundleShortVersionString);
     attributes.set(manifest::version, bundleVersion ? bundleVersion : Value("1"));
 }
 
 std::string ZBPlugInCore::description() const {
     // Every "find" logs it, so it is put together without the formatter.
-    const auto location = _url.get();
     std::string text;
-    for (const Value& part : {identifier(), uuidText(), location ? location->path : Value()}) {
+    for (const Value& part : {identifier(), uuidText(), _url.get().path}) {
         if (!text.empty()) text += ' ';
         text += part.string().value_or("(null)");
     }

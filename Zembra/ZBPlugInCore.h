@@ -100,7 +100,9 @@ public:
     /// When the plug-in was registered, in seconds since 1970-01-01 00:00 UTC.
     std::int64_t lastModified() const { return _lastModified; }
     void setLastModified(std::int64_t value) { _lastModified = value; }
-    std::optional<platform::UUID> uuid() const { return _identity.get().uuid; }
+    std::optional<platform::UUID> uuid() const {
+        return _identity.read([](const Identity& identity) { return identity.uuid; });
+    }
     void setUuid(const std::optional<platform::UUID>& value);
     /// The text form of `uuid`, made once.
     platform::Value uuidText() const { return _identity.get().text; }
@@ -128,6 +130,8 @@ public:
     /// Without a trailing separator; empty for a record without `url`.
     std::string path() const;
     platform::Value containingPath() const;
+    /// Whether `path` begins with the path of the application around the plug-in, byte for byte. False without one.
+    bool beginsWithContainingPath(std::string_view path) const;
     std::optional<platform::Dictionary> attributes() const;
     /// Absent also when the manifest has no string there.
     platform::Value version() const;
@@ -209,11 +213,13 @@ private:
         platform::Value text;
     };
     struct Location {
-        platform::URL url;
         platform::Value path;
+        platform::Value text; // of the URL; absent when that is the URL of the path, as for every bundle
     };
-    using LocationField = AtomicField<std::shared_ptr<const Location>>;
+    using LocationField = AtomicField<Location>;
     static void setLocation(LocationField& field, const std::optional<platform::URL>& url);
+    static std::optional<platform::URL> urlOf(const Location& location);
+    static std::string pathOf(const Location& location);
 
     std::atomic<bool> _onSystemVolume = false;
     platform::Value _plugInDictionary;

@@ -64,13 +64,12 @@ MutableDictionary ZBPlugInCore::exportForm(Failure* error) const {
         bundleInfo = MutableDictionary::copyOf(*current);
         bundleInfo->remove(manifest::bundleInfoVlistURL);
     }
-    const auto location = _url.get();
     const Value version = this->version();
     const Value annotations = _annotations.get();
     const Value localizedName = this->localizedName();
 
     form.set(formKey::hubProtocolVersion, hubProtocolVersion());
-    setRequired(formKey::path, location ? location->path : Value());
+    setRequired(formKey::path, _url.get().path);
     form.set(formKey::systemResident, onSystemVolume());
     setRequired(formKey::identifier, identifier());
     setRequired(formKey::originalIdentifier, originalIdentifier());

@@ -224,9 +224,9 @@ template <class T> void appendDescription(std::string& out, const T& value, std:
         else
             out += "(null)";
     } else if constexpr (std::same_as<T, Value>) {
-        out += value ? value.description() : "(null)";
+        value.describeTo(out);
     } else if constexpr (PropertyListValue<T>) {
-        out += Value(value).description();
+        Value(value).describeTo(out);
     } else if constexpr (std::same_as<T, URL>) {
         out += value.absoluteString();
     } else if constexpr (std::same_as<T, Error>) {

@@ -7,7 +7,9 @@
 #include <concepts>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <initializer_list>
+#include <iterator>
 #include <memory>
 #include <optional>
 #include <span>
@@ -52,7 +54,7 @@ struct Contents; // reaches into values for PropertyList.cpp
 /// Values may be read from any thread; storage that one thread changes must not be read by another meanwhile.
 class Value {
 public:
-    Value() noexcept : _bits(0), _kind(Kind::none), _unsigned(false) {}
+    Value() noexcept : _bits(0), _kind(Kind::none), _unsigned(false), _digest(0) {}
     Value(bool value) noexcept; // NOLINT(google-explicit-constructor)
     template <std::signed_integral T>
     Value(T value) noexcept : Value(Signed{static_cast<std::int64_t>(value)}) {} // NOLINT(google-explicit-constructor)
@@ -70,12 +72,16 @@ public:
     Value(const Array& value);                                          // NOLINT(google-explicit-constructor)
     Value(const Dictionary& value);                                     // NOLINT(google-explicit-constructor)
     static Value data(std::string_view bytes);
+    /// Data of `size` bytes, all of which `fill` writes.
+    static Value makeData(std::size_t size, const std::function<void(char* bytes)>& fill);
 
     // Inline: forms and replies are copies and ends of values for the most part.
-    Value(const Value& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
+    Value(const Value& other) noexcept
+        : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned), _digest(other._digest) {
         if (hasNode()) node()->addReference();
     }
-    Value(Value&& other) noexcept : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned) {
+    Value(Value&& other) noexcept
+        : _bits(other._bits), _kind(other._kind), _unsigned(other._unsigned), _digest(other._digest) {
         other._kind = Kind::none;
         other._bits = 0;
     }
@@ -88,6 +94,7 @@ public:
         std::swap(_bits, taken._bits);
         std::swap(_kind, taken._kind);
         std::swap(_unsigned, taken._unsigned);
+        std::swap(_digest, taken._digest);
         return *this;
     }
     ~Value() {
@@ -110,7 +117,8 @@ public:
     std::optional<std::string_view> data() const noexcept;
     std::optional<UUID> uuid() const noexcept;
     std::optional<Array> array() const noexcept;
-    std::optional<Dictionary> dictionary() const noexcept;
+    std::optional<Dictionary> dictionary() const& noexcept;
+    std::optional<Dictionary> dictionary() && noexcept; // saves counting a share that ends at once
 
     /// A boolean, an integer or a real: the kinds that compare by number.
     bool isNumber() const noexcept;
@@ -128,6 +136,8 @@ public:
     /// Control characters and bytes that are no UTF-8 are escaped, and long values are cut (see
     /// `maximumDescriptionLength` in PropertyList.cpp), so that no message can forge or flood the log.
     std::string description() const;
+    /// Appends it to `out`.
+    void describeTo(std::string& out) const;
 
 private:
     struct Signed {
@@ -150,7 +160,8 @@ private:
 
     std::uint64_t _bits;
     Kind _kind;
-    bool _unsigned; // an integer above the signed range; smaller ones are always held signed
+    bool _unsigned;        // an integer above the signed range; smaller ones are always held signed
+    std::uint32_t _digest; // of a string: tells most of those apart that are not equal, without a look at the bytes
 };
 
 /// A read-only view of ordered values: a handle on shared storage.
@@ -187,7 +198,7 @@ protected:
 /// An array handle that may also change the storage it shares; it converts to `Array` without copying.
 class MutableArray : public Array {
 public:
-    MutableArray() = default;
+    MutableArray();
     /// A new array with the same elements; the elements themselves are shared.
     static MutableArray copyOf(const Array& other);
     void append(Value value);
@@ -216,8 +227,9 @@ public:
     Value operator[](std::string_view key) const noexcept;
     /// As `operator[]` without sharing the value; null when there is none. Good until the storage changes.
     const Value* find(std::string_view key) const noexcept;
-    const Entry* begin() const noexcept;
-    const Entry* end() const noexcept;
+    class Iterator;
+    Iterator begin() const noexcept;
+    Iterator end() const noexcept;
 
     // Typed lookups: none when absent or of another kind.
     std::optional<std::string_view> string(std::string_view key) const noexcept;
@@ -232,8 +244,6 @@ public:
     /// A new dictionary with the same entries that keeps its compact encoding, for one that is encoded again and again.
     /// Neither it nor anything in it may change from now on.
     Dictionary keepingEncoding() const;
-    /// The encoding that is kept; none for most dictionaries.
-    std::optional<std::string_view> keptEncoding() const noexcept;
 
     /// Same keys with equal values, in any order.
     friend bool operator==(const Dictionary& left, const Dictionary& right) noexcept;
@@ -245,20 +255,61 @@ protected:
     friend class Value;
 };
 
+/// Good until the storage changes. In two stretches where a dictionary extends another.
+class Dictionary::Iterator {
+public:
+    using iterator_category = std::forward_iterator_tag;
+    using value_type = Entry;
+    using difference_type = std::ptrdiff_t;
+    using pointer = const Entry*;
+    using reference = const Entry&;
+
+    Iterator() = default;
+    Iterator(const Entry* at, const Entry* endOfFirst, const Entry* second) noexcept
+        : _at(at), _endOfFirst(endOfFirst), _second(second) {}
+    const Entry& operator*() const noexcept { return *_at; }
+    const Entry* operator->() const noexcept { return _at; }
+    Iterator& operator++() noexcept {
+        if (++_at == _endOfFirst) _at = _second;
+        return *this;
+    }
+    Iterator operator++(int) noexcept {
+        const Iterator before = *this;
+        ++*this;
+        return before;
+    }
+    friend bool operator==(const Iterator& left, const Iterator& right) noexcept { return left._at == right._at; }
+
+private:
+    const Entry* _at = nullptr;
+    const Entry* _endOfFirst = nullptr; // null when there is one stretch only
+    const Entry* _second = nullptr;
+};
+
 /// A dictionary handle that may also change the storage it shares; it converts to `Dictionary` without copying.
 class MutableDictionary : public Dictionary {
 public:
-    MutableDictionary() = default;
+    MutableDictionary();
     MutableDictionary(std::initializer_list<std::pair<std::string_view, Value>> entries) : Dictionary(entries) {}
     /// A new dictionary with the same entries; the values themselves are shared.
     static MutableDictionary copyOf(const Dictionary& other);
+    /// The same for a dictionary that keeps its encoding: the copy begins with the entries of `kept` itself, and so
+    /// costs nothing until one of these is changed.
+    static MutableDictionary extending(const Dictionary& kept);
+    /// Whether it is what `extending` made of `kept`, and still has the very same values.
+    bool isUnchangedFrom(const Dictionary& kept) const noexcept;
 
     /// Sets or replaces. `value` must not be absent.
     void set(std::string_view key, Value value);
+    /// The same with a string as the key, whose storage is shared: for keys that are set again and again.
+    template <std::same_as<Value> Key> void set(const Key& key, Value value) { setSharing(key, std::move(value)); }
     /// Does nothing when there is no such key. The other keys keep their order.
     void remove(std::string_view key);
     /// Sets every entry of `other`.
     void merge(const Dictionary& other);
+
+private:
+    void setSharing(const Value& key, Value value);
 };
 
 /// Bounds of the decoders. Each protects the daemon from its input; none is reachable by a sensible value.
@@ -279,6 +330,10 @@ inline constexpr std::string_view compactMagic = "vlist16\n";
 /// Appends the encoding of `value`, without magic. The value must not be absent. A string that is no UTF-8 or holds
 /// NUL, a date outside the years 1 to 9999 and nesting beyond `maximumNesting` are encoded, but no decoder takes them.
 void appendCompact(std::string& out, const Value& value);
+/// How many bytes that is.
+std::size_t compactSize(const Value& value);
+/// The same encoding as data, which is made without a buffer.
+Value compactData(const Value& value);
 /// Decodes exactly one value that fills `bytes`. Strict: UTF-8 checked, no NUL in strings and keys, no duplicate
 /// keys, every size checked against what is left before anything is allocated, containers nested in one another at most
 /// `nesting` deep. `nesting` is at most `maximumNesting`.

@@ -19,6 +19,7 @@ void requestOutput(int pid, const char* reply) noexcept;
 
 void pluginAdd(const char* path) noexcept;
 void pluginRemove(const char* path, bool isResolved) noexcept;
+bool pluginReadyEnabled() noexcept;
 void pluginReady(const char* uuidText) noexcept;
 /// `count` of the plug-ins that the database returned, before any filter.
 void discoverRaw(unsigned count) noexcept;

@@ -3,6 +3,7 @@
 #include "platform/PropertyList.h"
 #include "platform/WorkQueue.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -39,6 +40,10 @@ class ReplyToken {
 public:
     virtual ~ReplyToken() = default;
 };
+
+/// Bytes of the longest message that travels, as `compactSize` counts it. A full "match" answer of 10,000 plug-ins is
+/// about 24 MB.
+inline constexpr std::size_t maximumMessageSize = (std::size_t{64} << 20U) - 64;
 
 /// One message as it came: usually a dictionary, but a peer may send any value.
 struct ReceivedMessage {

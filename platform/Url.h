@@ -24,16 +24,19 @@ public:
     const std::string& path() const { return _path; }
 
     /// The URL's whole text.
-    const std::string& absoluteString() const { return _text; }
+    std::string absoluteString() const;
 
     /// This URL with `component` behind a separator, as written: ".." and further separators are not resolved.
     URL appending(std::string_view component) const;
 
-    friend bool operator==(const URL& left, const URL& right) { return left._text == right._text; }
+    friend bool operator==(const URL& left, const URL& right) {
+        return left._path == right._path && left._text == right._text;
+    }
 
 private:
     URL(std::string text, std::string path, bool isFile);
 
+    // Empty where it is what `file` makes of the path: the records of thousands of bundles have locations.
     std::string _text;
     std::string _path;
     bool _isFile;

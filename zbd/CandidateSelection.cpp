@@ -15,49 +15,55 @@ namespace {
 
 using Outcome = std::optional<Rejection>;
 
-Outcome mustHaveContainer(const Selection&, const ZBDPlugInRef& candidate) {
-    if (candidate->onSystemVolume() || candidate->containingUrl()) return std::nullopt;
+Outcome mustHaveContainer(const Selection&, const Candidate& candidate) {
+    if (candidate.plugIn->onSystemVolume() || candidate.plugIn->containingPath()) return std::nullopt;
     return Rejection{"neither on the system volume nor in an application"};
 }
 
-Outcome mustBeOnSystemVolumeWhenAsked(const Selection& selection, const ZBDPlugInRef& candidate) {
-    if ((selection.flags & zembra::ZBDiscoverSystemOnly) == 0 || candidate->onSystemVolume()) return std::nullopt;
+Outcome mustBeOnSystemVolumeWhenAsked(const Selection& selection, const Candidate& candidate) {
+    if ((selection.flags & zembra::ZBDiscoverSystemOnly) == 0 || candidate.plugIn->onSystemVolume()) {
+        return std::nullopt;
+    }
     return Rejection{"the host asked for plug-ins on the system volume only"};
 }
 
-Outcome mustBeTheHostsOwnWhenDedicated(const Selection& selection, const ZBDPlugInRef& candidate) {
-    if (!candidate->isDedicated()) return std::nullopt;
+Outcome mustBeTheHostsOwnWhenDedicated(const Selection& selection, const Candidate& candidate) {
+    if (!(candidate.kept ? candidate.kept->isDedicated : candidate.plugIn->isDedicated())) return std::nullopt;
     const auto& bundle = selection.client.bundle();
     const auto directory = bundle ? bundle->plugInsPath() : std::nullopt;
-    if (directory && candidate->path().starts_with(*directory)) return std::nullopt;
+    if (directory && candidate.plugIn->path().starts_with(*directory)) return std::nullopt;
     return Rejection{"dedicated to another host"};
 }
 
-Outcome mustNotBeHeld(const Selection& selection, const ZBDPlugInRef& candidate) {
-    if (!selection.server.holdOnPlugIn(candidate)) return std::nullopt;
+Outcome mustNotBeHeld(const Selection& selection, const Candidate& candidate) {
+    if (!selection.hasHolds || !selection.server.holdOnPlugIn(candidate.plugIn)) return std::nullopt;
     return Rejection{"on hold"};
 }
 
-Outcome mustMatchRules(const Selection& selection, const ZBDPlugInRef& candidate) {
-    auto mismatch = candidate->mismatch(selection.rules);
+Outcome mustMatchRules(const Selection& selection, const Candidate& candidate) {
+    auto mismatch = candidate.plugIn->mismatch(selection.rules);
     if (!mismatch) return std::nullopt;
     return Rejection{"does not match the host's rules", std::move(mismatch)};
 }
 
-Outcome mustNotBeExcluded(const Selection& selection, const ZBDPlugInRef& candidate) {
+Outcome mustNotBeExcluded(const Selection& selection, const Candidate& candidate) {
     for (const MatchRules& exclusion : selection.exclusions) {
-        if (candidate->mismatch(exclusion)) continue;
-        log::ops().info("client %d plugin %{public}@ globally excluded", selection.client.pid(), candidate->uuid());
+        if (candidate.plugIn->mismatch(exclusion)) continue;
+        log::ops().info("client %d plugin %{public}@ globally excluded", selection.client.pid(),
+                        candidate.plugIn->uuid());
         return Rejection{"excluded by the user"};
     }
     return std::nullopt;
 }
 
-Outcome mustBeAllowed(const Selection& selection, const ZBDPlugInRef& candidate) {
-    auto reason = candidate->allowForClient(selection.client);
+Outcome mustBeAllowed(const Selection& selection, const Candidate& candidate) {
+    const bool isConditional =
+        candidate.kept ? candidate.kept->requiresEntitlement : candidate.plugIn->requiresEntitlement();
+    if (!selection.isRestricted && !isConditional) return std::nullopt;
+    auto reason = candidate.plugIn->allowForClient(selection.client);
     if (!reason) return std::nullopt;
-    log::ops().info("client %d cannot use plugin %{public}@: %{public}@", selection.client.pid(), candidate->uuid(),
-                    *reason);
+    log::ops().info("client %d cannot use plugin %{public}@: %{public}@", selection.client.pid(),
+                    candidate.plugIn->uuid(), *reason);
     return Rejection{std::move(*reason)};
 }
 
@@ -75,7 +81,7 @@ constexpr std::array tests{
 
 std::span<const SelectionTest> selectionTests() { return tests; }
 
-std::optional<Rejection> rejectionOf(const Selection& selection, const ZBDPlugInRef& candidate) {
+std::optional<Rejection> rejectionOf(const Selection& selection, const Candidate& candidate) {
     const bool everything = (selection.flags & zembra::ZBDiscoverAll) != 0;
     for (const SelectionTest& test : tests) {
         if (everything && test.hostSide) continue;

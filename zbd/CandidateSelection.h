@@ -22,6 +22,14 @@ struct Selection {
     std::uint64_t flags = 0; // DiscoveryFlags
     MatchRules rules;
     std::vector<MatchRules> exclusions; // the user's, as read for this request
+    bool isRestricted = true;           // whether the host may be entitled to a part of the plug-ins only
+    bool hasHolds = true;               // whether a plug-in may be on hold
+};
+
+/// One plug-in under test, and what it keeps, if anything.
+struct Candidate {
+    const ZBDPlugInRef& plugIn;
+    const ZBDPlugIn::KeptFormRef& kept;
 };
 
 /// Why a candidate is dropped.
@@ -35,14 +43,14 @@ struct SelectionTest {
     std::string_view name;
     bool hostSide; // skipped by a host that asks for everything
     /// None when the candidate passes. Logs the lines that the log has for the case.
-    std::optional<Rejection> (*reject)(const Selection& selection, const ZBDPlugInRef& candidate);
+    std::optional<Rejection> (*reject)(const Selection& selection, const Candidate& candidate);
 };
 
 /// In the order in which they are made.
 std::span<const SelectionTest> selectionTests();
 
 /// The first test that drops the candidate, or none.
-std::optional<Rejection> rejectionOf(const Selection& selection, const ZBDPlugInRef& candidate);
+std::optional<Rejection> rejectionOf(const Selection& selection, const Candidate& candidate);
 
 /// The dictionaries in the user's exclusions; whatever else is stored there is ignored.
 std::vector<MatchRules> readExclusions(const platform::Value& stored, platform::TypeConformance& types);

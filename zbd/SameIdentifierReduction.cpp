@@ -9,13 +9,6 @@ namespace zbd {
 
 using zembra::comparableVersion;
 
-namespace {
-
-/// What a form states for a plug-in without a version.
-constexpr std::string_view noVersion = "<none>";
-
-} // namespace
-
 bool SameIdentifierReduction::admit(const Facts& candidate) {
     const bool allVersions = (_flags & zembra::ZBDiscoverAllVersions) != 0;
     if (allVersions && (_flags & zembra::ZBDiscoverDuplicates) != 0) return true;
@@ -34,14 +27,20 @@ bool SameIdentifierReduction::admit(const Facts& candidate) {
 
 /// The first form in order that the candidate has to be compared with to the end.
 std::optional<std::size_t> SameIdentifierReduction::rival(const Group& group, const Facts& candidate) const {
-    const bool onlyEqualVersions = (_flags & zembra::ZBDiscoverAllVersions) != 0;
-    if (onlyEqualVersions && candidate.version) {
+    const bool onlyEqualVersions = (_flags & zembra::ZBDiscoverAllVersions) != 0 && candidate.version;
+    if (!group.several) {
+        if (!group.only || !onlyEqualVersions) return group.only;
+        const bool isEqual = zembra::compareVersionString(*candidate.version, _slots[*group.only].version) == 0;
+        return isEqual ? group.only : std::nullopt;
+    }
+    const Several& several = *group.several;
+    if (onlyEqualVersions) {
         const std::string version = comparableVersion(*candidate.version);
-        const auto found = group.slotsByVersion.lower_bound({version, 0});
-        if (found == group.slotsByVersion.end() || found->first != version) return std::nullopt;
+        const auto found = several.slotsByVersion.lower_bound({version, 0});
+        if (found == several.slotsByVersion.end() || found->first != version) return std::nullopt;
         return found->second;
     }
-    return group.slots.empty() ? std::nullopt : std::optional(*group.slots.begin());
+    return several.slots.empty() ? std::nullopt : std::optional(*several.slots.begin());
 }
 
 bool SameIdentifierReduction::winsTie(const Facts& candidate, const Slot& slot) const {
@@ -50,21 +49,40 @@ bool SameIdentifierReduction::winsTie(const Facts& candidate, const Slot& slot) 
 }
 
 void SameIdentifierReduction::remove(Group& group, std::size_t index) {
-    _slots[index].present = false;
-    group.slots.erase(index);
-    group.slotsByVersion.erase({comparableVersion(_slots[index].version), index});
+    Slot& slot = _slots[index];
+    slot.present = false;
+    _encodedSize -= slot.encodedSize;
+    if (!group.several) return group.only.reset();
+    group.several->slots.erase(index);
+    group.several->slotsByVersion.erase({comparableVersion(slot.version), index});
 }
 
-void SameIdentifierReduction::add(const Facts& facts, platform::MutableDictionary form) {
-    const std::string version = facts.version.value_or(std::string(noVersion));
-    Group& group = _groups[facts.identifier];
-    group.slots.insert(_slots.size());
-    group.slotsByVersion.emplace(comparableVersion(version), _slots.size());
-    _slots.push_back({std::move(form), version, facts.onSystemVolume, facts.lastModified});
+void SameIdentifierReduction::put(Several& several, std::size_t index) const {
+    several.slots.insert(index);
+    several.slotsByVersion.emplace(comparableVersion(_slots[index].version), index);
+}
+
+void SameIdentifierReduction::add(Facts facts, platform::MutableDictionary form) {
+    const std::size_t index = _slots.size();
+    const std::size_t encodedSize = platform::compactSize(form);
+    _encodedSize += encodedSize;
+    std::string version = facts.version ? *std::move(facts.version) : std::string(noVersion);
+    _slots.push_back({std::move(form), std::move(version), facts.onSystemVolume, facts.lastModified, encodedSize});
+    Group& group = _groups[std::move(facts.identifier)];
+    if (!group.several && !group.only) {
+        group.only = index;
+        return;
+    }
+    if (!group.several) {
+        group.several = std::make_unique<Several>();
+        put(*group.several, *std::exchange(group.only, std::nullopt));
+    }
+    put(*group.several, index);
 }
 
 std::vector<platform::MutableDictionary> SameIdentifierReduction::takeForms() {
     std::vector<platform::MutableDictionary> forms;
+    forms.reserve(_slots.size());
     for (Slot& slot : _slots) {
         if (slot.present) forms.push_back(std::move(slot.form));
     }

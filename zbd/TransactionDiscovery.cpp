@@ -9,6 +9,7 @@
 #include "zbd/ZBDServer.h"
 
 #include <algorithm>
+#include <ranges>
 #include <unordered_map>
 
 namespace zbd {
@@ -26,43 +27,40 @@ namespace {
 
 constexpr std::size_t pathBufferSize = 1024; // a host at a longer path has no bundle-relative plug-ins
 
+/// What is left of the longest message for "matches", with room for what stands around it in the reply.
+constexpr std::size_t maximumMatchesSize = platform::maximumMessageSize - 1024;
+constexpr std::string_view tooLong = "the matching plug-ins are too many for one reply";
+
 using Candidates = std::vector<ZBDPlugInRef>;
 /// Replaced identifier to the form that replaces it; the form is shared with the answer.
 using Overrides = std::unordered_map<std::string, MutableDictionary>;
 
 std::string_view textOf(const Value& value) { return value.string().value_or(""); }
 
-/// The database's set as a list in the order of the UUIDs, so that the same question gets the same answer.
-Candidates sortedByUUID(const std::optional<ZBDPlugInSet>& plugIns) {
-    Candidates candidates;
-    if (plugIns) candidates.assign(plugIns->begin(), plugIns->end());
-    std::sort(candidates.begin(), candidates.end(),
-              [](const auto& left, const auto& right) { return *left->uuid() < *right->uuid(); });
-    return candidates;
+std::string describe(const ZBDPlugInRef& candidate) {
+    const auto kept = candidate->keptForm();
+    return platform::format("%@(%@) %@", candidate->identifier(), kept ? kept->version : candidate->version(),
+                            candidate->uuidText());
 }
+
+// Both lists are made as they are printed: the log shows the first few dozen of thousands.
 
 void logCandidates(const Candidates& candidates) {
     if (candidates.empty()) {
         log::ops().info("Candidate plugin count: 0");
-    } else if (log::ops().isEnabled(platform::LogLevel::info)) {
-        std::vector<std::string> texts;
-        texts.reserve(candidates.size());
-        for (const auto& candidate : candidates) {
-            texts.push_back(
-                platform::format("%@(%@) %@", candidate->identifier(), candidate->version(), candidate->uuid()));
-        }
-        log::ops().info("Candidate plugin count: %u, info: %{public}@", candidates.size(), texts);
+    } else {
+        log::ops().info("Candidate plugin count: %u, info: %{public}@", candidates.size(),
+                        std::views::transform(candidates, describe));
     }
 }
 
 void logResults(const std::vector<MutableDictionary>& forms) {
     if (forms.empty()) {
         log::ops().info("Resulting plugin count: 0");
-    } else if (log::ops().isEnabled(platform::LogLevel::info)) {
-        std::vector<Value> uuids;
-        uuids.reserve(forms.size());
-        for (const auto& form : forms) uuids.push_back(form[formKey::uuid]);
-        log::ops().info("Resulting plugin count: %u, UUIDs: %{public}@", forms.size(), uuids);
+    } else {
+        const auto uuid = [](const MutableDictionary& form) { return form[formKey::uuid]; };
+        log::ops().info("Resulting plugin count: %u, UUIDs: %{public}@", forms.size(),
+                        std::views::transform(forms, uuid));
     }
 }
 
@@ -70,8 +68,7 @@ void logResults(const std::vector<MutableDictionary>& forms) {
 void preferBundleRelative(Candidates& candidates, std::string_view hostPath) {
     std::unordered_map<std::string, ZBDPlugInRef> preferred;
     for (const auto& candidate : candidates) {
-        const Value container = candidate->containingPath();
-        if (!container || !hostPath.starts_with(textOf(container))) continue;
+        if (!candidate->beginsWithContainingPath(hostPath)) continue;
         preferred[std::string(textOf(candidate->identifier()))] = candidate;
     }
     if (preferred.empty()) return;
@@ -84,13 +81,23 @@ void preferBundleRelative(Candidates& candidates, std::string_view hostPath) {
     });
 }
 
+/// The version as the form states it.
+std::optional<std::string> versionOf(const ZBDPlugIn& plugIn, const MutableDictionary& form) {
+    const auto stated = form.string(formKey::version);
+    // A manifest may say what forms say where it says nothing.
+    if (stated == SameIdentifierReduction::noVersion && plugIn.version().string() != stated) return std::nullopt;
+    return stated ? std::optional<std::string>(*stated) : std::nullopt;
+}
+
 void noteOverrides(const ZBDPlugIn& plugIn, const MutableDictionary& form, Overrides& overrides) {
     const Value replaced = plugIn.valueForEntitlement(zembra::entitlement::replacePlugIn);
     if (const auto identifier = replaced.string()) {
         overrides.insert_or_assign(std::string(*identifier), form);
         return;
     }
-    for (const Value& element : replaced.array().value_or(Array())) {
+    const auto identifiers = replaced.array();
+    if (!identifiers) return;
+    for (const Value& element : *identifiers) {
         if (const auto identifier = element.string()) overrides.insert_or_assign(std::string(*identifier), form);
     }
 }
@@ -122,38 +129,53 @@ void Transaction::matchPlugIns() {
     }
 
     platform::TypeConformance& types = server()->platform().typeConformance;
-    const Selection selection{*server(), *_client, flags, MatchRules(rules, types),
-                              readExclusions(server()->userPrefs().exclusions(), types)};
-    Candidates candidates = sortedByUUID(server()->findPlugIns(rules));
+    const Selection selection{
+        .server = *server(),
+        .client = *_client,
+        .flags = flags,
+        .rules = MatchRules(rules, types),
+        .exclusions = readExclusions(server()->userPrefs().exclusions(), types),
+        .isRestricted = static_cast<bool>(_client->entitlementValueForKey(zembra::entitlement::allowedPlugIns)),
+        .hasHolds = server()->hasHolds(),
+    };
+    Candidates candidates = server()->findPlugIns(rules).value_or(Candidates());
     platform::trace::discoverRaw(static_cast<unsigned>(candidates.size()));
     logCandidates(candidates);
     preferBundleRelativeForHost(candidates);
 
+    // An older protocol has no forms in its reply, so none are too many.
+    const auto fits = [&](std::size_t size) {
+        return size <= maximumMatchesSize || _version != static_cast<std::uint64_t>(zembra::currentVersion);
+    };
     SameIdentifierReduction results(flags);
     Overrides overrides;
     for (const auto& candidate : candidates) {
-        if (!_client->acceptWork()) return; // nobody is left to answer
-        if (rejectionOf(selection, candidate)) continue;
+        const auto kept = candidate->keptForm();
+        if (rejectionOf(selection, {candidate, kept})) continue;
         platform::Failure error;
-        MutableDictionary form = candidate->currentForm(&error);
+        MutableDictionary form = candidate->currentForm(&error, kept);
         if (error) {
             log::ops().error("failed to export matching plug-in %{public}@: %{public}@", candidate->uuid(), *error);
         }
-        const Value version = candidate->version();
-        const SameIdentifierReduction::Facts facts{std::string(textOf(candidate->identifier())),
-                                                   version.string() ? std::optional<std::string>(*version.string())
-                                                                    : std::nullopt,
-                                                   candidate->onSystemVolume(), candidate->lastModified()};
+        SameIdentifierReduction::Facts facts{
+            .identifier = std::string(textOf(candidate->identifier())),
+            .version = versionOf(*candidate, form),
+            .onSystemVolume = candidate->onSystemVolume(),
+            .lastModified = candidate->lastModified(),
+        };
         if (!results.admit(facts)) continue;
         addAnnotationForPlugIn(*candidate, form);
-        candidate->augmentForm(form);
-        results.add(facts, form);
+        candidate->augmentForm(form, kept);
         noteOverrides(*candidate, form, overrides);
+        results.add(std::move(facts), std::move(form));
+        if (!fits(results.encodedSize())) return fail(code::malformed, tooLong);
     }
     auto forms = results.takeForms();
     markOverrides(forms, overrides);
     logResults(forms);
-    if (const auto matches = zembra::ZBDaemonClient::convertToQMX(Array::of(forms), _version)) {
+    const Value answer = Array::of(forms);
+    if (!overrides.empty() && !fits(platform::compactSize(answer))) return fail(code::malformed, tooLong);
+    if (const auto matches = zembra::ZBDaemonClient::convertToQMX(answer, _version)) {
         reply().set(key::matches, *matches);
     }
     log::ops().debug("reply marshalled");

@@ -16,7 +16,7 @@ ZBDPlugInRef Transaction::findPlugInByUUID(const UUID& uuid) { return server()->
 
 ZBDPlugInRef Transaction::findPlugInByPathURL(std::string_view text) {
     const auto url = URL::parse(text);
-    return url ? plugInAt(*url) : nullptr;
+    return url ? server()->findPlugInAtPath(*url) : nullptr;
 }
 
 void Transaction::findPlugIn() {
@@ -30,12 +30,13 @@ void Transaction::findPlugIn() {
     log::ops().notice("plugin found %{public}@", plugIn);
 
     platform::Failure error;
-    MutableDictionary form = plugIn->currentForm(&error);
+    const auto kept = plugIn->keptForm();
+    MutableDictionary form = plugIn->currentForm(&error, kept);
     if (error) {
         log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(), *error);
     }
     addAnnotationForPlugIn(*plugIn, form);
-    plugIn->augmentForm(form);
+    plugIn->augmentForm(form, kept);
     if (const auto matches = zembra::ZBDaemonClient::convertToQMX(form, _version)) reply().set(key::matches, *matches);
     done();
 }

@@ -19,30 +19,46 @@ using platform::UUID;
 using platform::Value;
 using zembra::valueOrAbsent;
 
-std::shared_ptr<ZBDPlugIn> ZBDPlugIn::initWithCXData(platform::Platform& platform, const PlugInProxyRef& proxy) {
-    std::shared_ptr<ZBDPlugIn> self(new ZBDPlugIn(platform));
+namespace {
+
+/// `text` as a value that shares the storage of one of `known` where that is the same text: thousands of records are
+/// kept.
+Value sharing(const std::optional<std::string>& text, std::initializer_list<Value> known) {
+    for (const Value& value : known) {
+        if (text && value.string() == *text) return value;
+    }
+    return valueOrAbsent(text);
+}
+
+} // namespace
+
+std::shared_ptr<ZBDPlugIn> ZBDPlugIn::initWithCXData(platform::Platform& platform, const PlugInProxyRef& proxy,
+                                                     std::shared_ptr<RecentForms> recentForms) {
+    std::shared_ptr<ZBDPlugIn> self(new ZBDPlugIn(platform, std::move(recentForms)));
     return self->setupWithProxy(proxy) ? self : nullptr;
 }
 
 bool ZBDPlugIn::setupWithProxy(const PlugInProxyRef& proxy) {
     if (!proxy->bundleURL) return false;
-    if (!initializeWithName(valueOrAbsent(proxy->plugInIdentifier), proxy->bundleURL, Value(),
-                            valueOrAbsent(proxy->plugInDictionary), proxy->uuid)) {
+    const Dictionary info = proxy->infoDictionary.value_or(Dictionary());
+    const Dictionary declared = proxy->plugInDictionary.value_or(Dictionary());
+    if (!initializeWithName(
+            sharing(proxy->plugInIdentifier, {info[manifest::bundleIdentifier], declared[manifest::identifier]}),
+            proxy->bundleURL, Value(), valueOrAbsent(proxy->plugInDictionary), proxy->uuid)) {
         return false;
     }
-    const Dictionary declared = proxy->plugInDictionary.value_or(Dictionary());
     const auto& container = proxy->containingBundle;
 
     setLastModified(static_cast<std::int64_t>(std::trunc(proxy->registrationDate.value_or(platform::Date()).seconds)));
     setOnSystemVolume(proxy->onSystemPartition);
-    setLocalizedName(valueOrAbsent(proxy->localizedName));
-    setLocalizedShortName(valueOrAbsent(proxy->localizedShortName));
+    setLocalizedName(sharing(proxy->localizedName, {info[manifest::bundleDisplayName], info[manifest::bundleName]}));
+    setLocalizedShortName(sharing(proxy->localizedShortName, {info[manifest::bundleName]}));
     setLocalizedContainingName(container ? valueOrAbsent(container->localizedName) : Value());
     setLocalizedFilevaneActionNames(
         ZBDPluginAdditions::localizedFilevaneActionNamesForZBDict(_platform.registry, *proxy, declared));
-    _originalIdentifier = valueOrAbsent(proxy->originalIdentifier);
-    _entitlements = proxy->entitlements;
-    _dataContainerURL = proxy->dataContainerURL;
+    setOriginalIdentifier(sharing(proxy->originalIdentifier, {identifier()}));
+    setEntitlements(valueOrAbsent(proxy->entitlements));
+    if (proxy->dataContainerURL) _dataContainerURL = {proxy, &*proxy->dataContainerURL};
     _infoVlist.set(valueOrAbsent(proxy->infoDictionary));
     if (const Value stated = declared[manifest::hubProtocolVersion]) {
         setHubProtocolVersion(static_cast<std::uint64_t>(stated.integerValue().value_or(0)));
@@ -78,7 +94,9 @@ PlugInProxyRef ZBDPlugIn::getProxy() const {
 
 Value ZBDPlugIn::currentInfo() const {
     const auto knowledge = _platform.registry.knowledgeUUID();
-    if (knowledge && knowledge == _cxKnowledgeUUID.get()) return _infoVlist.get();
+    if (knowledge && _cxKnowledgeUUID.read([&](const auto& known) { return known == knowledge; })) {
+        return _infoVlist.get();
+    }
     {
         const std::lock_guard lock(_refreshLock);
         if (const auto proxy = getProxy()) {
@@ -100,8 +118,8 @@ Value ZBDPlugIn::infoKey(std::string_view key) const {
 }
 
 Value ZBDPlugIn::pluginKey(std::string_view key) const {
-    const auto extension = infoKey(manifest::extension).dictionary();
-    return extension ? (*extension)[key] : Value();
+    const auto declared = infoKey(manifest::extension).dictionary();
+    return declared ? (*declared)[key] : Value();
 }
 
 Value ZBDPlugIn::attribute(std::string_view key) const {
@@ -117,42 +135,71 @@ MutableDictionary ZBDPlugIn::prunedInfoDictionaryFor(const Dictionary& dictionar
     return pruned;
 }
 
-std::optional<Dictionary> ZBDPlugIn::localizedFilevaneActionNames() const {
-    return _localizedFilevaneActionNames.get().dictionary();
+void ZBDPlugIn::setLocalizedName(Value value) {
+    ZBPlugInCore::setLocalizedName(std::move(value));
+    _formKeeper.set({}); // it shows the old name
+}
+
+void ZBDPlugIn::setLocalizedShortName(Value value) {
+    ZBPlugInCore::setLocalizedShortName(std::move(value));
+    _formKeeper.set({});
+}
+
+void ZBDPlugIn::setLocalizedContainingName(Value value) {
+    ZBPlugInCore::setLocalizedContainingName(std::move(value));
+    _formKeeper.set({});
 }
 
 void ZBDPlugIn::setLocalizedFilevaneActionNames(Value value) {
-    setLocalized(_localizedFilevaneActionNames, std::move(value));
+    ZBPlugInCore::setLocalizedFilevaneActionNames(std::move(value));
+    _formKeeper.set({});
 }
 
-void ZBDPlugIn::setLocalized(zembra::AtomicField<Value>& field, Value value) {
-    field.set(std::move(value));
-    _keptForm.set(nullptr); // it shows the old name
-}
+namespace {
 
-MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error) const {
+/// Whoever reads the debug lines of the export sees them for every form.
+bool mayKeepForms() { return !log::cx().isEnabled(platform::LogLevel::debug); }
+
+} // namespace
+
+ZBDPlugIn::KeptFormRef ZBDPlugIn::keptForm() const {
+    const auto keeper = _formKeeper.read([](const auto& field) { return field.lock(); });
+    if (!keeper || !mayKeepForms()) return nullptr;
+    auto kept = keeper->kept.get();
     const auto manifest = bundleInfoDictionary();
-    // Whoever reads the debug lines of the export sees them for every form.
-    const bool mayKeep = manifest && !log::cx().isEnabled(platform::LogLevel::debug);
-    if (const auto kept = mayKeep ? _keptForm.get() : nullptr; kept && kept->manifest.sharesStorageWith(*manifest)) {
-        return MutableDictionary::copyOf(kept->form);
-    }
+    return manifest && kept->manifest.sharesStorageWith(*manifest) ? kept : nullptr;
+}
+
+bool ZBDPlugIn::requiresEntitlement() const { return static_cast<bool>(pluginKey(manifest::hostEntitlement)); }
+
+MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFormRef& known) const {
+    if (known) return MutableDictionary::extending(known->form);
+    const auto manifest = bundleInfoDictionary();
     platform::Failure failure;
     MutableDictionary form = exportForm(&failure);
     if (failure) {
         if (error) *error = std::move(failure);
         return form;
     }
-    if (!mayKeep) return form;
-    for (const auto key : {zembra::formKey::bundleInfo, zembra::formKey::info, zembra::formKey::entitlements}) {
-        if (const auto part = form.dictionary(key)) form.set(key, part->keepingEncoding());
-    }
-    _keptForm.set(std::make_shared<const KeptForm>(KeptForm{*manifest, MutableDictionary::copyOf(form)}));
+    const auto [number, isAgain] = _recentForms->countMade(_lastMade);
+    _lastMade = number;
+    if (!manifest || !isAgain || !mayKeepForms()) return form;
+    // Not in one block with the counters of its owners, which outlives it here.
+    std::shared_ptr<FormKeeper> keeper(new FormKeeper);
+    keeper->kept.set(std::make_shared<const KeptForm>(KeptForm{.manifest = *manifest,
+                                                               .form = form.keepingEncoding(),
+                                                               .tokens = tokenNeeds(),
+                                                               .version = version(),
+                                                               .isDedicated = isDedicated(),
+                                                               .requiresEntitlement = requiresEntitlement()}));
+    _formKeeper.set(keeper);
+    _recentForms->keep(std::move(keeper));
     return form;
 }
 
 Value ZBDPlugIn::valueForEntitlement(std::string_view key) const {
-    return _entitlements ? (*_entitlements)[key] : Value();
+    const auto entitlements = this->entitlements();
+    return entitlements ? (*entitlements)[key] : Value();
 }
 
 bool ZBDPlugIn::hasEntitlement(std::string_view key) const {
@@ -179,8 +226,9 @@ Dictionary ZBDPluginAdditions::localizedFilevaneActionNamesForZBDict(platform::R
             log::cx().error("missing VKExtensionFilevaneActionName for plugin %@", proxy);
         }
     }
+    static const Dictionary none; // which most have
+    if (names.empty()) return none;
     MutableDictionary titles;
-    if (names.empty()) return titles;
     const auto localized = registry.localizedStrings(proxy, names, "Localizable");
     for (const std::string& name : names) {
         const auto found = localized.find(name);

@@ -5,7 +5,10 @@
 #include "platform/Platform.h"
 #include "platform/Registry.h"
 #include "zbd/MatchRules.h"
+#include "zbd/RecentForms.h"
 
+#include <atomic>
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -13,6 +16,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 namespace zbd {
 
@@ -23,8 +27,10 @@ class ZBDQmxClient;
 class ZBDPlugIn final : public zembra::ZBPlugInCore {
 public:
     /// Null for a proxy without location or identifier, and for a mis-configured plug-in, which is logged.
-    static std::shared_ptr<ZBDPlugIn> initWithCXData(platform::Platform& platform,
-                                                     const platform::PlugInProxyRef& proxy);
+    /// `recentForms` is shared by all records of a daemon.
+    static std::shared_ptr<ZBDPlugIn>
+    initWithCXData(platform::Platform& platform, const platform::PlugInProxyRef& proxy,
+                   std::shared_ptr<RecentForms> recentForms = std::make_shared<RecentForms>());
 
     /// A fresh proxy, by UUID or else by location; null when the registry knows neither.
     platform::PlugInProxyRef getProxy() const;
@@ -42,19 +48,13 @@ public:
     /// `dictionary` without the entries that build tools leave in manifests.
     static platform::MutableDictionary prunedInfoDictionaryFor(const platform::Dictionary& dictionary);
 
-    platform::Value originalIdentifier() const override { return _originalIdentifier; }
-    std::optional<platform::Dictionary> entitlements() const override { return _entitlements; }
-    std::optional<platform::URL> dataContainerURL() const override { return _dataContainerURL; }
-    platform::Value localizedName() const override { return _localizedName.get(); }
-    void setLocalizedName(platform::Value value) override { setLocalized(_localizedName, std::move(value)); }
-    platform::Value localizedShortName() const override { return _localizedShortName.get(); }
-    void setLocalizedShortName(platform::Value value) override { setLocalized(_localizedShortName, std::move(value)); }
-    platform::Value localizedContainingName() const override { return _localizedContainingName.get(); }
-    void setLocalizedContainingName(platform::Value value) override {
-        setLocalized(_localizedContainingName, std::move(value));
+    std::optional<platform::URL> dataContainerURL() const override {
+        return _dataContainerURL ? std::optional(*_dataContainerURL) : std::nullopt;
     }
+    void setLocalizedName(platform::Value value) override;
+    void setLocalizedShortName(platform::Value value) override;
+    void setLocalizedContainingName(platform::Value value) override;
     /// A dictionary from creation on, empty when the plug-in declares no actions.
-    std::optional<platform::Dictionary> localizedFilevaneActionNames() const override;
     void setLocalizedFilevaneActionNames(platform::Value value) override;
 
     /// The manifest as of the last refresh; absent when the plug-in had left the registry.
@@ -77,14 +77,39 @@ public:
 
     platform::Failure diagnose() const override;
 
-    /// A form of the caller's own, as `exportForm` makes it. What it is made of is kept, encoded, until the registry's
-    /// knowledge changes, so that a plug-in that is asked for again and again costs little.
-    platform::MutableDictionary currentForm(platform::Failure* error) const;
+    /// What the tokens of a form are for.
+    struct TokenNeeds {
+        platform::Value resources;                      // to read; absent when nothing is shared
+        std::optional<platform::Value> serviceOfBundle; // identifier of the bundle whose service is looked up
+    };
+    /// What does not change from answer to answer while the manifest stays the same, in one place: answers of a
+    /// thousand plug-ins have no time to look for it.
+    struct KeptForm {
+        platform::Dictionary manifest; // the one it was made from
+        platform::Dictionary form;     // with its encoding, and with the annotations and tokens of the last answer
+        TokenNeeds tokens;
+        platform::Value version;
+        bool isDedicated = false;
+        bool requiresEntitlement = false; // of its hosts
+    };
+    using KeptFormRef = std::shared_ptr<const KeptForm>;
+    /// Only for a plug-in that is asked for again and again; else null, also when what was kept is outdated.
+    KeptFormRef keptForm() const;
+    /// Whether hosts need an entitlement that the manifest names.
+    bool requiresEntitlement() const;
+
+    /// A form of the caller's own, as `exportForm` makes it; one that extends the kept form where there is one, which
+    /// costs little. That one has the annotations and tokens of the last answer, so the caller is to set both: where
+    /// they are the same nothing changes. `kept` is what `keptForm` has just answered.
+    platform::MutableDictionary currentForm(platform::Failure* error, const KeptFormRef& kept) const;
+    platform::MutableDictionary currentForm(platform::Failure* error) const { return currentForm(error, keptForm()); }
 
     // ZBDPlugInTokens.cpp
 
-    /// Adds the sandbox tokens that a host needs to a form made by `exportForm`.
-    void augmentForm(platform::MutableDictionary& form) const;
+    /// Issues the sandbox tokens that a host needs and sets them in a form made by `currentForm` or `exportForm`, whose
+    /// annotations are set. What differs from the kept form then takes its place.
+    void augmentForm(platform::MutableDictionary& form, const KeptFormRef& kept) const;
+    void augmentForm(platform::MutableDictionary& form) const { augmentForm(form, keptForm()); }
     /// A file-read token for each resource inside the bundle that the sandbox service grants, under the resource as
     /// written. `resources` is a string or an array; elements of another kind are skipped.
     platform::MutableDictionary issueResourceExtensions(const platform::Value& resources) const;
@@ -118,42 +143,38 @@ public:
     std::optional<platform::Dictionary> checkBusy() const;
 
 private:
-    explicit ZBDPlugIn(platform::Platform& platform) : _platform(platform) {}
+    ZBDPlugIn(platform::Platform& platform, std::shared_ptr<RecentForms> recentForms)
+        : _platform(platform), _recentForms(std::move(recentForms)) {}
     bool setupWithProxy(const platform::PlugInProxyRef& proxy);
     platform::Value currentInfo() const;
     platform::Value valueForRule(std::string_view key) const;
     std::string userElection() const;
     const char* sandboxProfile() const;
     bool accepts(const MatchRule& rule, const platform::Value& value) const;
-    void setLocalized(zembra::AtomicField<platform::Value>& field, platform::Value value);
 
     platform::Platform& _platform;
-    zembra::AtomicField<platform::Value> _localizedName;
-    zembra::AtomicField<platform::Value> _localizedShortName;
-    zembra::AtomicField<platform::Value> _localizedContainingName;
-    zembra::AtomicField<platform::Value> _localizedFilevaneActionNames;
-    std::optional<platform::Dictionary> _entitlements;
-    platform::Value _originalIdentifier;
-    std::optional<platform::URL> _dataContainerURL;
+    std::shared_ptr<const platform::URL> _dataContainerURL; // in the proxy, which the registry keeps too
 
     mutable std::recursive_mutex _refreshLock; // one refresh at a time: fetching and storing are one step
     mutable zembra::AtomicField<platform::Value> _infoVlist;
     mutable zembra::AtomicField<std::optional<platform::UUID>> _cxKnowledgeUUID;
 
-    struct KeptForm {
-        platform::Dictionary manifest; // the one it was made from
-        platform::MutableDictionary form;
+    TokenNeeds tokenNeeds() const;
+    struct IssuedToken {
+        platform::Value resource;
+        std::string text;
     };
-    mutable zembra::AtomicField<std::shared_ptr<const KeptForm>> _keptForm;
+    std::vector<IssuedToken> issueResourceTokens(const platform::Value& resources) const;
+    static platform::MutableDictionary dictionaryOf(const std::vector<IssuedToken>& tokens);
+    static bool shows(const std::optional<platform::Dictionary>& dictionary, const std::vector<IssuedToken>& tokens);
+    void augmentWithService(platform::MutableDictionary& form, const platform::Value& bundleIdentifier) const;
 
-    struct Tokens {
-        platform::Value extensions; // a dictionary, or absent
-        platform::Value service;    // a string, or absent
-        bool mayBeKept = false;
-        std::optional<platform::UUID> knowledge; // of the registry, when they were issued
+    const std::shared_ptr<RecentForms> _recentForms;
+    struct FormKeeper {
+        zembra::AtomicField<KeptFormRef> kept;
     };
-    std::shared_ptr<const Tokens> issueTokens() const;
-    mutable zembra::AtomicField<std::shared_ptr<const Tokens>> _keptTokens;
+    mutable zembra::AtomicField<std::weak_ptr<FormKeeper>> _formKeeper; // held by `_recentForms`
+    mutable std::atomic<std::uint64_t> _lastMade = 0; // the number of the last form that had to be made
 };
 
 /// What the daemon adds to the registry's proxies.

@@ -4,6 +4,7 @@
 #include "Zembra/ZBSandboxExtension.h"
 #include "zbd/ZBDPlugIn.h"
 
+#include <algorithm>
 #include <system_error>
 
 namespace zbd {
@@ -25,54 +26,76 @@ std::string errnoText(const platform::Error& error) {
 
 } // namespace
 
-void ZBDPlugIn::augmentForm(MutableDictionary& form) const {
-    currentInfo(); // takes over the registry's knowledge, which kept tokens have to match
-    auto tokens = _keptTokens.get();
-    if (!tokens || !tokens->knowledge || tokens->knowledge != _cxKnowledgeUUID.get() ||
-        log::sandbox().isEnabled(platform::LogLevel::debug)) { // whose reader sees each token issued
-        tokens = issueTokens();
-        _keptTokens.set(tokens->mayBeKept ? tokens : nullptr);
+void ZBDPlugIn::augmentForm(MutableDictionary& form, const KeptFormRef& kept) const {
+    const TokenNeeds own = kept ? TokenNeeds() : tokenNeeds();
+    const TokenNeeds& needs = kept ? kept->tokens : own;
+    if (needs.resources) {
+        const auto tokens = issueResourceTokens(needs.resources);
+        const Value* present = form.find(zembra::formKey::extensions);
+        if (!present || !shows(present->dictionary(), tokens)) {
+            form.set(zembra::formKey::extensions, dictionaryOf(tokens));
+        }
     }
-    if (tokens->extensions) form.set(zembra::formKey::extensions, tokens->extensions);
-    if (tokens->service) form.set(zembra::formKey::serviceExtension, tokens->service);
+    if (needs.serviceOfBundle) augmentWithService(form, *needs.serviceOfBundle);
+    if (!kept || form.isUnchangedFrom(kept->form)) return;
+    const auto keeper = _formKeeper.read([](const auto& field) { return field.lock(); });
+    if (!keeper || keeper->kept.get() != kept) return; // something newer is there
+    KeptForm changed = *kept;
+    changed.form = form.keepingEncoding();
+    keeper->kept.set(std::make_shared<const KeptForm>(std::move(changed)));
 }
 
-std::shared_ptr<const ZBDPlugIn::Tokens> ZBDPlugIn::issueTokens() const {
-    auto tokens = std::make_shared<Tokens>();
-    tokens->knowledge = _cxKnowledgeUUID.get();
-    Value resources = pluginKey(manifest::shared);
-    if (isAppExtension()) resources = Array{Value(wholeBundle)};
-    if (resources) tokens->extensions = issueResourceExtensions(resources);
-    // The registry notices when a bundle directory is replaced, and then knows more; of single files within it does
-    // not.
-    tokens->mayBeKept = !resources || (isAppExtension() && !tokens->extensions.dictionary()->empty());
-    if (isData()) return tokens;
-
-    const Value bundleIdentifier = infoKey(manifest::bundleIdentifier);
+void ZBDPlugIn::augmentWithService(MutableDictionary& form, const Value& bundleIdentifier) const {
     const auto token =
         zembra::issueServiceLookupToken(_platform.sandbox, std::string(bundleIdentifier.string().value_or("")));
-    if (token) {
-        tokens->service = *token;
-    } else {
-        tokens->mayBeKept = false; // a refusal is logged each time
+    if (!token) {
+        form.remove(zembra::formKey::serviceExtension);
         log::ops().info("failed to make mach extension for %@ in plug-in at %@: %{public}s", bundleIdentifier, path(),
                         errnoText(token.error()));
+    } else if (form.string(zembra::formKey::serviceExtension) != *token) {
+        form.set(zembra::formKey::serviceExtension, *token);
     }
-    return tokens;
+}
+
+ZBDPlugIn::TokenNeeds ZBDPlugIn::tokenNeeds() const {
+    TokenNeeds needs;
+    needs.resources = isAppExtension() ? Value(Array{Value(wholeBundle)}) : pluginKey(manifest::shared);
+    if (!isData()) needs.serviceOfBundle = infoKey(manifest::bundleIdentifier);
+    return needs;
 }
 
 MutableDictionary ZBDPlugIn::issueResourceExtensions(const Value& resources) const {
+    return dictionaryOf(issueResourceTokens(resources));
+}
+
+MutableDictionary ZBDPlugIn::dictionaryOf(const std::vector<IssuedToken>& tokens) {
+    MutableDictionary dictionary;
+    for (const auto& [resource, text] : tokens) dictionary.set(resource, text);
+    return dictionary;
+}
+
+/// False also when a resource is named twice, for then there are fewer entries than tokens.
+bool ZBDPlugIn::shows(const std::optional<platform::Dictionary>& dictionary, const std::vector<IssuedToken>& tokens) {
+    return dictionary && dictionary->size() == tokens.size() &&
+           std::all_of(tokens.begin(), tokens.end(), [&](const IssuedToken& token) {
+               return dictionary->string(*token.resource.string()) == token.text;
+           });
+}
+
+std::vector<ZBDPlugIn::IssuedToken> ZBDPlugIn::issueResourceTokens(const Value& resources) const {
     const Array elements = resources.string() ? Array{resources} : resources.array().value_or(Array());
     const auto bundle = *url();
-    MutableDictionary tokens;
+    std::vector<IssuedToken> tokens;
     for (const Value& element : elements) {
         const auto resource = element.string();
         if (!resource) continue;
-        const auto location = *resource == wholeBundle ? bundle : bundle.appending(*resource);
+        const std::optional<platform::URL> inside =
+            *resource == wholeBundle ? std::nullopt : std::optional(bundle.appending(*resource));
+        const platform::URL& location = inside ? *inside : bundle;
         // What a manifest calls its own must lie inside its bundle, also behind symbolic links.
-        const auto token = zembra::issueFileReadToken(_platform.sandbox, location, bundle.path());
+        auto token = zembra::issueFileReadToken(_platform.sandbox, location, bundle.path());
         if (token) {
-            tokens.set(*resource, *token);
+            tokens.push_back({element, *std::move(token)});
         } else {
             log::ops().info("failed to make extension for %@ in plug-in at %@: %{public}s", location.path(),
                             bundle.path(), errnoText(token.error()));

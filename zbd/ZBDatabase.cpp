@@ -34,6 +34,31 @@ std::optional<std::string> electionOfPattern(const Value& pattern) {
     return std::nullopt;
 }
 
+bool isUsable(const PlugInProxyRef& proxy) {
+    if (!proxy->bundleURL) {
+        log::ops().info("skipping cx proxy %@ with nil bundleURL", proxy);
+        return false;
+    }
+    const auto& container = proxy->containingBundle;
+    if (container && !container->isApplication) {
+        log::ops().error("CX reported containingBundle is not an application");
+        return false;
+    }
+    if (container && container->isPlaceholder) {
+        log::ops().info("skipping cx proxy %@ because its app is a placeholder", proxy);
+        return false;
+    }
+    return true;
+}
+
+/// By UUID, and each UUID once. The registry mostly answers so already.
+void order(std::vector<ZBDPlugInRef>& plugIns) {
+    const auto uuid = [](const ZBDPlugInRef& plugIn) { return *plugIn->uuid(); };
+    if (!std::ranges::is_sorted(plugIns, {}, uuid)) std::ranges::sort(plugIns, {}, uuid);
+    const auto isSame = [](const ZBDPlugInRef& left, const ZBDPlugInRef& right) { return *left == *right; };
+    plugIns.erase(std::unique(plugIns.begin(), plugIns.end(), isSame), plugIns.end());
+}
+
 } // namespace
 
 ZBDatabase::ZBDatabase(platform::Platform& platform) : _platform(platform), _workspace(platform.registry) {}
@@ -62,20 +87,23 @@ ZBDPlugInRef ZBDatabase::cachedPlugIn(const UUID& uuid) {
 }
 
 ZBDPlugInRef ZBDatabase::plugInForProxy(const PlugInProxyRef& proxy) {
-    return _sync->sync([&]() -> ZBDPlugInRef {
-        // A proxy without a UUID gives a record with a random one: never found again, so it is not kept.
-        if (!proxy->uuid) return createPlugInForProxy(proxy);
-        if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
-        // The proxy may be older than the notice of its uninstall; then nothing would end a record made of it.
-        const auto current = _workspace.plugInForUUID(*proxy->uuid);
-        return current ? createPlugInForProxy(current) : nullptr;
-    });
+    return _sync->sync([&] { return recordForProxy(proxy); });
+}
+
+ZBDPlugInRef ZBDatabase::recordForProxy(const PlugInProxyRef& proxy) {
+    _sync->assertCurrent();
+    // A proxy without a UUID gives a record with a random one: never found again, so it is not kept.
+    if (!proxy->uuid) return createPlugInForProxy(proxy);
+    if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
+    // The proxy may be older than the notice of its uninstall; then nothing would end a record made of it.
+    const auto current = _workspace.plugInForUUID(*proxy->uuid);
+    return current ? createPlugInForProxy(current) : nullptr;
 }
 
 ZBDPlugInRef ZBDatabase::createPlugInForProxy(const PlugInProxyRef& proxy) {
     _sync->assertCurrent();
     log::ops().notice("createPlugInForProxy");
-    auto plugIn = ZBDPlugIn::initWithCXData(_platform, proxy);
+    auto plugIn = ZBDPlugIn::initWithCXData(_platform, proxy, _recentForms);
     if (!plugIn) return nullptr;
     if (plugIn->hasEntitlement(zembra::entitlement::autoElectPlugIn)) autoElect(*plugIn);
     purgeCachesToLimit(_cacheLimit);
@@ -154,7 +182,7 @@ bool ZBDatabase::acceptByElection(const ElectionValues& elections, const std::st
     return std::find(elections.begin(), elections.end(), text) != elections.end();
 }
 
-std::optional<ZBDPlugInSet> ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
+std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
     std::optional<std::vector<PlugInProxyRef>> proxies;
     if (!query || query->empty()) {
         proxies = _workspace.installedPlugIns();
@@ -177,24 +205,15 @@ std::optional<ZBDPlugInSet> ZBDatabase::findPlugIns(const std::optional<Dictiona
 
     const std::size_t countBefore = cacheCount();
     if (!proxies) return std::nullopt;
-    ZBDPlugInSet plugIns;
-    for (const PlugInProxyRef& proxy : *proxies) {
-        if (!proxy->bundleURL) {
-            log::ops().info("skipping cx proxy %@ with nil bundleURL", proxy);
-            continue;
+    std::vector<ZBDPlugInRef> plugIns;
+    plugIns.reserve(proxies->size());
+    _sync->sync([&] { // once for all: most are cached
+        for (const PlugInProxyRef& proxy : *proxies) {
+            if (!isUsable(proxy)) continue;
+            if (auto plugIn = recordForProxy(proxy)) plugIns.push_back(std::move(plugIn));
         }
-        if (const auto& container = proxy->containingBundle) {
-            if (!container->isApplication) {
-                log::ops().error("CX reported containingBundle is not an application");
-                continue;
-            }
-            if (container->isPlaceholder) {
-                log::ops().info("skipping cx proxy %@ because its app is a placeholder", proxy);
-                continue;
-            }
-        }
-        if (auto plugIn = plugInForProxy(proxy)) plugIns.insert(std::move(plugIn));
-    }
+    });
+    order(plugIns);
     log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns.size(), countBefore, cacheCount());
     return plugIns;
 }

@@ -43,9 +43,10 @@ public:
     /// All or nothing: a cache of more than `limit` records is emptied. On the database queue only.
     void purgeCachesToLimit(std::uint32_t limit);
 
-    /// The records of the plug-ins that may match `query`; of all installed ones when it is absent or empty. The
-    /// caller judges them by its rules. None when the registry does not answer.
-    std::optional<ZBDPlugInSet> findPlugIns(const std::optional<platform::Dictionary>& query);
+    /// The records of the plug-ins that may match `query`; of all installed ones when it is absent or empty. Each once,
+    /// in the order of the registry's UUIDs, so that the same question gets the same answer. The caller judges them by
+    /// its rules. None when the registry does not answer.
+    std::optional<std::vector<ZBDPlugInRef>> findPlugIns(const std::optional<platform::Dictionary>& query);
     ZBDPlugInRef findPlugIn(const platform::UUID& uuid);
     ZBDPlugInRef findPlugInAtPath(const platform::URL& url);
     /// None when the application is unknown or has no plug-ins.
@@ -85,6 +86,7 @@ private:
     bool acceptByElection(const ElectionValues& elections, const std::string& identifier,
                           const std::optional<platform::Dictionary>& entitlements) const;
     ZBDPlugInRef cachedPlugIn(const platform::UUID& uuid);
+    ZBDPlugInRef recordForProxy(const platform::PlugInProxyRef& proxy);
     std::size_t cacheCount();
 
     platform::Platform& _platform;
@@ -95,6 +97,7 @@ private:
                                                       // for it: so the service queue may read it too
     std::shared_ptr<platform::WorkQueue> _sync;
     std::unordered_map<platform::UUID, ZBDPlugInRef> _cache; // on _sync only
+    const std::shared_ptr<RecentForms> _recentForms = std::make_shared<RecentForms>();
     std::unique_ptr<platform::LocaleObservation> _regionObserver;
 };
 

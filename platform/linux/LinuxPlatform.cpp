@@ -25,6 +25,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <fcntl.h>
+#include <malloc.h>
 #include <pthread.h>
 #include <unistd.h>
 
@@ -68,9 +69,19 @@ void fillStandardDescriptors() {
     }
 }
 
+/// What an answer of many plug-ins took goes back to the system with it. Left alone, the allocator would take the
+/// largest one as the measure of what to hold on to.
+void boundFreeMemory() {
+    constexpr int size = 8 << 20; // answers of a thousand plug-ins stay below, and need no new pages each time
+    mallopt(M_ARENA_MAX, 1);      // so that what one thread let go of serves the others
+    mallopt(M_MMAP_THRESHOLD, size);
+    mallopt(M_TRIM_THRESHOLD, size);
+}
+
 } // namespace
 
 LinuxPlatform::LinuxPlatform() {
+    boundFreeMemory();
     fillStandardDescriptors();
     setSystemLog(SystemLog::ofProcess());
     // No channel of ours, so it shows its arguments: there the refusal of a removal names the path for the

@@ -1,5 +1,6 @@
 #include "platform/PropertyList.h"
 
+#include "platform/linux/PropertyListCoding.h"
 #include "platform/linux/Utf8.h"
 
 #include <algorithm>
@@ -54,6 +55,17 @@ void require(bool condition, const char* text) noexcept {
 
 namespace detail {
 
+namespace {
+
+std::uint32_t digestOf(std::string_view text) noexcept {
+    if (text.empty()) return 0;
+    const auto byte = [&](std::size_t at) { return std::uint32_t{static_cast<unsigned char>(text[at])}; };
+    return static_cast<std::uint32_t>(text.size()) ^ (byte(0) << 8U) ^ (byte(text.size() / 2) << 16U) ^
+           (byte(text.size() - 1) << 24U);
+}
+
+} // namespace
+
 /// The bytes follow the node in the same allocation.
 struct BytesNode : Node {
     explicit BytesNode(std::size_t count) noexcept : length(count) {}
@@ -62,12 +74,16 @@ struct BytesNode : Node {
 
     const std::size_t length;
 
+    static BytesNode* make(std::size_t size) {
+        void* storage = ::operator new(sizeof(BytesNode) + size);
+        return new (storage) BytesNode(size);
+    }
     static BytesNode* make(std::string_view bytes) {
-        void* storage = ::operator new(sizeof(BytesNode) + bytes.size());
-        auto* node = new (storage) BytesNode(bytes.size());
-        if (!bytes.empty()) std::memcpy(reinterpret_cast<char*>(node + 1), bytes.data(), bytes.size());
+        BytesNode* node = make(bytes.size());
+        if (!bytes.empty()) std::memcpy(node->space(), bytes.data(), bytes.size());
         return node;
     }
+    char* space() noexcept { return reinterpret_cast<char*>(this + 1); }
     static void destroy(BytesNode* node) noexcept {
         node->~BytesNode();
         ::operator delete(node);
@@ -95,7 +111,8 @@ struct DictionaryNode : ContainerNode {
     DictionaryNode() noexcept : ContainerNode(Kind::dictionary) {}
 
     std::vector<Dictionary::Entry> entries;
-    std::unique_ptr<const std::string> encoding; // kept for a dictionary that does not change any more
+    std::unique_ptr<const std::string> encoding; // of the entries, for a dictionary that does not change any more
+    DictionaryNode* base = nullptr;   // shared, and keeps its encoding; its entries come before the node's own
     std::vector<std::uint32_t> index; // positions in `entries` by `before`; empty up to `indexThreshold` keys
 
     /// Any total order will do: comparing lengths first settles most pairs without looking at the bytes.
@@ -111,17 +128,32 @@ struct DictionaryNode : ContainerNode {
     }
 
     std::optional<std::size_t> find(std::string_view key) const noexcept {
-        if (index.empty()) {
-            for (std::size_t i = 0; i < entries.size(); ++i)
-                if (name(i) == key) return i;
-            return std::nullopt;
-        }
+        return index.empty() ? findWalking(key, digestOf(key)) : findInIndex(key);
+    }
+    std::optional<std::size_t> findWalking(std::string_view key, std::uint32_t digest) const noexcept;
+    std::optional<std::size_t> findInIndex(std::string_view key) const noexcept {
         const auto place = lowerBound(key);
         if (place == index.end() || name(*place) != key) return std::nullopt;
         return *place;
     }
 
-    void set(std::string_view key, Value value);
+    std::size_t size() const noexcept { return entries.size() + (base != nullptr ? base->entries.size() : 0); }
+    /// Also in the base.
+    const Value* valueUnder(std::string_view key) const noexcept {
+        if (const auto position = find(key)) return &entries[*position].value;
+        return base != nullptr ? base->valueUnder(key) : nullptr;
+    }
+    Dictionary::Iterator begin() const noexcept {
+        if (base == nullptr || base->entries.empty()) return {entries.data(), nullptr, nullptr};
+        const auto& first = base->entries;
+        return {first.data(), first.data() + first.size(), entries.data()};
+    }
+    Dictionary::Iterator end() const noexcept { return {entries.data() + entries.size(), nullptr, nullptr}; }
+    /// Takes over the entries of the base, for one of them is about to change.
+    void takeOverBase();
+
+    /// `shared` is the key as a value, or absent.
+    void set(std::string_view key, Value value, const Value& shared = {});
     void erase(std::size_t position) noexcept;
 
     /// Sorts all keys anew; false when two are equal.
@@ -144,6 +176,15 @@ struct Contents {
         return *static_cast<DictionaryNode*>(node(value));
     }
 
+    static std::uint32_t digest(const Value& value) noexcept { return value._digest; }
+    /// The same number, or the same storage.
+    static bool isSame(const Value& left, const Value& right) noexcept {
+        return left._kind == right._kind && left._bits == right._bits && left._unsigned == right._unsigned;
+    }
+    static Value newArray() { return {Kind::array, new ArrayNode}; }
+    static Value newDictionary() { return {Kind::dictionary, new DictionaryNode}; }
+    static Value valueOf(DictionaryNode* node) noexcept { return {Kind::dictionary, node}; }
+
     /// Takes the reference out of `value`, which becomes absent.
     static Node* take(Value& value) noexcept {
         Node* taken = value.hasNode() ? node(value) : nullptr;
@@ -156,13 +197,32 @@ std::string_view DictionaryNode::name(std::size_t position) const noexcept {
     return Contents::bytes(entries[position].key).view();
 }
 
-void DictionaryNode::set(std::string_view key, Value value) {
+std::optional<std::size_t> DictionaryNode::findWalking(std::string_view key, std::uint32_t digest) const noexcept {
+    for (std::size_t i = 0; i < entries.size(); ++i)
+        if (Contents::digest(entries[i].key) == digest && name(i) == key) return i;
+    return std::nullopt;
+}
+
+void DictionaryNode::takeOverBase() {
+    if (base == nullptr) return;
+    const Value ending = Contents::valueOf(std::exchange(base, nullptr)); // the share in it
+    entries.insert(entries.begin(), Contents::dictionary(ending).entries.begin(),
+                   Contents::dictionary(ending).entries.end());
+    rebuildIndex();
+}
+
+void DictionaryNode::set(std::string_view key, Value value, const Value& shared) {
     require(static_cast<bool>(value), "an absent value cannot be in a dictionary");
+    if (base != nullptr) {
+        const Value* present = base->valueUnder(key);
+        if (present != nullptr && Contents::isSame(*present, value)) return;
+        if (present != nullptr) takeOverBase();
+    }
     if (const auto position = find(key)) {
         std::swap(entries[*position].value, value); // the old value goes last: `key` may point into it
         return;
     }
-    Value name(key);
+    Value name = shared ? shared : Value(key);
     if (!index.empty()) {
         const auto place = lowerBound(key);
         index.insert(place, static_cast<std::uint32_t>(entries.size()));
@@ -188,7 +248,8 @@ bool DictionaryNode::rebuildIndex() {
         for (std::size_t i = 0; i < entries.size(); ++i) {
             names[i] = name(i);
             for (std::size_t j = 0; j < i; ++j)
-                if (names[j] == names[i]) return false;
+                if (Contents::digest(entries[j].key) == Contents::digest(entries[i].key) && names[j] == names[i])
+                    return false;
         }
         return true;
     }
@@ -240,6 +301,10 @@ void destroy(Kind kind, Node* node) noexcept {
             for (auto& entry : dictionary->entries) {
                 discard(entry.key);
                 discard(entry.value);
+            }
+            if (dictionary->base != nullptr && dictionary->base->dropReference()) {
+                dictionary->base->next = pending;
+                pending = dictionary->base;
             }
             delete dictionary;
         }
@@ -296,34 +361,46 @@ bool outsidesEqual(const Value& left, const Value& right) noexcept {
     case Kind::data: return Contents::bytes(left).view() == Contents::bytes(right).view();
     case Kind::uuid: return left.uuid() == right.uuid();
     case Kind::array: return Contents::array(left).values.size() == Contents::array(right).values.size();
-    case Kind::dictionary:
-        return Contents::dictionary(left).entries.size() == Contents::dictionary(right).entries.size();
+    case Kind::dictionary: return Contents::dictionary(left).size() == Contents::dictionary(right).size();
     default: return true;
     }
 }
 
 } // namespace
 
-Value::Value(bool value) noexcept : _bits(value ? 1 : 0), _kind(Kind::boolean), _unsigned(false) {}
+Value::Value(bool value) noexcept : _bits(value ? 1 : 0), _kind(Kind::boolean), _unsigned(false), _digest(0) {}
 
 Value::Value(Signed value) noexcept
-    : _bits(static_cast<std::uint64_t>(value.value)), _kind(Kind::integer), _unsigned(false) {}
+    : _bits(static_cast<std::uint64_t>(value.value)), _kind(Kind::integer), _unsigned(false), _digest(0) {}
 
 Value::Value(Unsigned value) noexcept
-    : _bits(value.value), _kind(Kind::integer), _unsigned(value.value > static_cast<std::uint64_t>(INT64_MAX)) {}
+    : _bits(value.value),
+      _kind(Kind::integer),
+      _unsigned(value.value > static_cast<std::uint64_t>(INT64_MAX)),
+      _digest(0) {}
 
-Value::Value(double value) noexcept : _bits(std::bit_cast<std::uint64_t>(value)), _kind(Kind::real), _unsigned(false) {}
+Value::Value(double value) noexcept
+    : _bits(std::bit_cast<std::uint64_t>(value)), _kind(Kind::real), _unsigned(false), _digest(0) {}
 
 Value::Value(Date value) noexcept
-    : _bits(std::bit_cast<std::uint64_t>(value.seconds)), _kind(Kind::date), _unsigned(false) {}
+    : _bits(std::bit_cast<std::uint64_t>(value.seconds)), _kind(Kind::date), _unsigned(false), _digest(0) {}
 
-Value::Value(Kind kind, detail::Node* node) noexcept : _bits(bitsOf(node)), _kind(kind), _unsigned(false) {}
+Value::Value(Kind kind, detail::Node* node) noexcept : _bits(bitsOf(node)), _kind(kind), _unsigned(false), _digest(0) {}
 
 Value::Value(std::string_view value)
-    : Value(Kind::string, linux_::firstBadByte(value) ? detail::BytesNode::make(wellFormed(value))
-                                                      : detail::BytesNode::make(value)) {}
+    : Value(Kind::string,
+            linux_::firstBadByte(value) ? detail::BytesNode::make(wellFormed(value)) : detail::BytesNode::make(value)) {
+    _digest = detail::digestOf(Contents::bytes(*this).view());
+}
 
 Value Value::data(std::string_view bytes) { return Value(Kind::data, detail::BytesNode::make(bytes)); }
+
+Value Value::makeData(std::size_t size, const std::function<void(char* bytes)>& fill) {
+    auto* node = detail::BytesNode::make(size);
+    Value data(Kind::data, node);
+    fill(node->space());
+    return data;
+}
 
 Value::Value(const UUID& value) : Value(Kind::uuid, new detail::UUIDNode(value)) {}
 
@@ -376,9 +453,14 @@ std::optional<Array> Value::array() const noexcept {
     return Array(*this);
 }
 
-std::optional<Dictionary> Value::dictionary() const noexcept {
+std::optional<Dictionary> Value::dictionary() const& noexcept {
     if (_kind != Kind::dictionary) return std::nullopt;
     return Dictionary(*this);
+}
+
+std::optional<Dictionary> Value::dictionary() && noexcept {
+    if (_kind != Kind::dictionary) return std::nullopt;
+    return Dictionary(std::move(*this));
 }
 
 bool Value::isNumber() const noexcept {
@@ -424,9 +506,9 @@ bool operator==(const Value& left, const Value& right) noexcept {
             continue;
         }
         const auto& others = Contents::dictionary(*other);
-        for (const auto& entry : Contents::dictionary(*one).entries) {
-            const auto position = others.find(entry.name());
-            if (!position || differs(entry.value, others.entries[*position].value)) return false;
+        for (const auto& entry : Contents::dictionary(*one)) {
+            const Value* value = others.valueUnder(entry.name());
+            if (value == nullptr || differs(entry.value, *value)) return false;
         }
     }
     return true;
@@ -437,21 +519,21 @@ namespace {
 /// Writes a description and stops taking text once the limit is reached.
 class Describer {
 public:
-    std::string describe(const Value& value) {
+    explicit Describer(std::string& out) : _out(out), _start(out.size()), _limit(_start + limit) {}
+
+    void describe(const Value& value) {
         append(value, 0);
-        if (_out.size() > limit) {
-            std::size_t end = limit;
-            while (end > 0 && (static_cast<unsigned char>(_out[end]) & 0xC0U) == 0x80U) --end;
-            _out.resize(end);
-            _out += ellipsis;
-        }
-        return std::move(_out);
+        if (!isFull()) return;
+        std::size_t end = _limit;
+        while (end > _start && (static_cast<unsigned char>(_out[end]) & 0xC0U) == 0x80U) --end;
+        _out.resize(end);
+        _out += ellipsis;
     }
 
 private:
     static constexpr std::size_t limit = maximumDescriptionLength - ellipsis.size();
 
-    bool isFull() const { return _out.size() > limit; }
+    bool isFull() const { return _out.size() > _limit; }
 
     void append(const Value& value, std::size_t depth) {
         if (isFull()) return;
@@ -474,7 +556,7 @@ private:
         case Kind::data: appendData(*value.data()); break;
         case Kind::uuid: _out += value.uuid()->text(); break;
         case Kind::array: appendArray(Contents::array(value).values, depth); break;
-        case Kind::dictionary: appendDictionary(Contents::dictionary(value).entries, depth); break;
+        case Kind::dictionary: appendDictionary(Contents::dictionary(value), depth); break;
         }
     }
 
@@ -502,6 +584,11 @@ private:
     /// Text as it is, but for what could end a line, steer a terminal or break the encoding of the log.
     void appendText(std::string_view text) {
         for (std::size_t at = 0; at < text.size() && !isFull();) {
+            if (const std::size_t plain = linux_::plainLength(text.substr(at)); plain > 0) {
+                _out += text.substr(at, std::min(plain, _limit + 1 - _out.size()));
+                at += plain;
+                continue;
+            }
             const std::size_t length = linux_::utf8Length(text, at);
             const std::string_view character = text.substr(at, length == 0 ? 1 : length);
             if (length == 0 || isControl(character)) {
@@ -536,7 +623,7 @@ private:
         _out += ')';
     }
 
-    void appendDictionary(const std::vector<Dictionary::Entry>& entries, std::size_t depth) {
+    void appendDictionary(const detail::DictionaryNode& entries, std::size_t depth) {
         if (depth == maximumNesting) return appendNested();
         _out += '{';
         bool isFirst = true;
@@ -553,14 +640,38 @@ private:
 
     void appendNested() { _out += ellipsis; }
 
-    std::string _out;
+    std::string& _out;
+    const std::size_t _start;
+    const std::size_t _limit; // of `_out`
 };
 
 } // namespace
 
-std::string Value::description() const { return Describer().describe(*this); }
+void Value::describeTo(std::string& out) const { Describer(out).describe(*this); }
 
-Array::Array() : _storage(Kind::array, new detail::ArrayNode) {}
+std::string Value::description() const {
+    std::string text;
+    describeTo(text);
+    return text;
+}
+
+namespace {
+
+// What is empty and read-only is one and the same: most of them only stand in for what is not there. Kept for ever, for
+// other statics may still hold it when the process ends.
+const Value& emptyArray() {
+    static const Value& storage = *new Value(Contents::newArray());
+    return storage;
+}
+
+const Value& emptyDictionary() {
+    static const Value& storage = *new Value(Contents::newDictionary());
+    return storage;
+}
+
+} // namespace
+
+Array::Array() : _storage(emptyArray()) {}
 
 Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) {}
 
@@ -583,6 +694,8 @@ const Value* Array::end() const noexcept { return begin() + size(); }
 
 bool operator==(const Array& left, const Array& right) noexcept { return left._storage == right._storage; }
 
+MutableArray::MutableArray() : Array(Contents::newArray()) {}
+
 MutableArray MutableArray::copyOf(const Array& other) {
     MutableArray copy;
     auto& values = Contents::array(copy._storage).values;
@@ -595,23 +708,24 @@ void MutableArray::append(Value value) {
     Contents::array(_storage).values.push_back(std::move(value));
 }
 
-Dictionary::Dictionary() : _storage(Kind::dictionary, new detail::DictionaryNode) {}
+Dictionary::Dictionary() : _storage(emptyDictionary()) {}
 
-Dictionary::Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries) : Dictionary() {
+Dictionary::Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries)
+    : _storage(Contents::newDictionary()) {
     for (const auto& [key, value] : entries) Contents::dictionary(_storage).set(key, value);
 }
 
 std::optional<Dictionary> Dictionary::fromUniqueEntries(std::vector<Entry> entries) {
     for (const auto& entry : entries)
         require(entry.key.kind() == Kind::string && entry.value, "a dictionary entry is a string and a value");
-    Dictionary made;
+    Dictionary made(Contents::newDictionary());
     auto& node = Contents::dictionary(made._storage);
     node.entries = std::move(entries);
     if (!node.rebuildIndex()) return std::nullopt;
     return made;
 }
 
-std::size_t Dictionary::size() const noexcept { return Contents::dictionary(_storage).entries.size(); }
+std::size_t Dictionary::size() const noexcept { return Contents::dictionary(_storage).size(); }
 
 Value Dictionary::operator[](std::string_view key) const noexcept {
     const Value* value = find(key);
@@ -619,14 +733,12 @@ Value Dictionary::operator[](std::string_view key) const noexcept {
 }
 
 const Value* Dictionary::find(std::string_view key) const noexcept {
-    const auto& node = Contents::dictionary(_storage);
-    const auto position = node.find(key);
-    return position ? &node.entries[*position].value : nullptr;
+    return Contents::dictionary(_storage).valueUnder(key);
 }
 
-const Dictionary::Entry* Dictionary::begin() const noexcept { return Contents::dictionary(_storage).entries.data(); }
+Dictionary::Iterator Dictionary::begin() const noexcept { return Contents::dictionary(_storage).begin(); }
 
-const Dictionary::Entry* Dictionary::end() const noexcept { return begin() + size(); }
+Dictionary::Iterator Dictionary::end() const noexcept { return Contents::dictionary(_storage).end(); }
 
 std::optional<std::string_view> Dictionary::string(std::string_view key) const noexcept {
     const Value* value = find(key);
@@ -655,23 +767,36 @@ std::optional<Dictionary> Dictionary::dictionary(std::string_view key) const noe
 
 Dictionary Dictionary::keepingEncoding() const {
     MutableDictionary copy = MutableDictionary::copyOf(*this);
+    auto& node = Contents::dictionary(copy._storage);
+    node.takeOverBase();
+    node.entries.shrink_to_fit();
     auto encoding = std::make_unique<std::string>();
-    appendCompact(*encoding, *this);
+    for (const auto& entry : node.entries) linux_::appendEntry(*encoding, entry);
     encoding->shrink_to_fit();
-    Contents::dictionary(copy._storage).encoding = std::move(encoding);
+    node.encoding = std::move(encoding);
     return copy;
 }
 
-std::optional<std::string_view> Dictionary::keptEncoding() const noexcept {
-    const auto& encoding = Contents::dictionary(_storage).encoding;
-    return encoding ? std::optional<std::string_view>(*encoding) : std::nullopt;
+namespace linux_ {
+
+EncodingParts encodingParts(const Value& dictionary) noexcept {
+    const auto& node = Contents::dictionary(dictionary);
+    if (node.encoding) return {*node.encoding, node.entries.size(), {}};
+    if (node.base == nullptr) return {{}, 0, node.entries};
+    return {*node.base->encoding, node.base->entries.size(), node.entries};
 }
+
+std::span<const Value> itemsOf(const Value& array) noexcept { return Contents::array(array).values; }
+
+} // namespace linux_
 
 bool Dictionary::sharesStorageWith(const Dictionary& other) const noexcept {
     return Contents::node(_storage) == Contents::node(other._storage);
 }
 
 bool operator==(const Dictionary& left, const Dictionary& right) noexcept { return left._storage == right._storage; }
+
+MutableDictionary::MutableDictionary() : Dictionary(Contents::newDictionary()) {}
 
 MutableDictionary MutableDictionary::copyOf(const Dictionary& other) {
     MutableDictionary copy;
@@ -680,15 +805,39 @@ MutableDictionary MutableDictionary::copyOf(const Dictionary& other) {
     auto& to = Contents::dictionary(copy._storage);
     to.entries = from.entries;
     to.index = from.index;
+    if (from.base != nullptr) from.base->addReference();
+    to.base = from.base;
     return copy;
+}
+
+MutableDictionary MutableDictionary::extending(const Dictionary& kept) {
+    const Value shared(kept);
+    auto& base = Contents::dictionary(shared);
+    require(base.encoding != nullptr, "only a dictionary that keeps its encoding can be extended");
+    MutableDictionary extension;
+    base.addReference();
+    Contents::dictionary(extension._storage).base = &base;
+    return extension;
+}
+
+bool MutableDictionary::isUnchangedFrom(const Dictionary& kept) const noexcept {
+    const auto& node = Contents::dictionary(_storage);
+    const Value shared(kept);
+    return node.base == &Contents::dictionary(shared) && node.entries.empty();
 }
 
 void MutableDictionary::set(std::string_view key, Value value) {
     Contents::dictionary(_storage).set(key, std::move(value));
 }
 
+void MutableDictionary::setSharing(const Value& key, Value value) {
+    require(key.kind() == Kind::string, "a key is a string");
+    Contents::dictionary(_storage).set(Contents::bytes(key).view(), std::move(value), key);
+}
+
 void MutableDictionary::remove(std::string_view key) {
     auto& node = Contents::dictionary(_storage);
+    if (node.base != nullptr && node.base->valueUnder(key) != nullptr) node.takeOverBase();
     if (const auto position = node.find(key)) node.erase(*position);
 }
 
@@ -696,6 +845,7 @@ void MutableDictionary::merge(const Dictionary& other) {
     if (sharesStorageWith(other)) return;
     // One sort at the end instead of an insertion into the index for each new key.
     auto& node = Contents::dictionary(_storage);
+    node.takeOverBase();
     std::vector<Entry> added;
     for (const auto& entry : other) {
         if (const auto position = node.find(entry.name()))

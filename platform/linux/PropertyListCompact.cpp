@@ -45,52 +45,92 @@ template <class Number> Number littleEndian(Number number) noexcept {
 /// nests deeper than this was built by mistake, and encoding it would risk the stack.
 constexpr std::size_t maximumBuiltNesting = 4 * maximumNesting;
 
-class Writer {
+/// Where an encoding goes. Containers begin with their size, which is patched in behind.
+class StringSink {
 public:
-    explicit Writer(std::string& out) : _out(out) {}
+    explicit StringSink(std::string& out) : _out(out) {}
+    std::size_t position() const { return _out.size(); }
+    void put(const void* bytes, std::size_t size) { _out.append(static_cast<const char*>(bytes), size); }
+    void patch(std::size_t position, std::uint32_t number) {
+        std::memcpy(_out.data() + position, &number, sizeof number);
+    }
+
+private:
+    std::string& _out;
+};
+
+/// Memory that is as large as the encoding.
+class MemorySink {
+public:
+    explicit MemorySink(char* start) : _start(start), _at(start) {}
+    std::size_t position() const { return static_cast<std::size_t>(_at - _start); }
+    void put(const void* bytes, std::size_t size) {
+        if (size == 0) return;
+        std::memcpy(_at, bytes, size);
+        _at += size;
+    }
+    void patch(std::size_t position, std::uint32_t number) { std::memcpy(_start + position, &number, sizeof number); }
+
+private:
+    char* const _start;
+    char* _at;
+};
+
+class CountingSink {
+public:
+    std::size_t position() const { return _size; }
+    void put(const void*, std::size_t size) { _size += size; }
+    void patch(std::size_t, std::uint32_t) {}
+
+private:
+    std::size_t _size = 0;
+};
+
+template <class Sink> class Writer {
+public:
+    explicit Writer(Sink& sink) : _sink(sink) {}
 
     void append(const Value& value, std::size_t depth = 0) {
         switch (value.kind()) {
         case Kind::none: fail("an absent value has no encoding");
-        case Kind::boolean: _out += static_cast<char>(*value.boolean() ? trueTag : falseTag); break;
+        case Kind::boolean: putTag(*value.boolean() ? trueTag : falseTag); break;
         case Kind::integer:
             if (const auto number = value.int64())
-                appendNumber(integerTag, static_cast<std::uint64_t>(*number));
+                putNumber(integerTag, static_cast<std::uint64_t>(*number));
             else
-                appendNumber(unsignedTag, *value.uint64());
+                putNumber(unsignedTag, *value.uint64());
             break;
-        case Kind::real: appendNumber(realTag, std::bit_cast<std::uint64_t>(*value.real())); break;
-        case Kind::date: appendNumber(dateTag, std::bit_cast<std::uint64_t>(value.date()->seconds)); break;
-        case Kind::string: appendBytes(stringTag, *value.string()); break;
-        case Kind::data: appendBytes(dataTag, *value.data()); break;
+        case Kind::real: putNumber(realTag, std::bit_cast<std::uint64_t>(*value.real())); break;
+        case Kind::date: putNumber(dateTag, std::bit_cast<std::uint64_t>(value.date()->seconds)); break;
+        case Kind::string: putBytes(stringTag, *value.string()); break;
+        case Kind::data: putBytes(dataTag, *value.data()); break;
         case Kind::uuid: {
-            _out += static_cast<char>(uuidTag);
+            putTag(uuidTag);
             const UUID uuid = *value.uuid();
-            _out.append(reinterpret_cast<const char*>(uuid.bytes.data()), uuid.bytes.size());
+            _sink.put(uuid.bytes.data(), uuid.bytes.size());
             break;
         }
         case Kind::array: {
-            const Array array = *value.array();
-            const std::size_t start = beginContainer(arrayTag, array.size(), depth);
-            for (const auto& item : array) append(item, depth + 1);
+            const auto items = linux_::itemsOf(value);
+            const std::size_t start = beginContainer(arrayTag, items.size(), depth);
+            for (const auto& item : items) append(item, depth + 1);
             endContainer(start);
             break;
         }
         case Kind::dictionary: {
-            const Dictionary dictionary = *value.dictionary();
-            if (const auto kept = dictionary.keptEncoding()) {
-                _out.append(*kept);
-                break;
-            }
-            const std::size_t start = beginContainer(dictionaryTag, dictionary.size(), depth);
-            for (const auto& entry : dictionary) {
-                appendSized(entry.name());
-                append(entry.value, depth + 1);
-            }
+            const auto parts = linux_::encodingParts(value);
+            const std::size_t start = beginContainer(dictionaryTag, parts.keptEntries + parts.others.size(), depth);
+            _sink.put(parts.kept.data(), parts.kept.size());
+            for (const auto& entry : parts.others) appendEntry(entry, depth + 1);
             endContainer(start);
             break;
         }
         }
+    }
+
+    void appendEntry(const Dictionary::Entry& entry, std::size_t depth) {
+        putSized(entry.name());
+        append(entry.value, depth);
     }
 
 private:
@@ -104,40 +144,42 @@ private:
         return littleEndian(static_cast<std::uint32_t>(size));
     }
 
-    void appendNumber(Tag tag, std::uint64_t number) {
+    void putTag(Tag tag) { _sink.put(&tag, sizeof tag); }
+
+    void putNumber(Tag tag, std::uint64_t number) {
         char bytes[1 + sizeof number];
         bytes[0] = static_cast<char>(tag);
         number = littleEndian(number);
         std::memcpy(bytes + 1, &number, sizeof number);
-        _out.append(bytes, sizeof bytes);
+        _sink.put(bytes, sizeof bytes);
     }
 
-    void appendBytes(Tag tag, std::string_view bytes) {
-        _out += static_cast<char>(tag);
-        appendSized(bytes);
+    void putBytes(Tag tag, std::string_view bytes) {
+        putTag(tag);
+        putSized(bytes);
     }
 
-    void appendSized(std::string_view bytes) {
+    void putSized(std::string_view bytes) {
         const std::uint32_t size = sizeField(bytes.size());
-        _out.append(reinterpret_cast<const char*>(&size), sizeof size);
-        _out.append(bytes);
+        _sink.put(&size, sizeof size);
+        _sink.put(bytes.data(), bytes.size());
     }
 
     /// Leaves room for the size; the answer says where the items begin.
     std::size_t beginContainer(Tag tag, std::size_t count, std::size_t depth) {
         if (depth == maximumBuiltNesting) fail("a value nests without end");
         const std::uint32_t fields[2] = {0, sizeField(count)};
-        _out += static_cast<char>(tag);
-        _out.append(reinterpret_cast<const char*>(fields), sizeof fields);
-        return _out.size();
+        putTag(tag);
+        _sink.put(fields, sizeof fields);
+        return _sink.position();
     }
 
     void endContainer(std::size_t start) {
-        const std::uint32_t size = sizeField(_out.size() - start);
-        std::memcpy(_out.data() + start - 2 * sizeof size, &size, sizeof size);
+        const std::uint32_t size = sizeField(_sink.position() - start);
+        _sink.patch(start - 2 * sizeof size, size);
     }
 
-    std::string& _out;
+    Sink& _sink;
 };
 
 class Reader {
@@ -329,13 +371,34 @@ private:
 
 } // namespace
 
-void appendCompact(std::string& out, const Value& value) { Writer(out).append(value); }
+void appendCompact(std::string& out, const Value& value) {
+    StringSink sink(out);
+    Writer(sink).append(value);
+}
+
+std::size_t compactSize(const Value& value) {
+    CountingSink sink;
+    Writer(sink).append(value);
+    return sink.position();
+}
+
+Value compactData(const Value& value) {
+    return Value::makeData(compactSize(value), [&](char* bytes) {
+        MemorySink sink(bytes);
+        Writer(sink).append(value);
+    });
+}
 
 Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids, std::size_t nesting) {
     return Reader(bytes, 0, uuids, nesting).read();
 }
 
 namespace linux_ {
+
+void appendEntry(std::string& out, const Dictionary::Entry& entry) {
+    StringSink sink(out);
+    Writer(sink).appendEntry(entry, 1);
+}
 
 Result<DecodedMessage> decodeMessage(std::string_view bytes, std::size_t maximumSize) {
     Reader reader(bytes, 0, UUIDs::allowed, maximumNesting, maximumSize);

@@ -6,11 +6,14 @@
 #include "platform/linux/SandboxToken.h"
 #include "platform/linux/SystemError.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
 #include <fcntl.h>
+#include <functional>
 #include <sys/stat.h>
+#include <utility>
 
 namespace platform::linux_ {
 
@@ -24,6 +27,11 @@ constexpr std::size_t maximumResolutions = 8192;
 /// A directory above may move without a sign at the file itself. A token made from an outdated resolution opens
 /// nothing, so this bounds how long one is handed out in vain.
 constexpr std::chrono::seconds resolutionLifetime{5};
+
+/// One look at a file serves the answers of that time: among them are those of hosts that ask again and again, and a
+/// look costs more than the rest of a form. Shorter than what the registry takes to hear that a bundle was replaced. A
+/// token handed out in vain meanwhile is like one from just before: it opens nothing.
+constexpr std::chrono::milliseconds lookLifetime{20};
 
 bool isName(const std::string& text) {
     return !text.empty() && text.size() <= maximumNameLength && text.find('\0') == std::string::npos;
@@ -62,31 +70,32 @@ void Sandbox::removeBrokerName() {
     if (_broker) _broker->removeName();
 }
 
-std::string Sandbox::resolutionKey(const std::string& path, const std::string& within) {
-    std::string key;
-    key.reserve(path.size() + 1 + within.size());
-    key = path;
-    if (!within.empty()) key.append(1, '\0').append(within);
-    return key;
-}
-
 /// The token of an earlier resolution, while the file is the one that it was made for.
-std::optional<std::string> Sandbox::knownToken(const std::string& key, const std::string& path,
-                                               const std::string& extensionClass, bool canonical) {
+std::optional<std::string> Sandbox::knownToken(const std::string& path, const std::string& extensionClass,
+                                               bool canonical, const std::string& within) {
+    const auto now = Clock::now();
+    const auto isCurrent = [&](const Resolution& resolution) {
+        return resolution.tokenCanonical == canonical && resolution.tokenClass == extensionClass &&
+               resolution.within == within && now - resolution.resolved < resolutionLifetime;
+    };
+    {
+        const std::lock_guard lock(_mutex);
+        const auto known = _resolutions.find(path);
+        if (known == _resolutions.end() || !isCurrent(known->second)) return std::nullopt;
+        if (now - known->second.looked < lookLifetime) return known->second.token;
+    }
     FileStatus status;
     if (readFileStatus(AT_FDCWD, path.c_str(), status) != 0) return std::nullopt;
-    const auto now = std::chrono::steady_clock::now();
     const std::lock_guard lock(_mutex);
-    const auto known = _resolutions.find(key);
-    if (known == _resolutions.end()) return std::nullopt;
-    const Resolution& resolution = known->second;
-    const bool isCurrent = resolution.status == status && now - resolution.checked < resolutionLifetime &&
-                           resolution.tokenCanonical == canonical && resolution.tokenClass == extensionClass;
-    return isCurrent ? std::optional(resolution.token) : std::nullopt;
+    const auto known = _resolutions.find(path); // it may be another one by now
+    if (known == _resolutions.end() || !isCurrent(known->second) || known->second.status != status) return std::nullopt;
+    known->second.looked = now;
+    return known->second.token;
 }
 
 int Sandbox::resolve(const std::string& path, const std::string& within, Resolution& resolution) {
-    resolution.checked = std::chrono::steady_clock::now();
+    resolution.within = within;
+    resolution.resolved = resolution.looked = Clock::now();
     if (int number = readFileStatus(AT_FDCWD, path.c_str(), resolution.status)) return number;
     if (int number = canonicalise(path, resolution.canonicalPath)) return number;
     if (!within.empty()) {
@@ -99,6 +108,18 @@ int Sandbox::resolve(const std::string& path, const std::string& within, Resolut
     return S_ISREG(resolution.status.mode) || S_ISDIR(resolution.status.mode) ? 0 : EINVAL;
 }
 
+/// Whether it is worth keeping what was made for `key`: not for an answer that shows thousands of plug-ins once, where
+/// what is kept would lie scattered among what goes, and hold its memory. With the lock held.
+bool Sandbox::isAskedAgain(const std::string& key) {
+    const std::size_t hash = std::hash<std::string>()(key);
+    auto& recent = _askedOnce[hash % _askedOnce.size()];
+    const auto mark = static_cast<std::uint32_t>(hash >> 32U) | 1U; // never that of an empty place
+    if (std::find(recent.begin(), recent.end(), mark) != recent.end()) return true;
+    std::shift_right(recent.begin(), recent.end(), 1);
+    recent.front() = mark;
+    return false;
+}
+
 Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
                                        const std::string& within) {
     if (!_signer) return systemError(EPERM, path);
@@ -106,8 +127,7 @@ Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const 
         within.find('\0') != std::string::npos)
         return systemError(EINVAL, path);
     const bool canonical = flag == SandboxFlag::canonical;
-    std::string key = resolutionKey(path, within);
-    if (auto token = knownToken(key, path, extensionClass, canonical)) return *std::move(token);
+    if (auto token = knownToken(path, extensionClass, canonical, within)) return *std::move(token);
 
     Resolution resolution;
     if (int number = resolve(path, within, resolution)) return systemError(number, path);
@@ -118,24 +138,26 @@ Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const 
     resolution.tokenCanonical = canonical;
     resolution.token = *token;
     const std::lock_guard lock(_mutex);
+    if (!isAskedAgain(path)) return *std::move(token);
     if (_resolutions.size() >= maximumResolutions) _resolutions.clear();
-    _resolutions.insert_or_assign(std::move(key), std::move(resolution));
+    _resolutions.insert_or_assign(path, std::move(resolution));
     return *std::move(token);
 }
 
 Result<std::string> Sandbox::issueService(const std::string& extensionClass, const std::string& name) {
     if (!_signer) return systemError(EPERM, name);
     if (!isName(extensionClass) || !isName(name)) return systemError(EINVAL, name);
-    std::string key = resolutionKey(extensionClass, name);
     {
         const std::lock_guard lock(_mutex);
-        if (const auto known = _serviceTokens.find(key); known != _serviceTokens.end()) return known->second;
+        const auto known = _serviceTokens.find(name);
+        if (known != _serviceTokens.end() && known->second.extensionClass == extensionClass) return known->second.token;
     }
     auto token = _signer->sign({SandboxGrant::Kind::service, extensionClass, name, false, {}});
     if (!token) return systemError(ENOMEM, name);
     const std::lock_guard lock(_mutex);
+    if (!isAskedAgain(name)) return *std::move(token);
     if (_serviceTokens.size() >= maximumResolutions) _serviceTokens.clear();
-    _serviceTokens.insert_or_assign(std::move(key), *token);
+    _serviceTokens.insert_or_assign(name, ServiceToken{extensionClass, *token});
     return *std::move(token);
 }
 

@@ -5,10 +5,15 @@
 #include "platform/linux/FileStatus.h"
 #include "platform/linux/Root.h"
 
+#include <array>
 #include <chrono>
+#include <cstddef>
+#include <cstdint>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
+#include <string>
 #include <string_view>
 #include <unordered_map>
 
@@ -64,30 +69,42 @@ private:
     };
     int ask(std::string_view request, Descriptor& opened) const;
 
-    /// Where a path led at `checked`, and whether that was within the directory asked for.
+    using Clock = std::chrono::steady_clock;
+
+    /// Where a path led at `resolved`, and whether that was within the directory asked for.
     struct Resolution {
+        std::string within;
         std::string canonicalPath;
         FileStatus status;
-        std::chrono::steady_clock::time_point checked; // when it was resolved
+        Clock::time_point resolved;
+        Clock::time_point looked; // when the file was last seen to be the same
         // The token made of it last: the same grant gives the same text.
         std::string tokenClass;
         bool tokenCanonical = false;
         std::string token;
     };
-    static std::string resolutionKey(const std::string& path, const std::string& within);
-    std::optional<std::string> knownToken(const std::string& key, const std::string& path,
-                                          const std::string& extensionClass, bool canonical);
+    struct ServiceToken {
+        std::string extensionClass;
+        std::string token;
+    };
+    std::optional<std::string> knownToken(const std::string& path, const std::string& extensionClass, bool canonical,
+                                          const std::string& within);
     /// Zero, or an errno value.
     static int resolve(const std::string& path, const std::string& within, Resolution& resolution);
+
+    bool isAskedAgain(const std::string& key);
 
     const Root _root;
     std::unique_ptr<TokenSigner> _signer; // issuers only
     std::unique_ptr<SandboxBroker> _broker;
     mutable std::mutex _mutex;
-    std::unordered_map<std::string, Resolution> _resolutions;    // guarded by _mutex; by path, NUL, directory
-    std::unordered_map<std::string, std::string> _serviceTokens; // guarded by _mutex; by class, NUL, name
-    std::map<std::int64_t, Right> _handles;                      // guarded by _mutex
-    std::int64_t _nextHandle = 1;                                // guarded by _mutex
+    std::unordered_map<std::string, Resolution> _resolutions;     // guarded by _mutex; by path
+    std::unordered_map<std::string, ServiceToken> _serviceTokens; // guarded by _mutex; by name
+    // Guarded by _mutex: hashes of what was asked for once, the last few of each class of them. Enough for all that may
+    // be kept.
+    std::array<std::array<std::uint32_t, 4>, 4096> _askedOnce{};
+    std::map<std::int64_t, Right> _handles; // guarded by _mutex
+    std::int64_t _nextHandle = 1;           // guarded by _mutex
 };
 
 } // namespace platform::linux_

@@ -146,8 +146,7 @@ private:
 std::string printableLine(std::string_view message, std::size_t limit) {
     constexpr std::string_view ellipsis = "...";
     constexpr std::string_view hexadecimal = "0123456789abcdef";
-    const bool isPlain = std::all_of(message.begin(), message.end(), [](char c) { return c >= 0x20 && c < 0x7F; });
-    if (isPlain && message.size() <= limit) return std::string(message);
+    if (message.size() <= limit && plainLength(message) == message.size()) return std::string(message);
     std::string out;
     out.reserve(std::min(message.size(), limit));
     std::size_t cut = 0; // where whole pieces end with room for the ellipsis

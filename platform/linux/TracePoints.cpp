@@ -65,8 +65,10 @@ void pluginRemove(const char* path, bool isResolved) noexcept {
         STAP_PROBE2(zbd, plugin__remove, path, isResolved);
 }
 
+bool pluginReadyEnabled() noexcept { return zbd_plugin__ready_semaphore != 0; }
+
 void pluginReady(const char* uuidText) noexcept {
-    if (zbd_plugin__ready_semaphore != 0) [[unlikely]]
+    if (pluginReadyEnabled()) [[unlikely]]
         STAP_PROBE1(zbd, plugin__ready, uuidText);
 }
 

@@ -267,6 +267,11 @@ void StreamConnection::removeWaiting(const WaitingMessage& message) {
 }
 
 bool StreamConnection::appendOut(FrameType type, std::uint64_t id, const Value& content) {
+    // Only now: a long reply that nothing follows is not moved while it goes out piece by piece.
+    if (_outSent > _out.size() / 2) {
+        _out.erase(0, _outSent);
+        _outSent = 0;
+    }
     return appendFrame(_out, type, id, content);
 }
 
@@ -291,10 +296,6 @@ void StreamConnection::flushOut() {
         if (_out.capacity() > keptBufferBytes) _out.shrink_to_fit();
         _outShare.resize(0);
         return;
-    }
-    if (_outSent > _out.size() / 2) {
-        _out.erase(0, _outSent);
-        _outSent = 0;
     }
     if (unsent() > maximumUnsentBytes || !_outShare.resize(_out.size())) {
         _sendBroken = true;
@@ -614,7 +615,7 @@ void StreamConnection::deliverReply(const Frame& frame) {
     } else if (auto dictionary = content->dictionary()) {
         reply = *std::move(dictionary);
     }
-    pending->queue->asyncOnCaller([loop = _loop, handler = std::move(pending->handler), reply = std::move(reply)] {
+    pending->queue->async([loop = _loop, handler = std::move(pending->handler), reply = std::move(reply)] {
         if (!loop->isStopped()) handler(reply);
     });
     if (!content) malformed(content.error().text().c_str());
@@ -623,7 +624,7 @@ void StreamConnection::deliverReply(const Frame& frame) {
 void StreamConnection::deliverEvent(const std::shared_ptr<EventHandler>& handler, ConnectionEvent event) {
     if (!handler) return;
     if (isAccepted()) return (*handler)(event);
-    _queue->asyncOnCaller([loop = _loop, handler, event = std::move(event)] {
+    _queue->async([loop = _loop, handler, event = std::move(event)] {
         if (!loop->isStopped()) (*handler)(event);
     });
 }
@@ -644,7 +645,7 @@ void StreamConnection::fail(const std::string& reason) {
     _frameBuffered = false;
     const TransportError error = invalid(reason);
     for (auto& [id, pending] : remains.pending) {
-        pending.queue->asyncOnCaller([loop = _loop, handler = std::move(pending.handler), error] {
+        pending.queue->async([loop = _loop, handler = std::move(pending.handler), error] {
             if (!loop->isStopped()) handler(error);
         });
     }
@@ -653,7 +654,7 @@ void StreamConnection::fail(const std::string& reason) {
         if (remains.handler) (*remains.handler)(error);
         remains.finalize();
     } else {
-        _queue->asyncOnCaller([loop = _loop, remains = std::move(remains), error]() mutable {
+        _queue->async([loop = _loop, remains = std::move(remains), error]() mutable {
             if (remains.handler && !loop->isStopped()) (*remains.handler)(error);
             remains.finalize();
         });

@@ -51,18 +51,16 @@ FrameScan scanFrame(std::string_view bytes) {
 
 bool appendFrame(std::string& out, FrameType type, std::uint64_t id, const Value& content) {
     const std::size_t start = out.size();
+    const std::size_t length = frameHeaderSize - frameLengthSize + compactSize(content);
+    if (length > maximumFrameLength) return false;
+    out.reserve(start + frameLengthSize + length); // a long answer is copied once
+    const auto field = static_cast<std::uint32_t>(length);
     std::array<char, frameHeaderSize> header{};
+    std::memcpy(header.data(), &field, sizeof field);
     header[4] = static_cast<char>(type);
     std::memcpy(header.data() + 8, &id, sizeof id);
     out.append(header.data(), header.size());
     appendCompact(out, content);
-    const std::size_t length = out.size() - start - frameLengthSize;
-    if (length > maximumFrameLength) {
-        out.resize(start);
-        return false;
-    }
-    const auto field = static_cast<std::uint32_t>(length);
-    std::memcpy(out.data() + start, &field, sizeof field);
     return true;
 }
 

@@ -1,6 +1,8 @@
 #pragma once
 
+#include "platform/Transport.h"
 #include "platform/linux/TransportBudget.h"
+#include "platform/linux/TransportFrame.h"
 
 #include <chrono>
 #include <cstddef>
@@ -9,8 +11,9 @@
 /// What one peer can make this process hold or wait for. None of these bounds changes what the protocol means.
 namespace platform::linux_::qmx {
 
-/// The largest value of a frame's length field. A full "match" answer of 10,000 plug-ins is about 24 MB.
+/// The largest value of a frame's length field.
 inline constexpr std::size_t maximumFrameLength = std::size_t{64} << 20U;
+static_assert(maximumMessageSize + frameHeaderSize <= maximumFrameLength);
 
 /// Requests of one connection that were delivered and not answered yet. Past it the connection is not read until half
 /// of them are answered; half, so that a client that keeps it full does not cost a wake-up per reply.

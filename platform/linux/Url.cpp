@@ -76,20 +76,28 @@ std::size_t schemeLength(std::string_view text) {
     return 0;
 }
 
+/// The text of the URL of a path.
+std::string textOf(std::string_view path) {
+    std::string text = path.starts_with('/') ? "file://" : "";
+    appendEscaped(text, path);
+    return text;
+}
+
 /// What stands before a query or fragment.
 std::string_view withoutQuery(std::string_view text) { return text.substr(0, text.find_first_of("?#")); }
 
 } // namespace
 
 URL::URL(std::string text, std::string path, bool isFile)
-    : _text(std::move(text)), _path(std::move(path)), _isFile(isFile) {}
+    : _text(text.empty() || text == textOf(path) ? std::string() : std::move(text)),
+      _path(std::move(path)),
+      _isFile(isFile) {}
+
+std::string URL::absoluteString() const { return _text.empty() ? textOf(_path) : _text; }
 
 URL URL::file(std::string_view path) {
     path = withoutTrailingSeparators(path);
-    const bool isAbsolute = path.starts_with('/');
-    std::string text = isAbsolute ? "file://" : "";
-    appendEscaped(text, path);
-    return URL(std::move(text), std::string(path), isAbsolute);
+    return URL({}, std::string(path), path.starts_with('/'));
 }
 
 std::optional<URL> URL::parse(std::string_view text) {
@@ -118,11 +126,12 @@ std::optional<URL> URL::parse(std::string_view text) {
 }
 
 URL URL::appending(std::string_view component) const {
-    const std::string_view base = withoutQuery(_text);
+    const std::string whole = absoluteString();
+    const std::string_view base = withoutQuery(whole);
     std::string text(base);
     if (!text.ends_with('/')) text += '/';
     appendEscaped(text, component);
-    text += std::string_view(_text).substr(base.size());
+    text += std::string_view(whole).substr(base.size());
 
     std::string path = _path;
     if (!path.ends_with('/')) path += '/';

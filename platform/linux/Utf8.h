@@ -31,6 +31,21 @@ inline std::size_t utf8Length(std::string_view text, std::size_t at) noexcept {
     return 4;
 }
 
+/// The length of the run of printable ASCII at the start of `text`, in steps of eight bytes where it can.
+inline std::size_t plainLength(std::string_view text) noexcept {
+    constexpr std::uint64_t ones = 0x0101010101010101U;
+    constexpr std::uint64_t highBits = 0x80 * ones;
+    std::size_t at = 0;
+    for (std::uint64_t word = 0; text.size() - at >= sizeof word; at += sizeof word) {
+        std::memcpy(&word, text.data() + at, sizeof word);
+        // A high bit is set for a byte beyond ASCII, for DEL, and for one below a blank; carries and borrows begin only
+        // at such bytes.
+        if (((word | (word + ones) | (word - 0x20 * ones)) & highBits) != 0) break;
+    }
+    while (at < text.size() && text[at] >= 0x20 && text[at] < 0x7F) ++at;
+    return at;
+}
+
 /// The offset of the first byte that is NUL or not part of well-formed UTF-8; none when all is well.
 inline std::optional<std::size_t> firstBadByte(std::string_view text) noexcept {
     constexpr std::uint64_t ones = 0x0101010101010101U;

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <functional>
 #include <limits>
 
 namespace {
@@ -184,7 +185,8 @@ TEST(Dictionary, KeepsOrderAndFindsEveryKeyAtAnySize) {
             if (i % 3 != 0) kept.push_back(key(i));
         }
         ASSERT_EQ(dictionary.size(), kept.size());
-        for (std::size_t i = 0; i < kept.size(); ++i) EXPECT_EQ(dictionary.begin()[i].name(), kept[i]);
+        std::size_t place = 0;
+        for (const auto& entry : dictionary) EXPECT_EQ(entry.name(), kept[place++]);
         for (std::size_t i = 0; i < size; ++i) {
             const Value expected = i % 3 == 0 ? Value() : i % 5 == 0 ? Value("new") : Value(i);
             EXPECT_EQ(dictionary[key(i)], expected) << key(i) << " of " << size;
@@ -217,6 +219,39 @@ TEST(Dictionary, FromUniqueEntriesRefusesEqualKeysAtAnySize) {
     }
 }
 
+TEST(DictionaryExtension, IsLikeACopyWhateverChanges) {
+    const Dictionary kept = Dictionary{{"a", 1}, {"b", Array{2}}, {"c", "x"}}.keepingEncoding();
+    const std::string before = compact(kept);
+    const std::function<void(MutableDictionary&)> changes[] = {
+        [](auto&) {},
+        [](auto& it) { it.set("d", "new"); },
+        [](auto& it) { it.set("b", "replaced"); },
+        [](auto& it) { it.remove("a"); },
+        [](auto& it) { it.remove("missing"); },
+        [](auto& it) { it.merge({{"c", 3}, {"e", 4}}); },
+        [](auto& it) {
+            for (int i = 0; i < 40; ++i) it.set(std::to_string(i), i);
+            it.remove("7");
+            it.set(Value("a"), Dictionary());
+        },
+    };
+    for (std::size_t i = 0; i < std::size(changes); ++i) {
+        auto extension = MutableDictionary::extending(kept);
+        auto copy = MutableDictionary::copyOf(kept);
+        for (int time = 0; time < 2; ++time) {
+            for (auto* each : {&extension, &copy}) changes[i](*each);
+            EXPECT_EQ(extension, copy) << i;
+            EXPECT_EQ(compact(extension), compact(copy)) << i; // the order too
+            EXPECT_EQ(extension.size(), copy.size()) << i;
+            EXPECT_EQ(Value(extension).description(), Value(copy).description()) << i;
+            for (const auto& [key, value] : copy) EXPECT_EQ(extension[*key.string()], value) << i;
+            extension = MutableDictionary::copyOf(extension);
+        }
+        EXPECT_EQ(compact(extension.keepingEncoding()), compact(copy)) << i;
+    }
+    EXPECT_EQ(compact(kept), before);
+}
+
 TEST(Description, IsOneLineThatCannotBeForged) {
     const std::pair<Value, std::string> cases[] = {
         {Value(), "(null)"},
@@ -230,6 +265,15 @@ TEST(Description, IsOneLineThatCannotBeForged) {
         {Dictionary{{"k\n", 1}}, "{k\\x0a = 1}"},
     };
     for (const auto& [value, text] : cases) EXPECT_EQ(value.description(), text);
+    // Wherever a byte stands, for plain text is taken in pieces.
+    const std::pair<char, std::string> bytes[] = {{'\x1F', "\\x1f"}, {' ', " "}, {'~', "~"}, {'\x7F', "\\x7f"}};
+    for (std::size_t place = 0; place <= 17; ++place) {
+        for (const auto& [byte, text] : bytes) {
+            const std::string before(place, 'a');
+            const std::string behind(17 - place, 'b');
+            EXPECT_EQ(Value(before + byte + behind).description(), before + text + behind);
+        }
+    }
 }
 
 TEST(Description, IsCutBetweenCharacters) {
@@ -265,6 +309,8 @@ TEST(CompactEncoding, RoundTripsEveryValue) {
         ASSERT_TRUE(decoded) << decoded.error().text();
         EXPECT_EQ(*decoded, value);
         EXPECT_EQ(compact(*decoded), bytes); // kinds and order too
+        EXPECT_EQ(platform::compactSize(value), bytes.size());
+        EXPECT_EQ(platform::compactData(value).data(), bytes);
     }
 }
 

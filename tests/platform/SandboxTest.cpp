@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <chrono>
 #include <climits>
 #include <fstream>
 #include <linux/filter.h>
@@ -235,6 +236,17 @@ TEST_F(LinuxSandbox, TokenIsForWhatWasThereThen) {
         std::ofstream(at("Bundle/Font")) << "other";
         EXPECT_EQ(consumeError(token), ESTALE);
     }
+}
+
+TEST_F(LinuxSandbox, KeptTokenGivesWayToThatOfWhatIsThereNow) {
+    const auto kept = *issue("Bundle/Font");
+    for (int time = 0; time < 3; ++time) EXPECT_EQ(*issue("Bundle/Font"), kept);
+    fs::remove(at("Bundle/Font"));
+    std::ofstream(at("Bundle/Font")) << "other";
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    while (consumeError(*issue("Bundle/Font")) != 0) ASSERT_LT(std::chrono::steady_clock::now(), deadline);
+    fs::remove(at("Bundle/Font"));
+    while (issue("Bundle/Font")) ASSERT_LT(std::chrono::steady_clock::now(), deadline);
 }
 
 TEST_F(LinuxSandbox, TokenLiftsNoFilePermissions) {

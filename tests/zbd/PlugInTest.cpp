@@ -163,7 +163,7 @@ TEST_F(PlugIn, WithoutUUIDEachRecordHasItsOwnAndIsFoundByLocation) {
     EXPECT_EQ(first->infoKey("VBBundleVersion"), Value("1"));
 }
 
-TEST_F(PlugIn, KeptFormAndTokensFollowTheRegistry) {
+TEST_F(PlugIn, KeptFormFollowsTheRegistryAndTokensAreIssuedEachTime) {
     for (const char* category : {"cx", "sandbox"}) processLog.setLevel(category, LogLevel::info);
     auto proxy = code("ext", ".appex");
     fake.sandbox.allowFile(proxy.bundleURL->path());
@@ -179,12 +179,17 @@ TEST_F(PlugIn, KeptFormAndTokensFollowTheRegistry) {
     form().set("identifier", "changed");
     EXPECT_EQ(form(), first) << "each caller has its own";
 
-    fake.sandbox.issueError = 13; // kept tokens are not asked for again, until the registry knows more
+    fake.sandbox.issueError = 13;
+    EXPECT_EQ(form().dictionary("extensions"), Dictionary());
+    EXPECT_FALSE(form().contains("service-extension"));
+    fake.sandbox.issueError = 0;
     EXPECT_EQ(form(), first);
     proxy.infoDictionary = dictionaryChanging(proxy.infoDictionary, "VBBundleVersion", "2");
     fake.registry.install(proxy);
-    EXPECT_EQ(form().dictionary("bundleInfo")->string("VBBundleVersion"), "2");
-    EXPECT_EQ(form().dictionary("extensions"), Dictionary());
+    for (int time = 0; time < 3; ++time) {
+        EXPECT_EQ(form().dictionary("bundleInfo")->string("VBBundleVersion"), "2");
+        EXPECT_EQ(form(), form(false));
+    }
     plugIn->setLocalizedName("Neu");
     EXPECT_EQ(form()["localizedDisplayName"], Value("Neu"));
     for (const char* category : {"cx", "sandbox"}) processLog.setLevel(category, LogLevel::debug);

@@ -12,7 +12,6 @@
 
 namespace {
 
-using platform::MutableDictionary;
 using zbd::SameIdentifierReduction;
 using Facts = SameIdentifierReduction::Facts;
 
@@ -48,10 +47,18 @@ std::vector<std::size_t> plainWalk(const std::vector<Facts>& candidates, std::ui
 std::vector<std::size_t> reduced(const std::vector<Facts>& candidates, std::uint64_t flags) {
     SameIdentifierReduction results(flags);
     for (std::size_t number = 0; number < candidates.size(); ++number) {
-        if (results.admit(candidates[number])) results.add(candidates[number], MutableDictionary{{"number", number}});
+        const Facts& facts = candidates[number];
+        if (!results.admit(facts)) continue;
+        results.add(facts, {{"number", number}});
     }
+    const std::size_t size = results.encodedSize();
     std::vector<std::size_t> numbers;
-    for (const auto& form : results.takeForms()) numbers.push_back(*form.uint64("number"));
+    std::size_t sizeOfForms = 0;
+    for (const auto& form : results.takeForms()) {
+        numbers.push_back(*form.uint64("number"));
+        sizeOfForms += platform::compactSize(form);
+    }
+    EXPECT_EQ(size, sizeOfForms);
     return numbers;
 }
 
