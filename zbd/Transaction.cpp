@@ -24,9 +24,6 @@ namespace {
 
 constexpr std::size_t maximumPath = 1024; // bytes of a resolved path with its NUL; longer ones count as unresolved
 
-/// Registering a path takes some tenths of a millisecond, and handing over to the next slice a hundredth of that.
-constexpr std::size_t pathsPerTurn = 16;
-
 struct RequestType {
     std::string_view name;
     void (Transaction::*handler)();
@@ -69,7 +66,7 @@ std::shared_ptr<platform::Connection> Transaction::connection() const { return _
 bool Transaction::isBrief() const {
     const auto type = _request.string(key::request);
     const RequestType* known = type ? typeNamed(*type) : nullptr;
-    return known == nullptr || known->isBrief;
+    return known != nullptr && known->isBrief;
 }
 
 void Transaction::dispatch() {
@@ -114,13 +111,8 @@ bool Transaction::marshalPaths(const PathCallback& callback) {
         fail(code::malformed, "invalid request format");
         return false;
     }
-    return walkPaths(*paths, 0, paths->size(), callback);
-}
-
-bool Transaction::walkPaths(const Array& paths, std::size_t first, std::size_t end, const PathCallback& callback) {
-    for (std::size_t i = first; i < end; ++i) {
-        if (!_client->acceptWork()) return false; // nobody is left to answer
-        const auto text = paths[i].string();
+    for (const Value& element : *paths) {
+        const auto text = element.string();
         if (!text) {
             fail(code::malformed, "invalid request format");
             return false;
@@ -136,43 +128,16 @@ bool Transaction::walkPaths(const Array& paths, std::size_t first, std::size_t e
     return true;
 }
 
-void Transaction::processPaths(PathCallback callback) {
-    const auto paths = _request.array(key::paths);
-    if (!paths) return fail(code::malformed, "invalid request format");
-    inTurns(
-        paths->size(), pathsPerTurn,
-        [this, paths, callback = std::move(callback)](std::size_t first, std::size_t end) {
-            return walkPaths(*paths, first, end, callback);
-        },
-        [this] { done(); });
-}
-
-void Transaction::inTurns(std::size_t count, std::size_t perTurn, Turn turn, std::function<void()> then) {
-    goOnInTurns(0, count, perTurn, std::move(turn), std::move(then));
-}
-
-void Transaction::goOnInTurns(std::size_t first, std::size_t count, std::size_t perTurn, Turn turn,
-                              std::function<void()> then) {
-    if (!_client->acceptWork()) return; // nobody is left to answer
-    const std::size_t end = std::min(first + perTurn, count);
-    if (!turn(first, end)) return;
-    if (end == count) return then();
-    _client->goOnLater([self = shared_from_this(), end, count, perTurn, turn = std::move(turn),
-                        then = std::move(then)] { self->goOnInTurns(end, count, perTurn, turn, then); });
+bool Transaction::processPaths(const PathCallback& callback) {
+    const bool isComplete = marshalPaths(callback);
+    if (isComplete) done();
+    return isComplete;
 }
 
 /// The path as the client's user may see it; none for what does not exist, and for what that user cannot reach.
 std::optional<std::string> Transaction::realPath(const std::string& path) const {
-    const auto peer = connection();
-    if (!peer) return std::nullopt;
-    const auto resolved = server()->platform().files.realPath(path, maximumPath, peer->peerAuditToken());
+    const auto resolved = server()->platform().files.realPath(path, maximumPath, _client->auditToken());
     return resolved ? std::optional(*resolved) : std::nullopt;
-}
-
-ZBDPlugInRef Transaction::plugInAt(const platform::URL& url) {
-    if (auto plugIn = server()->findPlugInAtPath(url)) return plugIn;
-    const auto path = url.isFile() && url.path().starts_with('/') ? realPath(url.path()) : std::nullopt;
-    return path && *path != url.path() ? server()->findPlugInAtPath(platform::URL::file(*path)) : nullptr;
 }
 
 bool Transaction::processUuidList(const PlugInCallback& callback) {
@@ -222,7 +187,7 @@ ZBDPlugInRef Transaction::plugInOfList(const UuidList& list, std::size_t index) 
         log::traffic().info("Failed to find plugin by %{uuid_t}.16P", *uuid);
         if (const auto path = (*list.paths)[index].string()) {
             log::traffic().info("Looking for plugin %{uuid_t}.16P by path %s", *uuid, *path);
-            plugIn = plugInAt(platform::URL::file(*path));
+            plugIn = server()->findPlugInAtPath(platform::URL::file(*path));
         }
     }
     if (!plugIn) fail(code::malformed, "no such plugin (uuid not found)");

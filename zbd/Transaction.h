@@ -25,7 +25,6 @@ public:
     using PathCallback = std::function<bool(const std::string& path, bool resolved)>;
     /// False stops the walk; the callback has answered.
     using PlugInCallback = std::function<bool(const ZBDPlugInRef& plugIn)>;
-    using Turn = std::function<bool(std::size_t first, std::size_t end)>;
 
     /// `message` holds a dictionary. Prepares the reply.
     static std::shared_ptr<Transaction> initWithRequest(const platform::ReceivedMessage& message,
@@ -38,17 +37,11 @@ public:
     /// dropped, unless its version already refused it.
     void dispatch();
 
-    /// Calls `turn` with one stretch after the other of `count` elements, each in a turn of its own on the service
-    /// queue, so that others are served between; then `then`. A turn that returns false has answered, and ends it; so
-    /// does the client's death. When this returns, the work may have only begun.
-    void inTurns(std::size_t count, std::size_t perTurn, Turn turn, std::function<void()> then);
-
-    // The walks over a request's plug-in list. One that returns false has answered, or has nobody to answer.
+    // The walks over a request's plug-in list. One that returns false has answered.
     bool marshalPaths(const PathCallback& callback);
     bool processUuidList(const PlugInCallback& callback);
-    /// As `marshalPaths`, and then sends the success reply. A long list is walked in slices, between which others are
-    /// served: when this returns, the walk may have only begun.
-    void processPaths(PathCallback callback);
+    /// As `marshalPaths`, and then sends the success reply.
+    bool processPaths(const PathCallback& callback);
 
     /// Sends the reply as it stands. The reply is not touched afterwards.
     void done();
@@ -87,10 +80,7 @@ private:
     void releaseHolds(const platform::Array& tokens);
     bool collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugInRef>& plugIns);
     bool mayRegister(const platform::URL& url) const;
-    ZBDPlugInRef plugInAt(const platform::URL& url);
     std::optional<std::string> realPath(const std::string& path) const;
-    bool walkPaths(const platform::Array& paths, std::size_t first, std::size_t end, const PathCallback& callback);
-    void goOnInTurns(std::size_t first, std::size_t count, std::size_t perTurn, Turn turn, std::function<void()> then);
     /// The lists of a request that names plug-ins by UUID.
     struct UuidList {
         platform::Array uuids;
@@ -99,6 +89,7 @@ private:
     std::optional<UuidList> uuidList();
     ZBDPlugInRef plugInOfList(const UuidList& list, std::size_t index);
     bool annotateInBulk(const platform::Dictionary::Entry& entry);
+    void finishAnnotating();
     void saveChanges();
 
     std::shared_ptr<ZBDQmxClient> _client;

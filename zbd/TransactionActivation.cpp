@@ -1,6 +1,7 @@
 #include "Zembra/ZBLog.h"
 #include "Zembra/ZBSandboxExtension.h"
 #include "platform/Format.h"
+#include "platform/TracePoints.h"
 #include "zbd/Transaction.h"
 #include "zbd/ZBDQmxClient.h"
 #include "zbd/ZBDServer.h"
@@ -26,6 +27,7 @@ void Transaction::readyPlugIns() {
     // Nothing is enabled before everything is allowed.
     ZBDPlugInSet plugIns;
     const bool isAllowed = processUuidList([&](const ZBDPlugInRef& plugIn) {
+        if (platform::trace::pluginReadyEnabled()) platform::trace::pluginReady(plugIn->uuid()->text().c_str());
         if (server()->holdOnPlugIn(plugIn)) {
             log::ops().notice("denied access to %d for plugin %{public}@(%{public}@): the plug-in is on hold",
                               _client->pid(), plugIn->identifier(), plugIn->uuidText());

@@ -3,8 +3,6 @@
 #include "zbd/ZBDQmxClient.h"
 #include "zbd/ZBDServer.h"
 
-#include <span>
-
 namespace zbd {
 
 namespace log = zembra::log;
@@ -17,9 +15,6 @@ using platform::UUID;
 using platform::Value;
 
 namespace {
-
-/// Saving costs as much for one change as for hundreds: the file is written as a whole.
-constexpr std::size_t changesPerTurn = 256;
 
 /// Bytes of one extension as it is stored. Hosts keep settings there, and every answer that names the plug-in carries
 /// them: once for each of the versions that share them.
@@ -56,48 +51,33 @@ void Transaction::annotatePlugIns() {
     }
     if (annotation.empty()) return done();
 
-    const auto list = uuidList();
-    if (!list) return;
-    inTurns(
-        list->uuids.size(), changesPerTurn,
-        [this, list, annotation, election](std::size_t first, std::size_t end) {
-            for (std::size_t i = first; i < end; ++i) {
-                const auto plugIn = plugInOfList(*list, i);
-                if (!plugIn) return false;
-                log::ops().debug("client %d plug-in %{public}@(%{public}@) annotation change: %@", _client->pid(),
-                                 plugIn->identifier(), plugIn->uuidText(), annotation);
-                if (election) {
-                    log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", _client->pid(),
-                                    plugIn->identifier(), plugIn->uuidText(), election);
-                }
-                _changes.push_back({annotation, plugIn});
-            }
-            saveChanges();
-            return true;
-        },
-        [this] {
-            server()->notifyAnnotationChange();
-            done();
-        });
+    const bool isComplete = processUuidList([&](const ZBDPlugInRef& plugIn) {
+        log::ops().debug("client %d plug-in %{public}@(%{public}@) annotation change: %@", _client->pid(),
+                         plugIn->identifier(), plugIn->uuidText(), annotation);
+        if (election) {
+            log::ops().info("client %d plug-in %{public}@(%{public}@) election := %@", _client->pid(),
+                            plugIn->identifier(), plugIn->uuidText(), election);
+        }
+        _changes.push_back({annotation, plugIn});
+        return true;
+    });
+    if (isComplete) finishAnnotating();
 }
 
 void Transaction::bulkAnnotatePlugIns() {
     const auto requested = _request.dictionary(key::annotations);
     if (!requested) return fail(code::malformed, "invalid request format (bad annotations dictionary)");
     log::ops().debug("bulk change requested for %u plug-ins", requested->size());
-    inTurns(
-        requested->size(), changesPerTurn,
-        [this, requested](std::size_t first, std::size_t end) {
-            for (const auto& entry : std::span(requested->begin() + first, requested->begin() + end)) {
-                if (!annotateInBulk(entry)) return false;
-            }
-            saveChanges();
-            return true;
-        },
-        [this] {
-            server()->notifyAnnotationChange();
-            done();
-        });
+    for (const auto& entry : *requested) {
+        if (!annotateInBulk(entry)) return;
+    }
+    finishAnnotating();
+}
+
+void Transaction::finishAnnotating() {
+    saveChanges(); // first, so that those who are told find them
+    server()->notifyAnnotationChange();
+    done();
 }
 
 bool Transaction::annotateInBulk(const Dictionary::Entry& entry) {
@@ -106,13 +86,12 @@ bool Transaction::annotateInBulk(const Dictionary::Entry& entry) {
         return false;
     };
     const auto extension = entry.value.dictionary();
-    if (!extension || !canBeStored(*extension)) {
-        return refuse(code::bulkAnnotation, "annotations values must be dictionaries");
-    }
+    if (!extension) return refuse(code::bulkAnnotation, "annotations values must be dictionaries");
     const auto uuid = UUID::parse(entry.name());
     if (!uuid) return refuse(code::bulkAnnotation, "invalid plug-in UUID value");
     const auto plugIn = server()->findPlugIn(*uuid);
     if (!plugIn) return refuse(code::registrationFailed, "no plug-in with the requested uuid");
+    if (!canBeStored(*extension)) return refuse(code::bulkAnnotation, "the extension cannot be stored");
     // The missing brace is part of the text: those who search logs for it find it so.
     log::ops().debug("client %d bulk plug-in %{public}@(%public}@) annotation change: %@", _client->pid(),
                      plugIn->identifier(), plugIn->uuid(), *extension);
@@ -120,6 +99,7 @@ bool Transaction::annotateInBulk(const Dictionary::Entry& entry) {
     return true;
 }
 
+/// Saving costs as much for one change as for hundreds: the file is written as a whole.
 void Transaction::saveChanges() {
     if (_changes.empty()) return;
     server()->setAnnotations(_changes);

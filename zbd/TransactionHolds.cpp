@@ -15,12 +15,6 @@ using platform::Array;
 using platform::MutableArray;
 using platform::URL;
 
-namespace {
-
-constexpr std::size_t tokensPerTurn = 64; // each posts a notification
-
-} // namespace
-
 void Transaction::lockDownPlugIns() {
     if (const auto tokens = _request.array(key::uuids)) return releaseHolds(*tokens);
 
@@ -65,15 +59,10 @@ void Transaction::lockDownPlugIns() {
 }
 
 void Transaction::releaseHolds(const Array& tokens) {
-    inTurns(
-        tokens.size(), tokensPerTurn,
-        [this, tokens](std::size_t first, std::size_t end) {
-            for (std::size_t i = first; i < end; ++i) {
-                if (const auto token = tokens[i].uuid()) server()->unholdToken(*token);
-            }
-            return true;
-        },
-        [this] { done(); });
+    for (const auto& element : tokens) {
+        if (const auto token = element.uuid()) server()->unholdToken(*token);
+    }
+    done();
 }
 
 bool Transaction::collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugInRef>& plugIns) {

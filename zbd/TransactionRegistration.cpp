@@ -29,8 +29,7 @@ void Transaction::addPlugIns() {
 }
 
 bool Transaction::mayRegister(const URL& url) const {
-    const auto peer = connection();
-    return peer && server()->platform().registry.mayRegister(url, peer->peerAuditToken());
+    return server()->platform().registry.mayRegister(url, _client->auditToken());
 }
 
 void Transaction::removePlugIns() {

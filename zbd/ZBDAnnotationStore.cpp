@@ -73,10 +73,15 @@ void ZBDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotati
 
 void ZBDAnnotationStore::setAnnotations(std::span<const AnnotationChange> changes) {
     const auto before = MutableDictionary::copyOf(_annotations);
-    for (const AnnotationChange& change : changes) apply(change);
+    for (const AnnotationChange& change : changes) {
+        if (const auto failure = apply(change)) {
+            log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, *failure);
+        }
+    }
     const auto bytes = encodedDatabase(_annotations);
     if (!bytes) {
-        _annotations = before;
+        // Each was tried alone, so they are too large together; or the file had in it what no file of ours can hold.
+        if (bytes.error().code == platform::fileWriteOutOfSpaceCode) _annotations = before;
         log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, bytes.error());
         return;
     }
@@ -86,13 +91,20 @@ void ZBDAnnotationStore::setAnnotations(std::span<const AnnotationChange> change
     }
 }
 
-void ZBDAnnotationStore::apply(const AnnotationChange& change) {
+platform::Failure ZBDAnnotationStore::apply(const AnnotationChange& change) {
     const std::string key = change.plugIn->annotationKey();
-    if (!change.annotation) return _annotations.remove(key);
+    if (!change.annotation) {
+        _annotations.remove(key);
+        return std::nullopt;
+    }
+    // As it will stand in the file. Tried alone, so that it is the only one refused.
+    const auto encoded = encodedDatabase(Dictionary{{key, *change.annotation}});
+    if (!encoded) return encoded.error();
     // A new dictionary each time: requests may still be reading the stored one.
     auto merged = MutableDictionary::copyOf(annotationForIdentifier(key).value_or(Dictionary()));
     merged.merge(*change.annotation);
     _annotations.set(key, merged);
+    return std::nullopt;
 }
 
 bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {

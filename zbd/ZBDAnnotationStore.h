@@ -40,12 +40,12 @@ public:
     std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn) const;
 
     /// Merges `annotation` into what is stored for the plug-in, or removes that when it is none; then saves. A failure
-    /// to save is logged; the change stays in memory and goes out with the next one. What no file can hold (a UUID,
-    /// control characters, nesting without end, more than `maximumFileSize` in all) is logged and not taken, for no
-    /// change could be saved after it.
+    /// to save is logged; the change stays in memory and goes out with the next one. What no file can hold (an
+    /// annotation or key with a UUID, control characters, nesting without end) is logged and not taken, for no change
+    /// could be saved after it.
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
-    /// The same for many, in their order, saved together: all are taken or none. (Trying them one by one would encode
-    /// a full table for each.)
+    /// The same for many, in their order, saved together. When the file would become larger than `maximumFileSize`,
+    /// that is logged and none is taken. (Trying them one by one would encode a full table for each.)
     void setAnnotations(std::span<const AnnotationChange> changes);
 
     /// False, with `error` set, when no table could be loaded; the present table then is as it was.
@@ -62,7 +62,7 @@ public:
     static std::optional<platform::URL> containerURL(platform::Platform& platform);
 
 private:
-    void apply(const AnnotationChange& change);
+    platform::Failure apply(const AnnotationChange& change);
     bool write(const std::string& bytes, platform::Error& error);
     ZBDAnnotationStore(platform::Platform& platform, platform::URL url);
 

@@ -31,7 +31,8 @@ std::set<std::string> ZBDPlugIn::allowedPVCServices() const {
     const auto container = containingUrl();
     if (!container) return services;
     const auto bundle = _platform.bundles.fromPath(container->path(), platform::BundleMode::directory);
-    if (!bundle) {
+    // A path without a directory gives a bundle without anything in it.
+    if (!bundle || !bundle->property(platform::BundleProperty::supportPath)) {
         log::ops().info("failed to create bundle for %@", path());
         return services;
     }

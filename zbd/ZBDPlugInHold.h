@@ -23,6 +23,8 @@ public:
     const platform::UUID& uuid() const { return _uuid; }
     const ZBDPlugInSet& blocked() const { return _blocked; }
     std::shared_ptr<ZBDQmxClient> client() const { return _client.lock(); }
+    /// Tells clients apart also when they are gone.
+    const std::weak_ptr<ZBDQmxClient>& clientReference() const { return _client; }
     std::chrono::system_clock::time_point created() const { return _created; }
 
     friend bool operator==(const ZBDPlugInHold& left, const ZBDPlugInHold& right) { return left._uuid == right._uuid; }

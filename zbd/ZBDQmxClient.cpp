@@ -25,13 +25,13 @@ constexpr std::uint32_t requestCountInterval = 1000;
 } // namespace
 
 ZBDQmxClient::ZBDQmxClient(const std::shared_ptr<Connection>& connection, std::shared_ptr<ZBDServer> server)
-    : _connection(connection), _server(std::move(server)) {}
+    : _connection(connection), _server(std::move(server)), _auditToken(connection->peerAuditToken()) {}
 
 std::shared_ptr<ZBDQmxClient> ZBDQmxClient::initWithConnection(const std::shared_ptr<Connection>& connection,
                                                                const std::shared_ptr<ZBDServer>& server) {
     std::shared_ptr<ZBDQmxClient> self(new ZBDQmxClient(connection, server));
     platform::Platform& platform = server->platform();
-    const platform::AuditToken token = connection->peerAuditToken();
+    const platform::AuditToken& token = self->_auditToken;
 
     // By the token, not the pid: the pid may be another process's by now.
     if (auto path = platform.processes.executablePath(token, pathBufferSize)) {
@@ -78,30 +78,13 @@ void ZBDQmxClient::handleRequest(const ReceivedMessage& message) {
         if (++self->_requestCount % requestCountInterval == 0) {
             log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
         }
-        self->serve(transaction);
+        transaction->dispatch();
     };
     if (isBrief) {
         _server->submitBriefWork(std::move(work));
     } else {
         _server->submitWork(std::move(work));
     }
-}
-
-void ZBDQmxClient::serve(const std::shared_ptr<Transaction>& transaction) {
-    if (_goesOn) return _behind.push_back(transaction);
-    transaction->dispatch();
-}
-
-void ZBDQmxClient::goOnLater(std::function<void()> rest) {
-    _goesOn = true;
-    _server->submitWork([self = shared_from_this(), rest = std::move(rest)] {
-        self->_goesOn = false;
-        rest();
-        if (self->_goesOn || self->_behind.empty()) return;
-        // Each in a turn of its own: there may be many.
-        self->goOnLater([next = std::move(self->_behind.front())] { next->dispatch(); });
-        self->_behind.pop_front();
-    });
 }
 
 void ZBDQmxClient::dying() { log::ops().debug("client %d termination imminent", pid()); }

@@ -6,15 +6,12 @@
 
 #include <atomic>
 #include <cstdint>
-#include <deque>
-#include <functional>
 #include <memory>
 #include <string>
 #include <string_view>
 
 namespace zbd {
 
-class Transaction;
 class ZBDServer;
 
 /// One connected host: who it is, and what it asks. Kept alive by its connection, which it holds only weakly.
@@ -37,16 +34,14 @@ public:
     /// The connection is invalid: the holds end, and requests that still wait are dropped.
     void dead();
 
-    /// Runs `rest`, what remains of a request, in a later turn of the service queue: other clients are served between,
-    /// and this client's own later requests after it. On the service queue.
-    void goOnLater(std::function<void()> rest);
-
     std::string description() const;
 
     bool acceptWork() const { return _acceptWork.load(std::memory_order_relaxed); }
     std::uint32_t requestCount() const { return _requestCount; }
     std::shared_ptr<platform::Connection> connection() const { return _connection.lock(); }
     const std::shared_ptr<ZBDServer>& server() const { return _server; }
+    /// The peer as it connected; good also when the connection is gone.
+    const platform::AuditToken& auditToken() const { return _auditToken; }
     /// The executable's path; empty when it could not be learnt.
     const std::string& path() const { return _path; }
     /// None when the executable's path could not be learnt.
@@ -56,14 +51,12 @@ private:
     ZBDQmxClient(const std::shared_ptr<platform::Connection>& connection, std::shared_ptr<ZBDServer> server);
     void handleEvent(const platform::ConnectionEvent& event);
     void handleRequest(const platform::ReceivedMessage& message);
-    void serve(const std::shared_ptr<Transaction>& transaction);
 
-    std::atomic<bool> _acceptWork{true};              // written on the delivery thread, read on the service queue
-    std::uint32_t _requestCount = 0;                  // on the service queue only
-    bool _goesOn = false;                             // on the service queue only
-    std::deque<std::shared_ptr<Transaction>> _behind; // what waits meanwhile; on the service queue only
+    std::atomic<bool> _acceptWork{true}; // written on the delivery thread, read on the service queue
+    std::uint32_t _requestCount = 0;     // on the service queue only
     std::weak_ptr<platform::Connection> _connection;
     std::shared_ptr<ZBDServer> _server;
+    platform::AuditToken _auditToken;
     std::string _path;
     std::shared_ptr<zembra::ZBBundle> _bundle;
     std::shared_ptr<platform::SecTask> _task;

@@ -73,7 +73,6 @@ void ZBDServer::submitBriefWork(platform::WorkQueue::Item item) { _mainQueue->as
 void ZBDServer::stop() {
     _service->cancel();
     releaseAllHolds();
-    notifyAnnotationChange();
 }
 
 void ZBDServer::removedPlugIns(const std::vector<platform::PlugInProxyRef>& proxies) {

@@ -7,6 +7,7 @@
 
 #include <functional>
 #include <list>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -51,10 +52,10 @@ public:
 
     /// The holds in force, in the order they were added.
     Holds holds() const;
+    bool hasHolds() const;
     bool holdOnPlugIn(const ZBDPlugInRef& plugIn);
     void addHold(const std::shared_ptr<ZBDPlugInHold>& hold);
     void unholdToken(const platform::UUID& token);
-    /// Some of the client's holds end before this returns, the others soon after.
     void unholdClient(const std::shared_ptr<ZBDQmxClient>& client);
     /// Asks the service manager to end the running instances of each plug-in. `reply` runs once, on a queue of its own,
     /// after it has answered for all of them; no thread waits meanwhile.
@@ -71,8 +72,7 @@ public:
 private:
     explicit ZBDServer(platform::Platform& platform);
     void handleListenerEvent(const platform::Listener::Event& event);
-    Holds::iterator removeHold(Holds::iterator hold);
-    void unholdSlice(const std::shared_ptr<ZBDQmxClient>& client);
+    void removeHold(const platform::UUID& token);
     void releaseAllHolds();
 
     // Set during construction and only read afterwards.
@@ -84,8 +84,13 @@ private:
     std::shared_ptr<platform::WorkQueue> _syncQueue;
 
     // On _syncQueue only.
-    Holds _holds; // in the order they were added
-    std::unordered_map<platform::UUID, Holds::iterator> _holdsByToken;
+    struct Place {
+        Holds::iterator amongAll;
+        Holds::iterator amongItsClients;
+    };
+    Holds _holds;                                                                   // in the order they were added
+    std::map<std::weak_ptr<ZBDQmxClient>, Holds, std::owner_less<>> _holdsByClient; // in that order too, none empty
+    std::unordered_map<platform::UUID, Place> _holdsByToken;
     std::unordered_map<ZBDPlugInRef, std::size_t, zembra::ZBPlugInHash, zembra::ZBPlugInEqual> _holdCounts;
 };
 

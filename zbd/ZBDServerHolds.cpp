@@ -3,8 +3,6 @@
 #include "zbd/ZBDQmxClient.h"
 #include "zbd/ZBDServer.h"
 
-#include <algorithm>
-
 namespace zbd {
 
 namespace log = zembra::log;
@@ -15,59 +13,56 @@ ZBDServer::Holds ZBDServer::holds() const {
     return _syncQueue->sync([&] { return _holds; });
 }
 
+bool ZBDServer::hasHolds() const {
+    return _syncQueue->sync([&] { return !_holds.empty(); });
+}
+
 bool ZBDServer::holdOnPlugIn(const ZBDPlugInRef& plugIn) {
     return _syncQueue->sync([&] { return _holdCounts.contains(plugIn); });
 }
 
 void ZBDServer::addHold(const std::shared_ptr<ZBDPlugInHold>& hold) {
     _syncQueue->sync([&] {
-        _holdsByToken.emplace(hold->uuid(), _holds.insert(_holds.end(), hold));
+        Holds& ofClient = _holdsByClient[hold->clientReference()];
+        _holdsByToken.emplace(hold->uuid(),
+                              Place{_holds.insert(_holds.end(), hold), ofClient.insert(ofClient.end(), hold)});
         for (const ZBDPlugInRef& plugIn : hold->blocked()) ++_holdCounts[plugIn];
     });
     notifyAnnotationChange();
 }
 
-ZBDServer::Holds::iterator ZBDServer::removeHold(Holds::iterator hold) {
-    for (const ZBDPlugInRef& plugIn : (*hold)->blocked()) {
+void ZBDServer::removeHold(const UUID& token) {
+    const Place place = _holdsByToken.extract(token).mapped();
+    const auto hold = *place.amongAll;
+    for (const ZBDPlugInRef& plugIn : hold->blocked()) {
         const auto count = _holdCounts.find(plugIn);
         if (--count->second == 0) _holdCounts.erase(count);
     }
-    _holdsByToken.erase((*hold)->uuid());
-    const auto next = _holds.erase(hold);
+    const auto ofClient = _holdsByClient.find(hold->clientReference());
+    ofClient->second.erase(place.amongItsClients);
+    if (ofClient->second.empty()) _holdsByClient.erase(ofClient);
+    _holds.erase(place.amongAll);
     notifyAnnotationChange();
-    return next;
 }
 
 void ZBDServer::unholdToken(const UUID& token) {
     _syncQueue->sync([&] {
-        const auto found = _holdsByToken.find(token);
-        if (found == _holdsByToken.end()) return;
+        if (!_holdsByToken.contains(token)) return;
         log::ops().debug("releasing plug-in hold %{public}@ at client's request", token);
-        removeHold(found->second);
+        removeHold(token);
     });
 }
 
 void ZBDServer::unholdClient(const std::shared_ptr<ZBDQmxClient>& client) {
-    _syncQueue->sync([&] { unholdSlice(client); });
-}
-
-void ZBDServer::unholdSlice(const std::shared_ptr<ZBDQmxClient>& client) {
-    // Ten thousand holds end in slices, between which others get to the queue. The rest does not keep the caller: that
-    // is the transport's thread, which reads every client's requests.
-    constexpr std::size_t slice = 64;
-    std::size_t released = 0;
-    for (auto hold = _holds.begin(); hold != _holds.end() && released < slice;) {
-        if ((*hold)->client() != client) {
-            ++hold;
-            continue;
+    _syncQueue->sync([&] {
+        const auto found = _holdsByClient.find(client);
+        if (found == _holdsByClient.end()) return;
+        const std::int32_t pid = client->pid();
+        for (const auto& hold : Holds(found->second)) { // a copy: the list goes with its last hold
+            log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(), pid);
+            removeHold(hold->uuid());
         }
-        log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", (*hold)->uuid(), client->pid());
-        hold = removeHold(hold);
-        ++released;
-    }
-    if (released < slice) return;
-    _syncQueue->async(
-        [self = std::static_pointer_cast<ZBDServer>(shared_from_this()), client] { self->unholdSlice(client); });
+    });
 }
 
 void ZBDServer::releaseAllHolds() {
@@ -76,8 +71,10 @@ void ZBDServer::releaseAllHolds() {
             log::ops().debug("releasing plug-in hold %{public}@ because server is stopping", hold->uuid());
         }
         _holds.clear();
+        _holdsByClient.clear();
         _holdsByToken.clear();
         _holdCounts.clear();
+        notifyAnnotationChange();
     });
 }
 

@@ -158,6 +158,12 @@ TEST_F(AnnotationStore, WhatNoFileCanHoldIsNotTaken) {
         store->setAnnotation(Dictionary{{"extension", Dictionary{{"k", bad}}}}, *plugIn("a"));
         EXPECT_TRUE(logged(LogLevel::error, unsaved));
         EXPECT_EQ(store->annotationForIdentifier("com.example.a"), elected);
+        if (bad == large) continue;
+        const std::vector<zbd::AnnotationChange> together{
+            {Dictionary{{"extension", Dictionary{{"k", bad}}}}, plugIn("bad")}, {elected, plugIn("good")}};
+        store->setAnnotations(together);
+        EXPECT_EQ(stored()["com.example.good"], Value(elected));
+        store->setAnnotation(std::nullopt, *plugIn("good"));
     }
     // Nor what is too much together.
     const Dictionary half{{"extension", Dictionary{{"k", std::string(ZBDAnnotationStore::maximumFileSize / 2, 'x')}}}};

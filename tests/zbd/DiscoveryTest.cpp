@@ -221,6 +221,18 @@ TEST_F(Discovery, APlugInThatCannotBeExportedWholeIsAnsweredWithAnError) {
                        "failed to export matching plug-in " + uuid(1).text() + ": the plug-in has no \"bundleInfo\""));
 }
 
+TEST_F(Discovery, AnAnswerThatNoMessageHoldsIsAnError) {
+    const Value filler = std::string(std::size_t{8} << 20U, 'x'); // twice in each form
+    for (int number = 1; number <= 5; ++number) {
+        auto plugIn = described(number, "p" + std::to_string(number));
+        plugIn.info = support::manifestOf(
+            "com.example.p" + std::to_string(number),
+            {{"VKExtensionProtocol", "#Data"}, {"VKExtensionAttributes", Dictionary()}, {"Filler", filler}});
+        install(plugIn);
+    }
+    EXPECT_EQ(daemon.ask("match", {}), errorReply(4, "the matching plug-ins are too many for one reply"));
+}
+
 TEST_F(Discovery, AnnotationRequestsCheckBeforeTheyChange) {
     install(described(1, "p"));
     const auto posts = [&] { return daemon.fake.notifications.posts().size(); };
@@ -247,6 +259,9 @@ TEST_F(Discovery, AnnotationRequestsCheckBeforeTheyChange) {
         {"bulk-annotate", {}, errorReply(4, bad), 0},
         {"bulk-annotate", Dictionary(), Dictionary(), 1},
         {"bulk-annotate", Dictionary{{known, 1}}, errorReply(18, "annotations values must be dictionaries"), 0},
+        {"bulk-annotate", Dictionary{{known, Dictionary{{"id", uuid(1)}}}},
+         errorReply(18, "the extension cannot be stored"), 0},
+        {"annotate", Dictionary{{"extension", Dictionary{{"b", 1}}}, {"other", 1}}, Dictionary(), 1},
         {"bulk-annotate", Dictionary{{known, Dictionary{{"a", 1}}}, {"x", Dictionary()}},
          errorReply(18, "invalid plug-in UUID value"), 0},
         {"bulk-annotate", Dictionary{{uuid(9).text(), Dictionary()}},

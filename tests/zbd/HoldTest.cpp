@@ -138,21 +138,22 @@ TEST_F(Hold, ADeathReleasesThatClientsHoldsAlone) {
             daemon.ask(client, {{"request", "lock"}, {"version", 3}, {"paths", Array{plugIns[0].path}}, {"flags", 1}});
         return *reply->uuid("uuids");
     };
-    // More than are released in one turn, and a multiple of that.
-    for (const std::size_t count : {std::size_t{130}, std::size_t{128}}) {
-        const auto client = daemon.connect();
-        for (std::size_t i = 0; i < count / 2; ++i) hold(client);
-        const auto kept = hold(other);
-        for (std::size_t i = 0; i < count - count / 2; ++i) hold(client);
-        const auto before = posts();
-        client->cancel();
-        daemon.fake.transport.deliver();
-        EXPECT_EQ(posts(), before + count);
-        ASSERT_EQ(daemon.server->holds().size(), 1U);
-        EXPECT_EQ(daemon.server->holds().front()->uuid(), kept);
-        daemon.server->unholdToken(kept);
-        EXPECT_FALSE(isHeld(0));
-    }
+    const auto client = daemon.connect();
+    hold(client);
+    const auto kept = hold(other);
+    for (int i = 0; i < 129; ++i) hold(client);
+    const auto before = posts();
+    client->cancel();
+    daemon.fake.transport.deliver();
+    EXPECT_EQ(posts(), before + 130);
+    const auto lines = processLog.messages("ops");
+    EXPECT_EQ(std::count_if(lines.begin(), lines.end(),
+                            [](const auto& line) { return line.ends_with(" for dead client pid 77"); }),
+              130);
+    ASSERT_EQ(daemon.server->holds().size(), 1U);
+    EXPECT_EQ(daemon.server->holds().front()->uuid(), kept);
+    daemon.server->unholdToken(kept);
+    EXPECT_FALSE(isHeld(0));
 }
 
 } // namespace

@@ -123,6 +123,14 @@ TEST_F(Match, KeysAndPatterns) {
     for (const Case& c : cases) {
         EXPECT_EQ(plugIn->matchKey(c.key, c.pattern), c.matches) << c.key << " against " << c.pattern.description();
     }
+    // Outside applications no pattern fits the containing one, not even that there is none.
+    auto loose = support::dataPlugIn("loose");
+    loose.path = "/System/loose.plugin";
+    const auto outside = daemon.server->findPlugIn(*daemon.fake.registry.install(loose)->uuid);
+    ASSERT_TRUE(outside);
+    for (const Value& pattern : {Value(false), Value(true), Value("x"), Value("<>x")}) {
+        EXPECT_FALSE(outside->matchKey("VKExtensionContainingApp", pattern)) << pattern.description();
+    }
 }
 
 TEST_F(Match, EveryRuleHasToHoldAndTheFirstThatDoesNotIsTold) {
@@ -138,8 +146,11 @@ TEST_F(Match, EveryRuleHasToHoldAndTheFirstThatDoesNotIsTold) {
 }
 
 TEST_F(Match, ElectionsShowWithoutTheirSecondByte) {
-    for (const auto& [election, shown] :
-         {std::pair<std::int64_t, const char*>{1, "1"}, {257, "1"}, {0xFF02, "2"}, {0x10000, "65536"}}) {
+    for (const auto& [election, shown] : {std::pair<std::int64_t, const char*>{1, "1"},
+                                          {257, "1"},
+                                          {0xFF02, "2"},
+                                          {0x10000, "65536"},
+                                          {-1, "-65281"}}) {
         daemon.server->setAnnotation(Dictionary{{"election", election}}, *plugIn);
         EXPECT_TRUE(plugIn->matchKey("VKUserElection", shown)) << election;
     }

@@ -230,7 +230,7 @@ TEST_F(Client, DeathReleasesItsHoldsAndDropsWaitingRequests) {
 
     fake.queues.setMode(support::FakeWorkQueues::Mode::manual);
     bool isAnswered = false;
-    for (const char* type : {"bulk", "unknown"}) {
+    for (const char* type : {"bulk", "match"}) {
         host->sendWithReply(
             Dictionary{{"request", type}, {"version", 3}}, fake.queues.makeSerial("replies"),
             [&](const ReplyOrError& reply) { isAnswered |= std::holds_alternative<Dictionary>(reply); });

@@ -48,7 +48,9 @@ std::optional<std::string> absolutePath(const std::string& path) {
         complain(path + ": " + error.message());
         return std::nullopt;
     }
-    return absolute.string();
+    // The daemon knows bundles by their real paths; what is gone by now may still be known by the one that it had.
+    const auto real = std::filesystem::canonical(absolute, error);
+    return (error ? absolute : real).string();
 }
 
 std::optional<std::vector<std::string>> absolutePaths(const std::vector<std::string>& paths) {
