@@ -28,7 +28,7 @@ enum class SelectionTask {
     selectAgain,  // one question again and again
     evaluate,     // the same questions in turn, asked of every record
     everything,   // no rules
-    gather,       // the records that are known put into a set, which is what the answer without rules is
+    gather,       // the records that are known put into a set, which is a plain way to the answer without rules
 };
 
 /// Installed plug-ins of twenty extension points. Each question asks for one point, a version from 2 on and one value

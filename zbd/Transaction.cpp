@@ -17,7 +17,6 @@ namespace log = zembra::log;
 namespace key = zembra::key;
 namespace code = zembra::code;
 namespace requestType = zembra::requestType;
-using platform::Array;
 using platform::Value;
 
 namespace {

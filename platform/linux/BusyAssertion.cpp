@@ -54,15 +54,16 @@ Failure BusyAssertion::hold(const Root& root, const std::string& bundleIdentifie
     if (!file) {
         const auto directory = openUserDirectory(users, ::geteuid(), {}, MissingDirectory::made);
         if (!directory) return directory.error();
-        file = std::make_shared<Descriptor>(::openat(directory->get(), bundleIdentifier.c_str(),
-                                                     O_RDWR | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC,
-                                                     0600));
+        file = std::make_shared<Descriptor>(
+            ::openat(directory->get(), bundleIdentifier.c_str(),
+                     O_RDONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, 0600));
         if (!*file) return systemError(errno, path);
         known = file;
     }
+    // A lock for reading: confined plug-ins may not write to the file, which lies in memory that is not theirs to fill.
     // Also when the file was open: after a fork it may be, and only the parent has a lock.
     struct flock lock{};
-    lock.l_type = F_WRLCK;
+    lock.l_type = F_RDLCK;
     lock.l_whence = SEEK_SET;
     lock.l_start = randomByte();
     lock.l_len = 1;

@@ -2,14 +2,20 @@
 
 #include "platform/SystemLog.h"
 #include "platform/linux/DirectoryFiles.h"
+#include "platform/linux/ProcPath.h"
 #include "platform/linux/SystemError.h"
 #include "platform/linux/UserDirectory.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <charconv>
 #include <fcntl.h>
 #include <linux/openat2.h>
+#include <optional>
+#include <string_view>
+#include <sys/inotify.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -33,16 +39,17 @@ Descriptor openOfUser(int directory, const std::string& name, int flags) {
     return Descriptor(static_cast<int>(::syscall(SYS_openat2, directory, name.c_str(), &how, sizeof how)));
 }
 
-/// The private directory of the user of that id; not open when there is none.
-Descriptor openPrivateDirectory(int users, uid_t user) {
-    Descriptor directory = openOfUser(users, std::to_string(user), O_DIRECTORY);
+/// The file of that name in the user's private directory. Not open, with errno set, on failure.
+Descriptor openBusyFile(int users, uid_t user, const std::string& identifier) {
+    const std::string own = std::to_string(user);
+    // Most users have no such file, and then their directory need not be opened.
+    if (!openOfUser(users, own + '/' + identifier, 0) && errno == ENOENT) return {};
+    const Descriptor directory = openOfUser(users, own, O_DIRECTORY);
     struct stat status{};
-    int number = !directory || ::fstat(directory.get(), &status) != 0 ? errno : 0;
-    if (number == ENOENT) return {};
-    if (number == 0 && status.st_uid != user) number = EPERM;
-    if (number == 0 && (status.st_mode & 077) != 0) number = EACCES;
-    if (number == 0) return directory;
-    log().error("busy instances of user %u not told: %@", user, systemError(number, "directory"));
+    if (!directory || ::fstat(directory.get(), &status) != 0) return {};
+    const bool isOwners = status.st_uid == user;
+    if (isOwners && (status.st_mode & 077) == 0) return openOfUser(directory.get(), identifier, 0);
+    errno = isOwners ? EACCES : EPERM;
     return {};
 }
 
@@ -69,19 +76,26 @@ std::set<pid_t> lockHolders(int file) {
     return holders;
 }
 
-/// The users whose instances count.
-std::vector<uid_t> usersIn(int directory) {
-    if (::geteuid() != 0) return {::geteuid()};
-    std::vector<uid_t> users;
-    const auto listing = listDirectory(directory);
-    if (!listing) return users;
-    for (const std::string& name : listing->directories) {
-        uid_t user = 0;
-        const auto [end, error] = std::from_chars(name.data(), name.data() + name.size(), user);
-        if (error == std::errc() && end == name.data() + name.size()) users.push_back(user);
-    }
-    return users;
+/// Whose directory has this name. None for others, "01" among them.
+std::optional<uid_t> userNamed(const std::string& name) {
+    uid_t user = 0;
+    std::from_chars(name.data(), name.data() + name.size(), user);
+    return std::to_string(user) == name ? std::optional(user) : std::nullopt;
 }
+
+/// Users that cannot be looked at. Told in one line, for one user can have any number of files and, with subordinate
+/// ids, of directories.
+struct Untold {
+    std::size_t count = 0;
+    uid_t user = 0; // the first one
+    std::optional<Error> error;
+
+    void add(uid_t whose, Error&& why) {
+        if (count++ != 0) return;
+        user = whose;
+        error = std::move(why);
+    }
+};
 
 } // namespace
 
@@ -92,22 +106,71 @@ ProcessAssertions::ProcessAssertions(const Root& root) : _directory(busyDirector
     static_cast<void>(openUsersDirectory(_directory, ::geteuid(), MissingDirectory::made));
 }
 
-/// Opening every user's directory for each plug-in of a long request would let one user, who can make any number of
-/// directories, stop the daemon. So they stay open until the directory around them changes.
+/// Anybody can make directories there in any number, so each costs one look when it comes and none with the questions
+/// that follow.
 void ProcessAssertions::readUsers(int directory) {
-    struct stat status{};
-    timespec now{};
-    clock_gettime(CLOCK_REALTIME, &now);
-    const bool isKnown = ::fstat(directory, &status) == 0 && status.st_ino == _inode &&
-                         status.st_mtim.tv_sec == _changed.tv_sec && status.st_mtim.tv_nsec == _changed.tv_nsec;
-    // Within the clock's grain another change may follow that does not show.
-    if (isKnown && now.tv_sec > _changed.tv_sec + 1) return;
-    _users.clear();
-    for (const uid_t user : usersIn(directory)) {
-        if (auto own = openPrivateDirectory(directory, user)) _users.emplace_back(user, std::move(own));
+    if (::geteuid() != 0) {
+        _users = {::geteuid()};
+        return;
     }
-    _inode = status.st_ino;
-    _changed = status.st_mtim;
+    if (readChanges(directory)) return;
+    _users.clear();
+    const auto listing = listDirectory(directory);
+    if (!listing) {
+        log().error("busy instances not told: %@", systemError(errno, _directory));
+        _changes.reset(); // next time from the beginning
+        return;
+    }
+    const auto others =
+        std::ranges::count_if(listing->directories, [&](const std::string& name) { return !note(directory, name); });
+    if (others == 0 || std::exchange(_toldOfOthers, true)) return;
+    log().error("%d directories of busy instances belong to others than their names say", others);
+}
+
+bool ProcessAssertions::readChanges(int directory) {
+    struct stat status{};
+    if (::fstat(directory, &status) != 0) return false;
+    if (!_changes || status.st_dev != _device || status.st_ino != _inode) {
+        _device = status.st_dev;
+        _inode = status.st_ino;
+        _changes = Descriptor(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+        // Changes of owners and modes, which cost their maker less than they cost here, are not asked for.
+        constexpr auto events = static_cast<std::uint32_t>(IN_CREATE | IN_MOVED_TO | IN_ONLYDIR);
+        if (::inotify_add_watch(_changes.get(), procPath(directory).c_str(), events) < 0) _changes.reset();
+        return false;
+    }
+    // What comes while this reads is for the next question.
+    int pending = 0;
+    if (::ioctl(_changes.get(), FIONREAD, &pending) != 0) pending = 0;
+    bool isComplete = true;
+    alignas(inotify_event) std::array<char, 16384> buffer; // NOLINT(cppcoreguidelines-pro-type-member-init)
+    while (pending > 0) {
+        const ssize_t size = ::read(_changes.get(), buffer.data(), buffer.size());
+        if (size < 0 && errno == EINTR) continue;
+        if (size <= 0) return false;
+        pending -= static_cast<int>(size);
+        for (std::size_t at = 0; at < static_cast<std::size_t>(size);) {
+            const auto* event = reinterpret_cast<const inotify_event*>(buffer.data() + at); // NOLINT
+            at += sizeof(inotify_event) + event->len;
+            // Too many to tell of, or the directory is gone and another one has its number.
+            if ((event->mask & (IN_Q_OVERFLOW | IN_IGNORED)) != 0) isComplete = false;
+            if ((event->mask & IN_IGNORED) != 0) _inode = 0;
+            if (event->len != 0 && (event->mask & IN_ISDIR) != 0) note(directory, event->name);
+        }
+    }
+    return isComplete;
+}
+
+bool ProcessAssertions::note(int directory, const std::string& name) {
+    const auto user = userNamed(name);
+    struct statx status{};
+    // Never waits for a file system that the user mounted there.
+    constexpr int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_STATX_DONT_SYNC;
+    if (!user || ::statx(directory, name.c_str(), flags, STATX_UID, &status) != 0) return true;
+    // What the superuser made may be given to the user yet.
+    if (status.stx_uid != *user && status.stx_uid != 0) return false;
+    _users.insert(*user);
+    return true;
 }
 
 std::vector<Dictionary> ProcessAssertions::busyExtensionInstances(const std::set<std::string>& bundleIdentifiers) {
@@ -119,13 +182,13 @@ std::vector<Dictionary> ProcessAssertions::busyExtensionInstances(const std::set
     const std::lock_guard lock(_lock);
     readUsers(directory->get());
     std::vector<Dictionary> instances;
+    Untold untold;
     for (const auto& identifier : bundleIdentifiers) {
         if (pathComponentError(identifier) != 0) continue;
-        for (const auto& [user, own] : _users) {
-            const Descriptor file = openOfUser(own.get(), identifier, 0);
+        for (const uid_t user : _users) {
+            const Descriptor file = openBusyFile(directory->get(), user, identifier);
             if (!file) {
-                if (errno != ENOENT)
-                    log().error("busy instances of user %u not told: %@", user, systemError(errno, identifier));
+                if (errno != ENOENT) untold.add(user, systemError(errno, identifier));
                 continue;
             }
             for (const pid_t process : lockHolders(file.get())) {
@@ -136,6 +199,9 @@ std::vector<Dictionary> ProcessAssertions::busyExtensionInstances(const std::set
             }
         }
     }
+    if (untold.error)
+        log().error("busy instances of user %u not told: %@ (and %d more)", untold.user, *untold.error,
+                    untold.count - 1);
     return instances;
 }
 

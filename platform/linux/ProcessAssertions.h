@@ -4,10 +4,10 @@
 #include "platform/linux/Descriptor.h"
 #include "platform/linux/Root.h"
 
-#include <ctime>
 #include <mutex>
+#include <set>
+#include <string>
 #include <sys/types.h>
-#include <utility>
 #include <vector>
 
 namespace platform::linux_ {
@@ -30,17 +30,24 @@ public:
     explicit ProcessAssertions(const Root& root);
 
     /// In the order of the identifiers. One that cannot be a file name has no busy instances. What cannot be looked at
-    /// is logged and counts as not busy.
+    /// is logged, in one line, and counts as not busy.
     std::vector<Dictionary> busyExtensionInstances(const std::set<std::string>& bundleIdentifiers) override;
 
 private:
+    /// Brings `_users` up to date.
     void readUsers(int directory);
+    /// False when what is in the directory must be listed.
+    bool readChanges(int directory);
+    /// False for a directory that stands in the name of somebody who does not own it.
+    bool note(int directory, const std::string& name);
 
     const std::string _directory;
-    std::mutex _lock;                                 // guards what follows
-    std::vector<std::pair<uid_t, Descriptor>> _users; // whose instances count, and their directories
-    ino_t _inode = 0;                                 // of the directory around them, with its time of change
-    timespec _changed{};
+    std::mutex _lock;       // guards what follows
+    std::set<uid_t> _users; // who may have instances
+    Descriptor _changes;    // of the directory around theirs, as the kernel tells them
+    dev_t _device = 0;      // that directory's
+    ino_t _inode = 0;
+    bool _toldOfOthers = false;
 };
 
 } // namespace platform::linux_

@@ -27,36 +27,47 @@ constexpr RequestSocketAddress address{"com.nordane.sandbox", SOCK_SEQPACKET};
 /// A token, NUL, and the longest path.
 constexpr std::size_t maximumRequestSize = maximumTokenSize + 1 + PATH_MAX;
 
-/// A directory descriptor that leads nowhere but below the directory: a detached, read-only copy of its mount. A plain
-/// one would lead a process in another mount namespace through ".." to everything; it is only good for a peer that
-/// sees the tree anyway, where the daemon may not copy mounts.
-int confineDirectory(int connection, Descriptor& directory) {
-    Descriptor copy(open_tree(directory.get(), "", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC | AT_EMPTY_PATH));
-    if (copy) {
-        mount_attr attributes{};
-        attributes.attr_set = MOUNT_ATTR_RDONLY | MOUNT_ATTR_NOSUID | MOUNT_ATTR_NODEV;
-        if (mount_setattr(copy.get(), "", AT_EMPTY_PATH, &attributes, sizeof attributes) != 0) return errno;
-        directory = std::move(copy);
-        return 0;
-    }
-    ucred peer{};
-    socklen_t size = sizeof peer;
-    if (getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return errno;
-    return seesCommonFileTree(peer.pid) ? 0 : EPERM;
+/// What the descriptor names, in a detached, read-only copy of its mount. A plain descriptor of a directory would lead
+/// a process in another mount namespace through ".." to everything, and one of a file can be opened once more to write.
+/// Not open where the daemon may not copy mounts.
+Descriptor readOnlyCopy(const Descriptor& reference) {
+    Descriptor copy(open_tree(reference.get(), "", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC | AT_EMPTY_PATH));
+    mount_attr attributes{};
+    attributes.attr_set = MOUNT_ATTR_RDONLY | MOUNT_ATTR_NOSUID | MOUNT_ATTR_NODEV;
+    if (copy && mount_setattr(copy.get(), "", AT_EMPTY_PATH, &attributes, sizeof attributes) != 0) copy.reset();
+    return copy;
 }
 
-/// Opens a regular file of an open directory, for reading.
-int openFileBelow(const Descriptor& directory, const std::string& path, Descriptor& opened) {
+/// For a peer that sees the tree of files anyway, a plain descriptor gives nothing more.
+bool seesCommonFileTreeAt(int connection) {
+    ucred peer{};
+    socklen_t size = sizeof peer;
+    return getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) == 0 && seesCommonFileTree(peer.pid);
+}
+
+/// Refers to what the grant is for, or to a regular file below. With the rights of the calling thread.
+int locate(const SandboxGrant& grant, const std::string& below, Descriptor& located, FileStatus& status) {
+    located = openReference(grant.name, grant.canonical ? RESOLVE_NO_SYMLINKS : RESOLVE_NO_MAGICLINKS);
+    if (!located) return errno;
+    if (int number = readFileStatus(located.get(), "", status)) return number;
+    if (status.identity != grant.identity) return ESTALE; // another file has taken the path since
+    if (below.empty()) return S_ISREG(status.mode) || S_ISDIR(status.mode) ? 0 : EPERM;
+    if (!S_ISDIR(status.mode)) return ENOTDIR;
     open_how how{};
     how.flags = O_PATH | O_CLOEXEC; // what it is shows before it is opened: opening a device may act on it
     how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
-    Descriptor file(static_cast<int>(syscall(SYS_openat2, directory.get(), path.c_str(), &how, sizeof how)));
-    if (!file) return errno;
-    FileStatus status;
-    if (int number = readFileStatus(file.get(), "", status)) return number;
+    located = Descriptor(static_cast<int>(syscall(SYS_openat2, located.get(), below.c_str(), &how, sizeof how)));
+    if (!located) return errno;
+    if (int number = readFileStatus(located.get(), "", status)) return number;
     if (!S_ISREG(status.mode)) return S_ISDIR(status.mode) ? EISDIR : EINVAL;
-    opened = Descriptor(::open(procPath(file.get()).c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    return opened ? 0 : errno;
+    return 0;
+}
+
+/// Whether the user could write to the file, or let themselves. With the rights of the calling thread, the user's.
+bool mayWrite(uid_t user, const Descriptor& file) {
+    struct stat status{};
+    return fstat(file.get(), &status) != 0 || status.st_uid == user ||
+           faccessat(AT_FDCWD, procPath(file.get()).c_str(), W_OK, AT_EACCESS) == 0;
 }
 
 } // namespace
@@ -93,29 +104,34 @@ bool SandboxBroker::serve(int connection) {
 }
 
 int SandboxBroker::open(const SandboxGrant& grant, const std::string& below, int connection, Descriptor& opened) {
+    // An extension lifts confinement, never file permissions.
+    const auto rights = rightsOfPeer(connection);
+    Descriptor located;
     FileStatus status;
+    bool isWritable = false;
     {
-        // An extension lifts confinement, never file permissions.
-        const ActingAsPeer peer(rightsOfPeer(connection));
+        const ActingAsPeer peer(rights);
         if (!peer.isReady()) return EPERM;
-        opened = openReference(grant.name, grant.canonical ? RESOLVE_NO_SYMLINKS : RESOLVE_NO_MAGICLINKS);
-        if (!opened) return errno;
-        if (int number = readFileStatus(opened.get(), "", status)) return number;
-        if (status.identity != grant.identity) return ESTALE; // another file has taken the path since
-        if (!below.empty()) {
-            if (!S_ISDIR(status.mode)) return ENOTDIR;
-            const Descriptor directory = std::move(opened);
-            return openFileBelow(directory, below, opened);
-        }
-        const std::string path = procPath(opened.get());
-        if (S_ISREG(status.mode)) {
-            opened = Descriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-            return opened ? 0 : errno;
-        }
+        if (int number = locate(grant, below, located, status)) return number;
         // A descriptor for openat alone asks no permission to read the directory itself.
-        if (faccessat(AT_FDCWD, path.c_str(), R_OK | X_OK, AT_EACCESS) != 0) return errno;
+        if (S_ISDIR(status.mode) && faccessat(AT_FDCWD, procPath(located.get()).c_str(), R_OK | X_OK, AT_EACCESS) != 0)
+            return errno;
+        isWritable = S_ISREG(status.mode) && mayWrite(rights->user, located);
     }
-    return S_ISDIR(status.mode) ? confineDirectory(connection, opened) : EPERM;
+    // With the daemon's own rights, which copying takes.
+    if (auto copy = readOnlyCopy(located)) {
+        located = std::move(copy);
+    } else if ((S_ISDIR(status.mode) || isWritable) && !seesCommonFileTreeAt(connection)) {
+        return EPERM;
+    }
+    if (S_ISDIR(status.mode)) {
+        opened = std::move(located);
+        return 0;
+    }
+    const ActingAsPeer peer(rights);
+    if (!peer.isReady()) return EPERM;
+    opened = Descriptor(::open(procPath(located.get()).c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    return opened ? 0 : errno;
 }
 
 } // namespace platform::linux_

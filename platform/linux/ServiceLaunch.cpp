@@ -196,7 +196,7 @@ LaunchRefusal becomeService(const Root& root, const std::string& name, const std
                               {container->get(), readFiles | changeFiles}};
     const Descriptor busy = openBusyFile(root, identifier);
     if (busy) {
-        own.push_back({busy.get(), readFiles | writeFiles});
+        own.push_back({busy.get(), readFiles}); // enough for a lock
     } else {
         systemLog().defaultHandle().error("%{public}s will never count as busy: its file cannot be made",
                                           identifier.c_str());

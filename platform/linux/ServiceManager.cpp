@@ -9,7 +9,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <climits>
 #include <csignal>
 #include <dirent.h>
@@ -29,19 +28,7 @@ namespace platform::linux_ {
 
 namespace {
 
-constexpr char separator = '@';               // between bundle identifier and version
-constexpr std::size_t maximumUserLength = 10; // of an id's digits
-
-/// The user that an instance's file names. None for a file that a crash left empty; that instance was never told that
-/// it may start.
-std::optional<uid_t> recordedUser(int directory, const std::string& name) {
-    const auto text = readFile(directory, name, maximumUserLength);
-    if (!text || !*text) return std::nullopt;
-    uid_t user = 0;
-    const char* const end = (*text)->data() + (*text)->size();
-    const auto parsed = std::from_chars((*text)->data(), end, user);
-    return parsed.ec == std::errc() && parsed.ptr == end ? std::optional(user) : std::nullopt;
-}
+constexpr char separator = '@'; // between bundle identifier and version
 
 /// The name of a service's directory; an errno value for names that give none. The identifier holds no separator, so
 /// that no two services share one.
@@ -148,8 +135,11 @@ void ServiceManager::loadInstances() {
             if (process) {
                 const std::string path = _directory + '/' + service + '/' + name;
                 if (_watch.add(std::move(process), path) != 0) continue;
+                // A crash may have left the file empty. Then the process was never told that it may start, and
+                // asks anew.
+                const auto user = recordedUser(records.get(), name);
                 const std::lock_guard lock(_launching);
-                _instances[path] = recordedUser(records.get(), name).value_or(0);
+                if (user) _instances[path] = *user;
             } else if (!identity || errno == ESRCH) {
                 ::unlinkat(records.get(), name.c_str(), 0);
             }

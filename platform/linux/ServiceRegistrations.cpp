@@ -94,6 +94,11 @@ std::optional<std::uint64_t> numberOf(std::string_view text) {
     return number;
 }
 
+/// Of who is charged for a host. Not left to be seen from the process: one that has executed a set-user-id program
+/// shows several users. The dot keeps it out of listings.
+constexpr const char* userFile = ".user";
+constexpr std::size_t maximumUserLength = 10; // of an id's digits
+
 constexpr int directoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 
 /// Zero for a directory of this process's user, or the superuser, that is closed to all others: environments are in it.
@@ -121,7 +126,24 @@ int writeNew(const std::string& path, std::string_view bytes) {
     return 0;
 }
 
+/// Zero, or an errno value.
+int recordUser(const std::string& directory, uid_t user) {
+    const std::string path = directory + '/' + userFile;
+    if (recordedUser(AT_FDCWD, path) == user) return 0;
+    if (::unlink(path.c_str()) != 0 && errno != ENOENT) return errno;
+    return writeNew(path, std::to_string(user));
+}
+
 } // namespace
+
+std::optional<uid_t> recordedUser(int directory, const std::string& name) {
+    const auto text = readFile(directory, name, maximumUserLength);
+    if (!text || !*text) return std::nullopt;
+    uid_t user = 0;
+    const char* const end = (*text)->data() + (*text)->size();
+    const auto parsed = std::from_chars((*text)->data(), end, user);
+    return parsed.ec == std::errc() && parsed.ptr == end ? std::optional(user) : std::nullopt;
+}
 
 std::string ServiceRegistration::encoded() const {
     std::string bytes(compactMagic);
@@ -241,14 +263,21 @@ int ServiceRegistrations::load() {
     const std::lock_guard lock(_mutex);
     for (const auto& name : listing->directories) {
         const auto identity = ProcessIdentity::named(name);
-        Host* loaded = nullptr;
-        // A host that lives keeps what it has, also when this process is short of something: it is taken up with the
-        // next registration.
-        if (identity && host(*identity, ownerOf(identity->pid).value_or(0), loaded) != ESRCH) continue;
+        // A host that lives keeps what it has, also when this process is short of something or cannot tell whose it
+        // is: it is taken up with the next registration.
+        if (identity && takeUp(name, *identity) != ESRCH) continue;
         std::error_code ignored; // tried again at the next start
         std::filesystem::remove_all(pathOf(name), ignored);
     }
     return 0;
+}
+
+int ServiceRegistrations::takeUp(const std::string& name, const ProcessIdentity& identity) {
+    auto user = recordedUser(AT_FDCWD, pathOf(name) + '/' + userFile);
+    if (!user) user = ownerOf(identity.pid);
+    if (!user) return openProcess(identity) ? EPERM : errno;
+    Host* ignored = nullptr;
+    return host(identity, *user, ignored);
 }
 
 void ServiceRegistrations::loadServices(const std::string& name, Host& host) {
@@ -292,8 +321,11 @@ int ServiceRegistrations::host(const ProcessIdentity& identity, uid_t user, Host
     if (const int number = privacyError(Descriptor(::open(_directory.c_str(), directoryFlags)))) return number;
     const bool isNew = ::mkdir(pathOf(name).c_str(), 0700) == 0;
     if (!isNew && errno != EEXIST) return errno;
-    if (const int number = _watch.add(std::move(process), pathOf(name))) {
-        ::rmdir(pathOf(name).c_str());
+    int number = recordUser(pathOf(name), user);
+    if (number == 0) number = _watch.add(std::move(process), pathOf(name));
+    if (number != 0) {
+        std::error_code ignored;
+        if (isNew) std::filesystem::remove_all(pathOf(name), ignored);
         return number;
     }
     ++_users[user].hosts;

@@ -32,6 +32,9 @@ struct ServiceLimits {
     std::size_t instancesOfUser = 1000;
 };
 
+/// The user whose number is all that the file holds. None for any other file.
+std::optional<uid_t> recordedUser(int directory, const std::string& name);
+
 /// A service is what a bundle identifier and a version name.
 struct ServiceName {
     std::string identifier;
@@ -68,8 +71,8 @@ struct OpenedService {
 Result<OpenedService> openService(const ServiceRegistration& registration);
 
 /// The registrations of external services, one directory per host process in `<root>/run/nordane/ignitd/hosts`, named
-/// by pid and start time, with a numbered file per executable. They outlive the daemon and end with the host.
-/// Callable from any thread.
+/// by pid and start time, with a numbered file per executable and one that names the user. They outlive the daemon and
+/// end with the host. Callable from any thread.
 class ServiceRegistrations {
 public:
     /// `directory` must be one that only its owner can write to. Processes that end are told to `watch`, by the path of
@@ -112,6 +115,8 @@ private:
     };
 
     std::string pathOf(const std::string& host) const { return _directory + '/' + host; }
+    /// Takes up what lies in the host's directory. Zero, or an errno value: ESRCH when the host is gone.
+    int takeUp(const std::string& name, const ProcessIdentity& identity);
     /// The host's entry. A missing one is made, with the registrations that lie in its directory.
     int host(const ProcessIdentity& identity, uid_t user, Host*& host);
     void loadServices(const std::string& name, Host& host);

@@ -5,11 +5,13 @@
 #include <cerrno>
 #include <fcntl.h>
 #include <memory>
+#include <optional>
 #include <sched.h>
 #include <seccomp.h>
 #include <sys/ioctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 namespace platform::linux_ {
@@ -35,10 +37,22 @@ constexpr RefusedCall refusedCalls[] = {
     {"migrate_pages"},
     {"perf_event_open"},
     {"userfaultfd"},
-    {"shmget"}, // segments and queues belong to the user, whichever of the user's processes made them
+    // Segments, queues and semaphores belong to the user, whichever of the user's processes made them. Their numbers
+    // can be guessed, so using one is refused as getting it is.
+    {"shmget"},
     {"shmat"},
+    {"shmdt"},
+    {"shmctl"},
     {"msgget"},
+    {"msgsnd"},
+    {"msgrcv"},
+    {"msgctl"},
     {"semget"},
+    {"semop"},
+    {"semtimedop"},
+    {"semtimedop_time64"},
+    {"semctl"},
+    {"ipc"}, // all of them, on some machines
     {"mq_open"},
     {"mq_unlink"},
     // Keys.
@@ -63,7 +77,7 @@ constexpr RefusedCall refusedCalls[] = {
     {"mount_setattr", 442},
     {"statmount", 457},
     {"listmount", 458},
-    // Files past their paths, and what Landlock lets everybody do by path.
+    // Files past their paths, and what Landlock lets everybody do by path, or by a descriptor for reading only.
     {"name_to_handle_at"},
     {"open_by_handle_at"},
     {"fanotify_init"},
@@ -71,27 +85,38 @@ constexpr RefusedCall refusedCalls[] = {
     {"quotactl"},
     {"quotactl_fd", 443},
     {"chmod"},
+    {"fchmod"},
     {"fchmodat"},
     {"fchmodat2", 452},
     {"chown"},
+    {"chown32"},
+    {"fchown"},
+    {"fchown32"},
     {"lchown"},
+    {"lchown32"},
     {"fchownat"},
     {"getxattr"}, // some hold secrets, and a program's entitlements
     {"lgetxattr"},
+    {"fgetxattr"},
     {"getxattrat", 464},
     {"listxattr"},
     {"llistxattr"},
+    {"flistxattr"},
     {"listxattrat", 465},
     {"setxattr"},
     {"lsetxattr"},
+    {"fsetxattr"},
     {"setxattrat", 463},
     {"removexattr"},
     {"lremovexattr"},
+    {"fremovexattr"},
     {"removexattrat", 466},
     {"file_setattr", 469},
     {"utime"},
     {"utimes"},
     {"futimesat"},
+    {"utimensat"},
+    {"utimensat_time64"},
     // The machine.
     {"bpf"},
     {"kexec_load"},
@@ -119,16 +144,33 @@ constexpr RefusedCall refusedCalls[] = {
 /// Refused with ENOSYS, so that libraries take the older way. What they are asked for lies in memory or in a ring,
 /// where no filter sees it.
 constexpr RefusedCall missingCalls[] = {
-    {"clone3", 435},
-    {"io_uring_setup", 425},
-    {"io_uring_enter", 426},
-    {"io_uring_register", 427},
+    {"clone3", 435}, {"openat2", 437}, {"io_uring_setup", 425}, {"io_uring_enter", 426}, {"io_uring_register", 427},
 };
 
-constexpr int namespaceFlags[] = {CLONE_NEWNS,   CLONE_NEWCGROUP, CLONE_NEWUTS, CLONE_NEWIPC,
-                                  CLONE_NEWUSER, CLONE_NEWPID,    CLONE_NEWNET};
+/// New namespaces, and a child of the own parent: the host, which would take it for one that it started.
+constexpr int refusedCloneFlags[] = {CLONE_NEWNS,   CLONE_NEWCGROUP, CLONE_NEWUTS, CLONE_NEWIPC,
+                                     CLONE_NEWUSER, CLONE_NEWPID,    CLONE_NEWNET, CLONE_PARENT};
 
 constexpr std::uint64_t typingRequests[] = {TIOCSTI, TIOCLINUX};
+
+/// The second byte of what file systems are asked for. Much of it needs an owner and a descriptor for reading alone:
+/// setting a file's flags, sealing its content (fs-verity), encrypting a directory, making a volume in one. Cloning a
+/// file goes with it; programs that want that copy it then.
+constexpr std::uint64_t fileSystemRequestTypes[] = {'f', 'X', 0x94};
+constexpr std::uint64_t requestTypeMask = 0xff00;
+
+/// A call that makes a file: which of its arguments holds flags, and which the mode.
+struct MakingCall {
+    const char* name;
+    std::optional<unsigned> flags; // none: it always makes one
+    unsigned mode;
+};
+constexpr MakingCall makingCalls[] = {
+    {"open", 1, 2},     {"openat", 2, 3}, {"creat", {}, 1},   {"mkdir", {}, 1},
+    {"mkdirat", {}, 2}, {"mknod", {}, 1}, {"mknodat", {}, 2},
+};
+constexpr std::uint64_t makingFlags[] = {O_CREAT, O_TMPFILE};
+constexpr std::uint64_t setIdBits[] = {S_ISUID, S_ISGID};
 
 /// Who gets the signals of a socket or a pipe; the kernel sends them past what forbids sending any.
 constexpr std::uint64_t signalReceiverRequests[] = {FIOSETOWN, SIOCSPGRP};
@@ -202,6 +244,23 @@ void refuseSockets(Filter& filter, Network network) {
     if (network != Network::server) filter.refuse({"listen"}, EACCES);
 }
 
+/// A set-user-id program in the container would give its user's rights to whoever can execute it. Without one of the
+/// flags nothing is made, and any number may stand where the mode would.
+void refuseSetIdFiles(Filter& filter) {
+    for (const auto& [name, flags, mode] : makingCalls) {
+        for (const std::uint64_t bit : setIdBits) {
+            const auto hasBit = argument(mode, SCMP_CMP_MASKED_EQ, bit, bit);
+            if (!flags) {
+                filter.refuse({name}, EPERM, hasBit);
+                continue;
+            }
+            for (const std::uint64_t makes : makingFlags) {
+                filter.refuse({name}, EPERM, argument(*flags, SCMP_CMP_MASKED_EQ, makes, makes), hasBit);
+            }
+        }
+    }
+}
+
 /// Of other processes: the host would run when and where its plug-in wants.
 void refuseScheduling(Filter& filter) {
     for (const char* name : schedulingCalls) filter.refuse({name}, EPERM, argument(0, SCMP_CMP_NE, 0));
@@ -223,7 +282,6 @@ void refuseTruncating(Filter& filter) {
         filter.refuse({"open"}, EPERM, truncates(1));
         filter.refuse({"openat"}, EPERM, truncates(2));
     }
-    filter.refuse({"openat2", 437}, ENOSYS); // its flags lie in memory
 }
 
 /// Landlock before version 6 knows nothing of signals.
@@ -246,18 +304,20 @@ Failure filterSystemCalls(Network network, int landlock) {
     Filter filter;
     for (const auto& call : refusedCalls) filter.refuse(call, EPERM);
     for (const auto& call : missingCalls) filter.refuse(call, ENOSYS);
-    for (const int flag : namespaceFlags) {
+    for (const int flag : refusedCloneFlags) {
         const auto bits = static_cast<std::uint64_t>(flag);
         filter.refuse({"clone"}, EPERM, argument(0, SCMP_CMP_MASKED_EQ, bits, bits));
     }
-    // Without a path it is a descriptor's own file that is meant.
-    filter.refuse({"utimensat"}, EPERM, argument(1, SCMP_CMP_NE, 0));
     // Another process's limits are set with the same call as one's own.
     filter.refuse({"prlimit64"}, EPERM, argument(0, SCMP_CMP_NE, 0));
     // Typing into the terminal that was inherited.
     for (const std::uint64_t request : typingRequests) {
         filter.refuse({"ioctl"}, EPERM, argument(1, SCMP_CMP_MASKED_EQ, request, lowerHalf));
     }
+    for (const std::uint64_t type : fileSystemRequestTypes) {
+        filter.refuse({"ioctl"}, EPERM, argument(1, SCMP_CMP_MASKED_EQ, type << 8U, requestTypeMask));
+    }
+    refuseSetIdFiles(filter);
     refuseSockets(filter, network);
     refuseScheduling(filter);
     if (landlock < 3) refuseTruncating(filter);

@@ -8,6 +8,7 @@
 #include <arpa/inet.h>
 #include <climits>
 #include <fstream>
+#include <linux/fs.h>
 #include <linux/keyctl.h>
 #include <linux/openat2.h>
 #include <sched.h>
@@ -15,8 +16,11 @@
 #include <sys/ioctl.h>
 #include <sys/mman.h>
 #include <sys/mount.h>
+#include <sys/msg.h>
 #include <sys/ptrace.h>
 #include <sys/resource.h>
+#include <sys/sem.h>
+#include <sys/shm.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -133,10 +137,16 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
     int pair[2];
     ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
     const Descriptor ends[] = {Descriptor(pair[0]), Descriptor(pair[1])};
+    const Descriptor resource(open(at("Bundle/Resource").c_str(), O_RDONLY | O_CLOEXEC));
+    const auto makes = [&](const char* name, int flags, mode_t mode) {
+        return result(Descriptor(open(at(name).c_str(), flags | O_WRONLY | O_CLOEXEC, mode)).get());
+    };
     const std::vector<Attempt> attempts = {
         {"read the bundle", Keeper::nobody, [&] { return opens(at("Bundle/Resource")); }},
         {"execute the bundle's program", Keeper::nobody, [&] { return executes(at("Bundle/Program")); }},
         {"make a file in the container", Keeper::nobody, [&] { return opens(at("own/new"), O_RDWR | O_CREAT); }},
+        {"open with a number in the mode's place", Keeper::nobody,
+         [&] { return result(syscall(SYS_openat, AT_FDCWD, at("own/new").c_str(), O_RDONLY, 06755)); }},
         {"rename in the container", Keeper::nobody,
          [&] { return result(rename(at("own/new").c_str(), at("own/newer").c_str())); }},
         {"read libraries", Keeper::nobody, [] { return opens("/usr/lib", O_RDONLY | O_DIRECTORY); }},
@@ -166,9 +176,11 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
         {"execute a system program", Keeper::landlock, [] { return executes("/bin/true"); }},
         {"execute a script that it made", Keeper::landlock,
          [&] {
-             std::ofstream(at("own/script")) << "#!/bin/true\n";
-             return result(fchmod(Descriptor(open(at("own/script").c_str(), O_RDONLY)).get(), 0700)) +
-                    executes(at("own/script"));
+             const std::string text = "#!/bin/true\n";
+             Descriptor script(open(at("own/script").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0700));
+             if (write(script.get(), text.data(), text.size()) < 0) return 0;
+             script.reset();
+             return executes(at("own/script"));
          }},
         {"read its parent's environment", Keeper::landlock, [&] { return opens(proc + "/environ"); }},
         {"signal its parent", Keeper::filter, [&] { return result(kill(parent, 0)); }},
@@ -228,6 +240,45 @@ TEST_F(Confinement, KeepsAServiceToItsOwn) {
         {"change a mode", Keeper::filter, [&] { return result(chmod(at("home/secret").c_str(), 0777)); }},
         {"change a mode anew", Keeper::filter,
          [&] { return result(syscall(452, AT_FDCWD, at("home/secret").c_str(), 0777, 0)); }},
+        {"change the bundle's mode by descriptor", Keeper::filter,
+         [&] { return result(fchmod(resource.get(), 0777)); }},
+        {"change the bundle's owner by descriptor", Keeper::filter,
+         [&] { return result(fchown(resource.get(), geteuid(), getegid())); }},
+        {"change the bundle's times by descriptor", Keeper::filter,
+         [&] { return result(futimens(resource.get(), nullptr)); }},
+        {"set an attribute by descriptor", Keeper::filter,
+         [&] { return result(fsetxattr(resource.get(), "user.nordane.x", "x", 1, 0)); }},
+        {"remove an attribute by descriptor", Keeper::filter,
+         [&] { return result(fremovexattr(resource.get(), "user.nordane.x")); }},
+        {"read an attribute by descriptor", Keeper::filter,
+         [&] { return result(fgetxattr(resource.get(), "user.nordane.x", nullptr, 0)); }},
+        {"set the bundle's flags", Keeper::filter,
+         [&] { return result(syscall(SYS_ioctl, resource.get(), FS_IOC_SETFLAGS | upperHalf, nullptr)); }},
+        {"set the bundle's flags by the narrow call", Keeper::filter,
+         [&] { return result(ioctl(resource.get(), FS_IOC32_SETFLAGS, nullptr)); }},
+        {"set the bundle's project", Keeper::filter,
+         [&] { return result(ioctl(resource.get(), FS_IOC_FSSETXATTR, nullptr)); }},
+        {"make a set-user-id file", Keeper::filter, [&] { return makes("own/setuid", O_CREAT, 04755); }},
+        {"make a set-group-id file without a name", Keeper::filter, [&] { return makes("own", O_TMPFILE, 02755); }},
+        {"make a set-user-id file anew", Keeper::filter,
+         [&] {
+             const open_how how{O_WRONLY | O_CREAT, 04755, 0};
+             return result(syscall(SYS_openat2, AT_FDCWD, at("own/anew").c_str(), &how, sizeof how));
+         }},
+        {"make a set-user-id node", Keeper::filter,
+         [&] { return result(mknod(at("own/node").c_str(), S_IFREG | 04755, 0)); }},
+        // Were they let through, a number that nobody has would give EINVAL, for the machine's may have owners.
+        {"write to a queue by its number", Keeper::filter,
+         [] { return result(msgsnd(-1, "12345678", 0, IPC_NOWAIT)); }},
+        {"look for queues", Keeper::filter, [] { return result(msgctl(-1, IPC_STAT, nullptr)); }},
+        {"set a semaphore by its number", Keeper::filter, [] { return result(semctl(-1, 0, SETVAL, 1)); }},
+        {"remove a segment by its number", Keeper::filter, [] { return result(shmctl(-1, IPC_RMID, nullptr)); }},
+        {"fork a child of its parent", Keeper::filter,
+         [] {
+             const long child = syscall(SYS_clone, CLONE_PARENT | SIGCHLD, nullptr, nullptr, nullptr, nullptr);
+             if (child == 0) _exit(0);
+             return result(child);
+         }},
         {"watch the home", Keeper::filter,
          [&] { return result(inotify_add_watch(inotify_init(), at("home").c_str(), IN_CREATE)); }},
         {"make a namespace", Keeper::filter, [] { return result(unshare(CLONE_NEWUSER)); }},

@@ -5,13 +5,16 @@
 #include "tests/support/ScratchDirectory.h"
 #include "tests/support/SystemLogFake.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <gtest/gtest.h>
 #include <memory>
 #include <optional>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <tuple>
 
@@ -253,6 +256,51 @@ TEST(ProcessAssertionsOnLinux, RootCountsEveryUserAndAUserOnlyThemself) {
         if (lockByte(open((squatted + "/a").c_str(), O_RDWR | O_CLOEXEC), 0)) pause();
     });
     EXPECT_EQ(busyOf(world.assertions, {"a"}), Names{"a"});
+}
+
+TEST(ProcessAssertionsOnLinux, NobodyWhoComesLaterIsMissedAmongOthersDirectories) {
+    if (geteuid() != 0) GTEST_SKIP() << "takes two users";
+    LinuxAssertions world;
+    chmod(world.scratch.path().c_str(), 0755);
+    const std::string shared = busyDirectory(world.root);
+    // In memory, where many changes take no time.
+    if (mount("none", shared.c_str(), "tmpfs", 0, "mode=1777") != 0) GTEST_SKIP() << "may not mount";
+    int mostChanges = 0; // that the kernel keeps
+    std::ifstream("/proc/sys/fs/inotify/max_queued_events") >> mostChanges;
+    const std::tuple<const char*, std::function<void()>> cases[] = {
+        {"none", [] {}},
+        {"many",
+         [&] {
+             for (int change = 0; change <= mostChanges; ++change) {
+                 const std::string path = shared + (change % 2 == 0 ? "/100000" : "/100001");
+                 ASSERT_EQ(mkdir(path.c_str(), 0700), 0);
+                 rmdir(path.c_str());
+             }
+         }},
+        {"another directory around them", [&] { umount2(shared.c_str(), MNT_DETACH); }},
+    };
+    EXPECT_EQ(support::resultInChild([&] {
+                  if (!support::becomeOrdinaryUser()) return 1;
+                  for (int user = 200000; user < 200100; ++user)
+                      if (mkdir((shared + '/' + std::to_string(user)).c_str(), 0700) != 0) return 2;
+                  return 0;
+              }),
+              0);
+    for (const auto& [change, make] : cases) {
+        support::processLog.clear();
+        platform::linux_::ProcessAssertions assertions(world.root);
+        EXPECT_EQ(busyOf(assertions, {"a"}), Names()) << change;
+        make();
+        {
+            const auto other = world.busy("a", true);
+            EXPECT_EQ(busyOf(assertions, {"a"}), Names{"a"}) << change;
+        }
+        EXPECT_EQ(busyOf(assertions, {"a"}), Names()) << change;
+        std::filesystem::remove_all(shared + '/' + std::to_string(support::ordinaryUser));
+        const auto lines = support::processLog.lines();
+        EXPECT_EQ(std::ranges::count(lines, platform::LogLevel::error, &support::FakeSystemLog::Line::level), 1)
+            << "that there are such directories";
+    }
 }
 
 TEST(ProcessAssertionsOnLinux, TellsAProcessOnceHoweverManyLocksItHolds) {

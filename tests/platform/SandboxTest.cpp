@@ -187,6 +187,54 @@ TEST_F(LinuxSandbox, ConsumedDirectoryGivesWhatIsBelow) {
     EXPECT_EQ(errno, EROFS);
 }
 
+TEST_F(LinuxSandbox, ReadingGivesNoWayToWrite) {
+    int number = 0;
+    const auto bundle = host.consume(*issue("Bundle"), number);
+    const auto below = subject.host.open(bundle, "Font");
+    ASSERT_TRUE(below) << below.error().text();
+    const linux_::Descriptor copy(open_tree(AT_FDCWD, "/", OPEN_TREE_CLONE | OPEN_TREE_CLOEXEC));
+    if (!copy) GTEST_SKIP() << "may not copy mounts";
+    for (int file : {consumed(*issue("Bundle/Font")), below->get()}) {
+        const std::string again = "/proc/self/fd/" + std::to_string(file);
+        EXPECT_EQ(contentsOf(linux_::Descriptor(open(again.c_str(), O_RDONLY | O_CLOEXEC)).get()), "Bundle");
+        EXPECT_FALSE(linux_::Descriptor(open(again.c_str(), O_RDWR | O_CLOEXEC)));
+        EXPECT_EQ(errno, EROFS);
+        EXPECT_NE(fchmod(file, 0666), 0);
+    }
+}
+
+TEST_F(LinuxSandbox, WithoutCopiesOnlyFreePeersGetWhatTheyMayWrite) {
+    if (geteuid() != 0) GTEST_SKIP() << "takes two users";
+    chmod(at("").c_str(), 0777);
+    for (const char* name : {"Theirs", "Open", "Closed"}) std::ofstream(at(name)) << name;
+    chmod(at("Open").c_str(), 0666);
+    EXPECT_EQ(chown(at("Theirs").c_str(), support::ordinaryUser, support::ordinaryUser), 0);
+    chmod(at("Theirs").c_str(), 0444); // until its owner changes that
+    const auto result = support::resultInChild([&] {
+        // The kernel shows others nothing of a process that changed its user, until it says that they may look.
+        if (!support::becomeOrdinaryUser() || prctl(PR_SET_DUMPABLE, 1) != 0) return 99;
+        const linux_::Root root(at("own"));
+        linux_::Sandbox own(root, linux_::SandboxRole::issuer);
+        linux_::Sandbox peer(root, linux_::SandboxRole::consumer);
+        if (mkdir(at("own").c_str(), 0755) != 0 || own.startBroker()) return 1;
+        for (const bool isFree : {true, false}) {
+            for (const auto& [name, error] : {std::pair("Theirs", EPERM), {"Open", EPERM}, {"Closed", 0}}) {
+                const auto token = *own.issueFile(sandboxReadExtensionClass, at(name), SandboxFlag::canonical, "");
+                const int number = support::resultInChild([&] {
+                    if (!isFree && unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) return 99;
+                    int refusal = 0;
+                    return peer.consume(token, refusal) >= 0 ? 0 : refusal;
+                });
+                if (number == 99) return 99;
+                if (number != (isFree ? 0 : error)) return 2;
+            }
+        }
+        return 0;
+    });
+    if (result == 99) GTEST_SKIP() << "may not make namespaces";
+    EXPECT_EQ(result, 0);
+}
+
 TEST_F(LinuxSandbox, AlteredTokensAreRefused) {
     const std::string token = *issue("Bundle/Font");
     ASSERT_EQ(consumeError(token), 0);

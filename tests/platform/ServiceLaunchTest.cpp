@@ -204,14 +204,16 @@ TEST_F(ServiceLaunch, GivesWhatWasRegisteredAndNothingElse) {
 TEST_F(ServiceLaunch, LetsAServiceCountAsBusyAndNoOther) {
     ASSERT_EQ(add(), 0);
     const std::string busy = linux_::busyDirectory(_root) + "/" + std::to_string(geteuid()) + "/";
-    EXPECT_EQ(launch("true >> " + busy + identifier), 0);
+    EXPECT_EQ(launch("true < " + busy + identifier), 0);
     if (linux_::landlockVersion() == 0) GTEST_SKIP() << "this kernel has no Landlock";
     std::ofstream(busy + "com.example.other").flush();
-    for (const char* other : {"com.example.other", "com.example.new"}) EXPECT_NE(launch("true >> " + busy + other), 0);
+    EXPECT_NE(launch("true < " + busy + "com.example.other"), 0);
+    EXPECT_NE(launch("true >> " + busy + "com.example.new"), 0);
+    EXPECT_NE(launch("true >> " + busy + identifier), 0) << "everybody's memory would fill";
     EXPECT_EQ(launch("[ \"$(echo " + busy + "*)\" = '" + busy + "*' ]"), 0) << "who else ran is not shown";
     EXPECT_EQ(support::resultInChild([&] {
                   const linux_::Descriptor file(open((busy + identifier).c_str(), O_PATH | O_CLOEXEC));
-                  const linux_::OwnPlace own[] = {{file.get(), linux_::readFiles | linux_::writeFiles}};
+                  const linux_::OwnPlace own[] = {{file.get(), linux_::readFiles}};
                   if (linux_::confine(*linux_::findConfinementProfile("plugin"), own)) return 1;
                   return linux_::BusyAssertion(_root, identifier).failure() ? 2 : 0;
               }),
@@ -386,17 +388,46 @@ TEST_F(ServiceLaunch, RegistrationsOutliveTheManagerButNotTheirHost) {
 
     // What a process with a recycled pid would find, and what crashes leave: files that are none, and one replaced.
     const std::string own = fs::directory_iterator(hosts())->path();
-    const std::string file = fs::directory_iterator(own)->path();
+    const std::string file = own + "/1";
     fs::copy(own, hosts() + "/" + std::to_string(getppid()) + "-1", fs::copy_options::recursive);
     for (const char* name : {"/0", "/98", "/97", "/x"}) fs::copy_file(file, own + name);
     std::ofstream(own + "/99") << "vlist16\n";
     _manager.reset();
     startManager();
     EXPECT_EQ(entriesOf(hosts()), 1U);
-    EXPECT_EQ(entriesOf(own), 1U);
+    EXPECT_EQ(entriesOf(own), 2U) << "the registration and the user";
     EXPECT_EQ(launch(), 0);
     ASSERT_EQ(add(), 0);
-    EXPECT_EQ(entriesOf(own), 1U) << "replaced";
+    EXPECT_EQ(entriesOf(own), 2U) << "replaced";
+}
+
+TEST_F(ServiceLaunch, ARestartChargesThoseWhoWereCharged) {
+    // As a host that shows another user by now.
+    const uid_t user = geteuid() + 1;
+    const support::WaitingProgram host("/bin/cat");
+    const support::WaitingProgram other("/bin/cat");
+    const auto identity = *linux_::ProcessIdentity::of(host.pid());
+    const auto otherIdentity = *linux_::ProcessIdentity::of(other.pid());
+    const auto registration = *linux_::registrationOf(_files, program(), overlay());
+    const std::string directory = _scratch / "hosts";
+    linux_::ProcessWatch watch;
+    ASSERT_EQ(linux_::ServiceRegistrations(directory, watch).add(identity, user, registration), 0);
+    linux_::ServiceLimits limits;
+    limits.hostsOfUser = 1;
+    linux_::ServiceRegistrations restarted(directory, watch, limits);
+    ASSERT_EQ(restarted.load(), 0);
+    EXPECT_TRUE(restarted.find(identity, identifier));
+    EXPECT_EQ(restarted.add(otherIdentity, user, registration), EDQUOT);
+    EXPECT_EQ(restarted.add(otherIdentity, geteuid(), registration), 0);
+
+    // What a crash left of an instance that never started counts for nobody.
+    ASSERT_EQ(add(), 0);
+    const std::string instance = _root.runtime() + "/ignitd/" + identifier + "@1/" + otherIdentity.name();
+    fs::create_directories(fs::path(instance).parent_path());
+    std::ofstream{instance};
+    limits.instancesOfUser = 1;
+    startManager(limits);
+    EXPECT_EQ(launch(), 0);
 }
 
 TEST_F(ServiceLaunch, TenThousandRegistrationsEndWithTheirHost) {
@@ -412,7 +443,7 @@ TEST_F(ServiceLaunch, TenThousandRegistrationsEndWithTheirHost) {
             registration.executablePath = program() + std::to_string(number);
             ASSERT_EQ(registrations.add(*linux_::ProcessIdentity::of(host.pid()), 0, registration), 0);
         }
-        EXPECT_EQ(entriesOf(directory), 10000U);
+        EXPECT_EQ(entriesOf(directory), 10001U) << "and one for the user";
         EXPECT_TRUE(watch.takeEnded().empty());
     }
     pollfd ended{watch.descriptor(), POLLIN, 0};
@@ -423,7 +454,7 @@ TEST_F(ServiceLaunch, TenThousandRegistrationsEndWithTheirHost) {
     EXPECT_TRUE(watch.takeEnded().empty()) << "one descriptor for all";
 
     for (int number = 0; number < 10000; ++number) ASSERT_EQ(add(), 0);
-    EXPECT_EQ(entriesOf(fs::directory_iterator(hosts())->path()), 1U) << "each takes the place of the one before";
+    EXPECT_EQ(entriesOf(fs::directory_iterator(hosts())->path()), 2U) << "each takes the place of the one before";
 }
 
 TEST_F(ServiceLaunch, ServicesOfAnotherUserLiveInThatUsersContainer) {
