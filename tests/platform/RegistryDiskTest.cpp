@@ -305,7 +305,7 @@ TEST_F(RegistryOnDisk, FirstAnswerKnowsWhatChangedWhileStopped) {
             start();
             settle();
             uuid = uuidAt(plugIn);
-            // Two of the questions are answered from what is there in either case.
+            // Some find files that can be believed, the others files that changed a moment before.
             i == 1 || i == 4 ? stop() : stopOnceFilesAreOld();
             make();
             start();
