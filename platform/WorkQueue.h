@@ -25,8 +25,9 @@ public:
     /// itself. Items still waiting when the last reference goes are run first; the destructor does not wait.
     virtual void async(Item item) = 0;
 
-    /// As `async`, but on an idle queue the calling thread may run the item (and what is submitted meanwhile) itself
-    /// before it returns, which saves a wake-up. For callers that hold no lock and are on no queue.
+    /// As `async`, for items of microseconds: on an idle queue a thread of the platform that delivers events, such as
+    /// the transport's, may run the item (and others of its kind) itself once the delivery has returned, which saves a
+    /// wake-up that costs as much as the item.
     virtual void asyncOnCaller(Item item) = 0;
 
     /// Runs `item` now, after everything submitted before it, and returns its result when it is done.

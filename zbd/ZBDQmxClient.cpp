@@ -73,18 +73,15 @@ void ZBDQmxClient::handleRequest(const ReceivedMessage& message) {
         platform::trace::requestInput(pid(), message.content.description().c_str());
     }
     auto transaction = Transaction::initWithRequest(message, shared_from_this());
-    const bool isBrief = transaction->isBrief();
-    platform::WorkQueue::Item work = [self = shared_from_this(), transaction = std::move(transaction)] {
-        if (++self->_requestCount % requestCountInterval == 0) {
-            log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
-        }
-        transaction->dispatch();
-    };
-    if (isBrief) {
-        _server->submitBriefWork(std::move(work));
-    } else {
-        _server->submitWork(std::move(work));
-    }
+    const auto size = transaction->isBrief() ? ZBDServer::WorkSize::brief : ZBDServer::WorkSize::any;
+    _server->submitWork(
+        [self = shared_from_this(), transaction = std::move(transaction)] {
+            if (++self->_requestCount % requestCountInterval == 0) {
+                log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
+            }
+            transaction->dispatch();
+        },
+        size);
 }
 
 void ZBDQmxClient::dying() { log::ops().debug("client %d termination imminent", pid()); }

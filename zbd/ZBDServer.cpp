@@ -26,7 +26,7 @@ ZBDServer::ZBDServer(platform::Platform& platform) : ZBDatabase(platform) {}
 std::shared_ptr<ZBDServer> ZBDServer::initForService(platform::Platform& platform, const std::string& serviceName,
                                                      const std::optional<std::string>& annotationDatabasePath) {
     std::shared_ptr<ZBDServer> self(new ZBDServer(platform));
-    if (!self->initWithDatabase(annotationDatabasePath)) return nullptr;
+    self->initWithDatabase(annotationDatabasePath);
     self->_qmxQueue = platform.queues.makeSerial("qmx");
     self->_mainQueue = platform.queues.makeSerial("service", platform::QualityOfService::userInitiated);
     self->_syncQueue = platform.queues.makeSerial("serverSync");
@@ -66,9 +66,13 @@ void ZBDServer::run() {
     platform().runLoop.run();
 }
 
-void ZBDServer::submitWork(platform::WorkQueue::Item item) { _mainQueue->async(std::move(item)); }
-
-void ZBDServer::submitBriefWork(platform::WorkQueue::Item item) { _mainQueue->asyncOnCaller(std::move(item)); }
+void ZBDServer::submitWork(platform::WorkQueue::Item item, WorkSize size) {
+    if (size == WorkSize::brief) {
+        _mainQueue->asyncOnCaller(std::move(item));
+    } else {
+        _mainQueue->async(std::move(item));
+    }
+}
 
 void ZBDServer::stop() {
     _service->cancel();

@@ -24,8 +24,8 @@ class ZBDServer final : public ZBDatabase, public ZBDatabaseDelegate {
 public:
     using Holds = std::list<std::shared_ptr<ZBDPlugInHold>>;
 
-    /// A server whose listener is suspended until `run`. Null, with the reason logged, when the database cannot work or
-    /// the service's name cannot be had. Main thread. The platform must outlive the process's other threads.
+    /// A server whose listener is suspended until `run`. Null, with the reason logged, when the service's name cannot
+    /// be had. Main thread. The platform must outlive the process's other threads.
     static std::shared_ptr<ZBDServer> initForService(platform::Platform& platform, const std::string& serviceName,
                                                      const std::optional<std::string>& annotationDatabasePath);
 
@@ -35,11 +35,10 @@ public:
     /// Resumes the listener and serves the main run loop. Main thread; does not return while the process lives.
     void run();
 
-    /// Runs `item` on the service queue after everything submitted before it. Any thread.
-    void submitWork(platform::WorkQueue::Item item);
-    /// The same for work that is done in microseconds: on an idle queue the caller runs it itself, which saves a
-    /// hand-over that costs as much as the work. For a thread that holds no lock and is on no queue.
-    void submitBriefWork(platform::WorkQueue::Item item);
+    enum class WorkSize { any, brief };
+    /// Enqueues `item` on the service queue: it runs later, after everything submitted before it. Any thread. What is
+    /// done in microseconds is brief, and spared a hand-over that costs as much as the work.
+    void submitWork(platform::WorkQueue::Item item, WorkSize size = WorkSize::any);
 
     /// Accepts no further connections and releases every hold. Existing connections are not touched. Not on the holds
     /// queue.

@@ -531,7 +531,6 @@ std::size_t StreamConnection::deliverFrames(std::string_view bytes) {
             break;
         }
     }
-    endGathering();
     if (next.outcome == FrameScan::Outcome::malformed) {
         malformed(next.problem);
         return bytes.size();
@@ -539,7 +538,7 @@ std::size_t StreamConnection::deliverFrames(std::string_view bytes) {
     return used;
 }
 
-void StreamConnection::endGathering() {
+void StreamConnection::onServed() {
     const std::lock_guard lock(_mutex);
     if (!_gathering || _state != State::open) return;
     _gathering = false;
@@ -568,7 +567,10 @@ bool StreamConnection::deliverRequest(const Frame& frame, bool moreFollow) {
             _waiting.push_back(waiting);
             _waitingBytes += waiting.size;
         }
-        _gathering = moreFollow;
+        if (moreFollow && !_gathering) {
+            _gathering = true;
+            _loop->whenServed(this);
+        }
         handler = _handler;
     }
     if (isDuplicate) {

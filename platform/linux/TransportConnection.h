@@ -49,6 +49,7 @@ public:
 
     void onEvents(std::uint32_t events) override;
     void onTurn() override;
+    void onServed() override;
     void shutDown() override;
 
 private:
@@ -89,7 +90,6 @@ private:
     std::size_t deliverFrames(std::string_view bytes);
     bool deliverRequest(const Frame& frame, bool moreFollow);
     void deliverReply(const Frame& frame);
-    void endGathering();
     void deliverEvent(const std::shared_ptr<EventHandler>& handler, ConnectionEvent event);
     void malformed(const char* problem);
     void drain();
@@ -132,7 +132,7 @@ private:
     bool _watched = false;
     bool _reading = true;    // false once the peer has ended
     bool _paused = false;    // requests are left unread until replies went out
-    bool _gathering = false; // more requests follow at once: replies wait for one common write
+    bool _gathering = false; // requests came together: replies of this thread wait for one common write
     bool _sendBroken = false;
     std::uint32_t _interest = 0;
     std::string _out;

@@ -2,6 +2,7 @@
 
 #include "platform/linux/ServiceThread.h"
 #include "platform/linux/TransportLimits.h"
+#include "platform/linux/WorkQueue.h"
 
 #include <algorithm>
 #include <array>
@@ -144,10 +145,19 @@ void Loop::runDeadlines() {
     }
 }
 
+void Loop::serve(LentThread& lent) {
+    lent.serve();
+    for (Pollable* pollable : _served) {
+        if (pollable->_kept) pollable->onServed();
+    }
+    _served.clear();
+}
+
 void Loop::run() {
     _threadId = std::this_thread::get_id();
     std::array<epoll_event, 64> events;
     std::vector<Pollable*> turns;
+    LentThread lent;
     while (!_stopping) {
         const int count = ::epoll_wait(_epoll.get(), events.data(), static_cast<int>(events.size()), timeout());
         for (int i = 0; i < count && !_stopping; ++i) {
@@ -159,13 +169,16 @@ void Loop::run() {
             }
             auto* const pollable = static_cast<Pollable*>(event.data.ptr);
             if (pollable->_kept) pollable->onEvents(event.events);
+            serve(lent);
         }
         runTasks();
         runTimers();
         runDeadlines();
+        serve(lent);
         turns.swap(_again);
         for (Pollable* pollable : turns) {
             if (pollable->_kept && !_stopping) pollable->onTurn();
+            serve(lent);
         }
         turns.clear();
         _dropped.clear();

@@ -16,6 +16,10 @@
 #include <utility>
 #include <vector>
 
+namespace platform::linux_ {
+class LentThread;
+}
+
 namespace platform::linux_::qmx {
 
 /// What the loop calls. All of it runs on the loop's thread, except `shutDown`.
@@ -26,6 +30,8 @@ public:
     virtual void onEvents(std::uint32_t events) = 0;
     /// A turn that was asked for with `Loop::again`.
     virtual void onTurn() {}
+    /// What was delivered before `Loop::whenServed` has been served, as far as this thread serves it.
+    virtual void onServed() {}
     /// The time that `Loop::expire` gave has passed.
     virtual void onDeadline() {}
     /// The transport is going away and the thread has ended: let go of everything, call no handler.
@@ -67,6 +73,8 @@ public:
     void unwatch(int descriptor);
     /// Asks for another turn after the others had theirs. `pollable` must be kept.
     void again(Pollable* pollable) { _again.push_back(pollable); }
+    /// Calls its `onServed` once, after the queues that this thread is lent to had theirs.
+    void whenServed(Pollable* pollable) { _served.push_back(pollable); }
     void after(std::chrono::milliseconds delay, Task task);
     /// Gives `pollable` this long until it is dropped. `pollable` must be kept and have no deadline yet.
     void expire(Pollable* pollable, std::chrono::milliseconds delay);
@@ -83,6 +91,7 @@ private:
     void runTasks();
     void runTimers();
     void runDeadlines();
+    void serve(LentThread& lent);
     int timeout();
 
     Descriptor _epoll;
@@ -99,6 +108,7 @@ private:
     std::unordered_map<Pollable*, std::shared_ptr<Pollable>> _kept;
     std::vector<std::shared_ptr<Pollable>> _dropped; // still named by events of this round
     std::vector<Pollable*> _again;
+    std::vector<Pollable*> _served; // to be told so
     std::vector<std::pair<Clock::time_point, Task>> _timers; // a handful: retries only
     std::set<std::pair<Clock::time_point, Pollable*>> _deadlines;
     std::vector<char> _scratch;

@@ -12,6 +12,7 @@
 #include <malloc.h>
 #include <mutex>
 #include <sys/resource.h>
+#include <utility>
 
 namespace platform {
 
@@ -41,16 +42,14 @@ long pagesTaken() {
     return usage.ru_minflt;
 }
 
-// A caller that offered its thread runs no more items than this: it has other work to return to.
-constexpr std::size_t callerBatch = 16;
+// A thread that is lent runs no more items than this of a queue at once: it has other work to return to.
+constexpr std::size_t lentBatch = 16;
 
 /// Names the calling thread: an address no other living thread has.
 const void* thisThread() {
     static thread_local const char mark = 0;
     return &mark;
 }
-
-class Queue;
 
 } // namespace
 
@@ -98,41 +97,39 @@ private:
 
 namespace {
 
+/// Where the calling thread is lent.
+thread_local LentThread* lentThread = nullptr;
+
+} // namespace
+
 class Queue final : public WorkQueue, public std::enable_shared_from_this<Queue> {
 public:
     Queue(std::string label, QualityOfService quality, std::shared_ptr<ThreadPool> pool)
         : _label(std::move(label)), _quality(quality), _pool(std::move(pool)) {}
 
     void async(Item item) override {
-        {
-            const std::lock_guard guard(_lock);
-            _line.push_back({std::move(item), nullptr});
-            if (_isTaken) return;
-            _isTaken = true;
-        }
-        _pool->submit(shared_from_this(), _quality);
+        if (enqueue({std::move(item), nullptr, false})) leaveToPool();
     }
 
     void asyncOnCaller(Item item) override {
-        {
-            const std::lock_guard guard(_lock);
-            if (_isTaken) {
-                _line.push_back({std::move(item), nullptr});
-                return;
-            }
-            _isTaken = true;
+        if (!enqueue({std::move(item), nullptr, true})) return;
+        if (lentThread != nullptr) {
+            lentThread->_taken.push_back(shared_from_this());
+        } else {
+            leaveToPool();
         }
-        const std::shared_ptr<Queue> self = shared_from_this(); // the item may drop the last other reference
-        runItem(item);
-        runTurn(callerBatch - 1);
     }
 
+    /// The caller has the turn.
+    void leaveToPool() { _pool->submit(shared_from_this(), _quality); }
+
     /// Runs waiting items. The caller has the turn, and has passed it on or given it up on return.
-    void runTurn(std::size_t limit = poolBatch) {
+    void runTurn(std::size_t limit = poolBatch, bool isLent = false) {
         for (std::size_t count = 0; count < limit; ++count) {
             Item item;
             {
                 const std::lock_guard guard(_lock);
+                if (isLent && !_line.empty() && !_line.front().isBrief) break;
                 if (!takeNext(item)) return;
             }
             runItem(item);
@@ -153,18 +150,27 @@ private:
     struct Entry {
         Item item;
         Waiter* waiter; // instead of an item
+        bool isBrief;
     };
+
+    /// True when the queue was idle and the turn is the caller's now.
+    bool enqueue(Entry entry) {
+        const std::lock_guard guard(_lock);
+        _line.push_back(std::move(entry));
+        return !std::exchange(_isTaken, true);
+    }
 
     void runSync(Call call) override {
         if (isCurrent()) {
             std::fprintf(stderr, "work queue \"%s\" is entered from itself\n", _label.c_str());
             std::abort();
         }
+        if (lentThread != nullptr) lentThread->giveBack();
         {
             std::unique_lock lock(_lock);
             if (_isTaken) {
                 Waiter waiter;
-                _line.push_back({nullptr, &waiter});
+                _line.push_back({nullptr, &waiter, false});
                 waiter.granted.wait(lock, [&] { return waiter.isGranted; });
             } else {
                 _isTaken = true;
@@ -199,7 +205,7 @@ private:
                 return;
             }
         }
-        _pool->submit(shared_from_this(), _quality);
+        leaveToPool();
     }
 
     /// With the lock held: the next item, for the caller to run. False when the turn went elsewhere.
@@ -232,15 +238,36 @@ private:
     std::deque<Entry> _line;
 };
 
-} // namespace
+LentThread::LentThread() { lentThread = this; }
+
+LentThread::~LentThread() {
+    lentThread = nullptr;
+    giveBack();
+}
+
+void LentThread::serveTaken() {
+    for (std::size_t left = _taken.size(); left > 0 && !_taken.empty(); --left) {
+        const std::shared_ptr<Queue> next = std::move(_taken.front());
+        _taken.erase(_taken.begin());
+        next->runTurn(lentBatch, true);
+    }
+    giveBack(); // what the items submitted is for other threads: this one is wanted back
+}
+
+void LentThread::giveBack() {
+    for (const auto& taken : _taken) taken->leaveToPool();
+    _taken.clear();
+}
 
 void ThreadPool::submit(std::shared_ptr<Queue> queue, QualityOfService quality) {
-    const std::lock_guard guard(_lock);
-    if (_isStopping && _threads == 0) return; // too late: what the item works on may be gone
-    _ready[quality == QualityOfService::userInitiated ? 0 : 1].push_back(std::move(queue));
-    // A thread that was woken counts as idle until it has taken its queue, hence the comparison of numbers.
-    if (_ready[0].size() + _ready[1].size() > _idleThreads) startThread();
-    _wakeUp.notify_one();
+    {
+        const std::lock_guard guard(_lock);
+        if (_isStopping && _threads == 0) return; // too late: what the item works on may be gone
+        _ready[quality == QualityOfService::userInitiated ? 0 : 1].push_back(std::move(queue));
+        // A thread that was woken counts as idle until it has taken its queue, hence the comparison of numbers.
+        if (_ready[0].size() + _ready[1].size() > _idleThreads) startThread();
+    }
+    _wakeUp.notify_one(); // whom the lock would only keep waiting
 }
 
 void ThreadPool::startThread() {

@@ -5,10 +5,37 @@
 #include <cstddef>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace platform::linux_ {
 
 class ThreadPool;
+
+class Queue;
+
+/// Makes the calling thread one of those that serve queues, for as long as this object lives: what the thread submits
+/// with `asyncOnCaller` to idle queues it runs itself, at its next `serve`. For a thread's outermost loop: nothing that
+/// it calls there holds a lock or is on a queue.
+class LentThread {
+public:
+    LentThread();
+    ~LentThread();
+    LentThread(const LentThread&) = delete;
+    LentThread& operator=(const LentThread&) = delete;
+
+    /// Runs what the queues taken since the last call have waiting, or, of many items, the first few.
+    void serve() {
+        if (!_taken.empty()) serveTaken();
+    }
+
+private:
+    friend class Queue;
+    void serveTaken();
+    /// Leaves the queues to the pool, before the thread waits for one of them.
+    void giveBack();
+
+    std::vector<std::shared_ptr<Queue>> _taken; // whose turn this thread has, and has not begun
+};
 
 /// Serial queues on one pool of threads.
 ///
