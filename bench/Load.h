@@ -3,6 +3,7 @@
 #include "bench/Socket.h"
 #include "bench/Timing.h"
 
+#include <cstring>
 #include <functional>
 #include <list>
 #include <sys/epoll.h>
@@ -41,11 +42,16 @@ inline double throughput(const Target& target, std::size_t clients, std::size_t 
     };
     const Descriptor epoll(epoll_create1(EPOLL_CLOEXEC));
     std::list<Client> all;
-    std::size_t next = 0;
+    std::vector<std::string> requests = target.requests;
+    std::uint64_t next = 0;
     const auto ask = [&](Client& client, std::size_t count) {
         // A send for each, as from a program that asks when it needs to know.
-        for (std::size_t i = 0; i < count; ++i)
-            sendAll(client.socket.get(), target.requests[next++ % target.requests.size()]);
+        for (std::size_t i = 0; i < count; ++i, ++next) {
+            std::string& request = requests[next % requests.size()];
+            // No two that wait have the same id, which stands at the end of the frame's header.
+            std::memcpy(request.data() + qmx::frameHeaderSize - sizeof next, &next, sizeof next);
+            sendAll(client.socket.get(), request);
+        }
     };
     for (std::size_t i = 0; i < clients; ++i) {
         Client& client = all.emplace_back();
