@@ -45,9 +45,7 @@ std::unique_ptr<ZBDAnnotationStore> ZBDAnnotationStore::initWithDatabase(platfor
                          store->_annotationsURL, error);
         store->_isFileDamaged = true;
     }
-    const auto container = containerURL(platform);
-    if (!container) return nullptr;
-    if (store->loadDb(*container, error)) {
+    if (store->loadDb(containerURL(platform), error)) {
         log::ops().info("migrating shared annotations");
         if (!store->saveDb(error)) {
             log::ops().error("unable to save migrated annotations to %{public}@ error:%{public}@",
@@ -156,14 +154,13 @@ URL ZBDAnnotationStore::globalURL(platform::Platform& platform) {
     return URL::file(platform.files.locate("/var/db/Zembra-Annotations"));
 }
 
-std::optional<URL> ZBDAnnotationStore::containerURL(platform::Platform& platform) {
-    auto path = platform.containers.userContainer("com.nordane.zbd");
+URL ZBDAnnotationStore::containerURL(platform::Platform& platform) {
+    const auto path = platform.containers.userContainer("com.nordane.zbd");
     if (path) return URL::file(*path);
+    log::ops().error("annotations of earlier versions cannot be looked for: %{public}@", path.error());
     const auto number = static_cast<std::uint64_t>(path.error().code);
     log::ops().error("failed to get storage container: error=%llu", number);
-    log::ops().error("unable to locate user container: error %llu", number);
-    log::ops().error("annotations of earlier versions cannot be looked for: %{public}@", path.error());
-    return std::nullopt;
+    zembra::fatalInternalError(platform::format("unable to locate user container: error %llu", number));
 }
 
 } // namespace zbd

@@ -32,7 +32,7 @@ public:
     static constexpr std::size_t maximumFileSize = std::size_t{64} << 20U;
 
     /// A store with its table loaded, migrated or empty. `path` is taken as written; none means the default location.
-    /// Never writes unless it migrates. Null, with the reason logged, when the container service fails.
+    /// Never writes unless it migrates. A container service that fails ends the process.
     static std::unique_ptr<ZBDAnnotationStore> initWithDatabase(platform::Platform& platform,
                                                                 const std::optional<std::string>& path);
 
@@ -59,7 +59,7 @@ public:
 
     static platform::URL defaultDatabaseURL(platform::Platform& platform);
     static platform::URL globalURL(platform::Platform& platform);
-    static std::optional<platform::URL> containerURL(platform::Platform& platform);
+    static platform::URL containerURL(platform::Platform& platform);
 
 private:
     platform::Failure apply(const AnnotationChange& change);

@@ -5,6 +5,9 @@
 #include "Zembra/ZBUtilities.h"
 
 #include <algorithm>
+#include <bit>
+#include <locale>
+#include <stdexcept>
 
 namespace zbd {
 
@@ -21,16 +24,31 @@ std::optional<std::string> pathOf(const std::optional<URL>& url) {
     return url ? std::optional(url->path()) : std::nullopt;
 }
 
-/// The election that a pattern asks for, or none when the pattern is more than "equals". Elections are decimal numbers,
-/// so a pattern that begins beyond ASCII needs no prefilter: the rules refuse it later.
+/// Whether `text`, which is not empty, begins with a letter or digit of any script.
+bool beginsAlphanumeric(std::string_view text) {
+    static const std::locale unicode = [] {
+        try {
+            return std::locale("C.UTF-8");
+        } catch (const std::runtime_error&) {
+            return std::locale::classic(); // then ASCII has to do
+        }
+    }();
+    // Strings are well-formed UTF-8: the first byte has as many ones in front as the character has bytes.
+    const auto first = static_cast<unsigned char>(text.front());
+    const int length = std::countl_one(first);
+    auto character = static_cast<wchar_t>(first & (0x7F >> length));
+    for (int at = 1; at < length; ++at) {
+        character = static_cast<wchar_t>((character << 6) | (text[static_cast<std::size_t>(at)] & 0x3F));
+    }
+    return std::isalnum(character, unicode);
+}
+
+/// The election that a pattern asks for, or none when the pattern is more than "equals".
 std::optional<std::string> electionOfPattern(const Value& pattern) {
     const auto text = pattern.string();
     if (!text || text->empty()) return std::nullopt;
-    const char first = text->front();
-    if (first == '=') return std::string(text->substr(1));
-    const bool alphanumeric =
-        (first >= '0' && first <= '9') || (first >= 'A' && first <= 'Z') || (first >= 'a' && first <= 'z');
-    if (alphanumeric) return std::string(*text);
+    if (text->front() == '=') return std::string(text->substr(1));
+    if (beginsAlphanumeric(*text)) return std::string(*text);
     return std::nullopt;
 }
 
@@ -63,9 +81,8 @@ void order(std::vector<ZBDPlugInRef>& plugIns) {
 
 ZBDatabase::ZBDatabase(platform::Platform& platform) : _platform(platform), _workspace(platform.registry) {}
 
-bool ZBDatabase::initWithDatabase(const std::optional<std::string>& annotationDatabasePath) {
+void ZBDatabase::initWithDatabase(const std::optional<std::string>& annotationDatabasePath) {
     _annotations = ZBDAnnotationStore::initWithDatabase(_platform, annotationDatabasePath);
-    if (!_annotations) return false;
     _sync = _platform.queues.makeSerial("ZBDatabase");
     _workspace.addObserver(weak_from_this());
     _regionObserver =
@@ -75,7 +92,6 @@ bool ZBDatabase::initWithDatabase(const std::optional<std::string>& annotationDa
                 if (const auto database = self.lock()) database->purgeCachesToLimit(0);
             });
         });
-    return true;
 }
 
 ZBDPlugInRef ZBDatabase::cachedPlugIn(const UUID& uuid) {
@@ -90,14 +106,12 @@ ZBDPlugInRef ZBDatabase::plugInForProxy(const PlugInProxyRef& proxy) {
     return _sync->sync([&] { return recordForProxy(proxy); });
 }
 
+/// Where the registry was asked for the proxy on this queue too, a notice that outdates what it said comes after the
+/// record is made, and takes it out of the cache.
 ZBDPlugInRef ZBDatabase::recordForProxy(const PlugInProxyRef& proxy) {
     _sync->assertCurrent();
-    // A proxy without a UUID gives a record with a random one: never found again, so it is not kept.
-    if (!proxy->uuid) return createPlugInForProxy(proxy);
-    if (auto cached = cachedPlugIn(*proxy->uuid)) return cached;
-    // The proxy may be older than the notice of its uninstall; then nothing would end a record made of it.
-    const auto current = _workspace.plugInForUUID(*proxy->uuid);
-    return current ? createPlugInForProxy(current) : nullptr;
+    const auto cached = proxy->uuid ? cachedPlugIn(*proxy->uuid) : nullptr;
+    return cached ? cached : createPlugInForProxy(proxy);
 }
 
 ZBDPlugInRef ZBDatabase::createPlugInForProxy(const PlugInProxyRef& proxy) {
@@ -107,7 +121,7 @@ ZBDPlugInRef ZBDatabase::createPlugInForProxy(const PlugInProxyRef& proxy) {
     if (!plugIn) return nullptr;
     if (plugIn->hasEntitlement(zembra::entitlement::autoElectPlugIn)) autoElect(*plugIn);
     purgeCachesToLimit(_cacheLimit);
-    if (proxy->uuid) _cache.insert_or_assign(*plugIn->uuid(), plugIn);
+    _cache.insert_or_assign(*plugIn->uuid(), plugIn);
     return plugIn;
 }
 
@@ -117,10 +131,6 @@ void ZBDatabase::purgeCachesToLimit(std::uint32_t limit) {
     log::ops().info("purging cache for %d > %d", _cache.size(), limit);
     _cache.clear();
     _workspace.clearSchemaCaches();
-}
-
-std::size_t ZBDatabase::cacheCount() {
-    return _sync->sync([&] { return _cache.size(); });
 }
 
 ZBDPlugInRef ZBDatabase::findPlugIn(const UUID& uuid) {
@@ -142,15 +152,17 @@ ZBDPlugInRef ZBDatabase::findPlugInAtPath(const URL& url) {
 }
 
 std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::plugInsWithinApplication(const URL& url) {
-    const auto application = _workspace.applicationForURL(url);
-    if (!application) return std::nullopt;
-    const auto proxies = _workspace.plugInsOfApplication(*application);
-    if (proxies.empty()) return std::nullopt;
-    std::vector<ZBDPlugInRef> plugIns;
-    for (const PlugInProxyRef& proxy : proxies) {
-        if (auto plugIn = plugInForProxy(proxy)) plugIns.push_back(std::move(plugIn));
-    }
-    return plugIns;
+    return _sync->sync([&]() -> std::optional<std::vector<ZBDPlugInRef>> {
+        const auto application = _workspace.applicationForURL(url);
+        if (!application) return std::nullopt;
+        const auto proxies = _workspace.plugInsOfApplication(*application);
+        if (proxies.empty()) return std::nullopt;
+        std::vector<ZBDPlugInRef> plugIns;
+        for (const PlugInProxyRef& proxy : proxies) {
+            if (auto plugIn = recordForProxy(proxy)) plugIns.push_back(std::move(plugIn));
+        }
+        return plugIns;
+    });
 }
 
 std::optional<ZBDatabase::ElectionValues> ZBDatabase::electionPrefilter(const Dictionary& query) {
@@ -182,40 +194,42 @@ bool ZBDatabase::acceptByElection(const ElectionValues& elections, const std::st
     return std::find(elections.begin(), elections.end(), text) != elections.end();
 }
 
-std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
-    std::optional<std::vector<PlugInProxyRef>> proxies;
+std::optional<std::vector<PlugInProxyRef>> ZBDatabase::proxiesFor(const std::optional<Dictionary>& query) {
     if (!query || query->empty()) {
-        proxies = _workspace.installedPlugIns();
+        auto proxies = _workspace.installedPlugIns();
         log::cx().debug("%d installedPlugins: %@", proxies ? proxies->size() : 0, proxies);
-    } else {
-        const auto elections = electionPrefilter(*query);
-        proxies = _workspace.plugInsMatching(
-            *query, [&](const std::string& identifier, const std::optional<Dictionary>& entitlements) {
-                if (!elections) return true;
-                // A replacing plug-in shares the annotation of the one it replaces.
-                const auto replaced =
-                    entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
-                const std::string key(replaced.value_or(identifier));
-                const bool accepted = acceptByElection(*elections, key, entitlements);
-                log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);
-                return accepted;
-            });
-        log::cx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, *query, proxies);
+        return proxies;
     }
+    const auto elections = electionPrefilter(*query);
+    auto proxies = _workspace.plugInsMatching(*query, [&](const std::string& identifier,
+                                                          const std::optional<Dictionary>& entitlements) {
+        if (!elections) return true;
+        // A replacing plug-in shares the annotation of the one it replaces.
+        const auto replaced = entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
+        const std::string key(replaced.value_or(identifier));
+        const bool accepted = acceptByElection(*elections, key, entitlements);
+        log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);
+        return accepted;
+    });
+    log::cx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, *query, proxies);
+    return proxies;
+}
 
-    const std::size_t countBefore = cacheCount();
-    if (!proxies) return std::nullopt;
-    std::vector<ZBDPlugInRef> plugIns;
-    plugIns.reserve(proxies->size());
-    _sync->sync([&] { // once for all: most are cached
+std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
+    return _sync->sync([&]() -> std::optional<std::vector<ZBDPlugInRef>> {
+        const auto proxies = proxiesFor(query);
+        const std::size_t countBefore = _cache.size();
+        if (!proxies) return std::nullopt;
+        std::vector<ZBDPlugInRef> plugIns;
+        plugIns.reserve(proxies->size());
         for (const PlugInProxyRef& proxy : *proxies) {
             if (!isUsable(proxy)) continue;
             if (auto plugIn = recordForProxy(proxy)) plugIns.push_back(std::move(plugIn));
         }
+        order(plugIns);
+        log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns.size(), countBefore, _cache.size());
+        return plugIns;
     });
-    order(plugIns);
-    log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns.size(), countBefore, cacheCount());
-    return plugIns;
 }
 
 platform::Failure ZBDatabase::addPlugIn(const URL& url) {

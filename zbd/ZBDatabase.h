@@ -34,8 +34,8 @@ public:
     static constexpr std::uint32_t defaultCacheLimit = 1'000'000;
 
     /// Reads the annotations and begins to follow the registry and the locale. The object must be held by a shared
-    /// pointer. False when there is no annotation store.
-    bool initWithDatabase(const std::optional<std::string>& annotationDatabasePath);
+    /// pointer.
+    void initWithDatabase(const std::optional<std::string>& annotationDatabasePath);
 
     ZBDPlugInRef plugInForProxy(const platform::PlugInProxyRef& proxy);
     /// On the database queue only.
@@ -87,7 +87,7 @@ private:
                           const std::optional<platform::Dictionary>& entitlements) const;
     ZBDPlugInRef cachedPlugIn(const platform::UUID& uuid);
     ZBDPlugInRef recordForProxy(const platform::PlugInProxyRef& proxy);
-    std::size_t cacheCount();
+    std::optional<std::vector<platform::PlugInProxyRef>> proxiesFor(const std::optional<platform::Dictionary>& query);
 
     platform::Platform& _platform;
     std::uint32_t _cacheLimit = defaultCacheLimit;
