@@ -15,9 +15,11 @@ std::string executableLink(pid_t pid) { return "/proc/" + std::to_string(pid) + 
 
 } // namespace
 
-ProgramIdentity ProgramIdentity::ofProcess(pid_t pid) {
+ProgramIdentity ProgramIdentity::ofProcess(pid_t pid) { return ofFile(executableLink(pid)); }
+
+ProgramIdentity ProgramIdentity::ofFile(const std::string& path) {
     struct stat status{};
-    if (::stat(executableLink(pid).c_str(), &status) != 0) return {};
+    if (::stat(path.c_str(), &status) != 0) return {};
     return {status.st_dev, status.st_ino};
 }
 

@@ -11,7 +11,8 @@
 
 namespace platform::linux_ {
 
-/// Which file a process runs. Zero when it could not be read (another user's process, or one that is gone).
+/// Which file a process runs. Zero when it could not be read (another user's process, or one that is gone; no such
+/// file).
 struct ProgramIdentity {
     dev_t device = 0;
     ino_t inode = 0;
@@ -19,6 +20,7 @@ struct ProgramIdentity {
     bool isKnown() const { return inode != 0; }
     /// What `/proc/<pid>/exe` leads to now.
     static ProgramIdentity ofProcess(pid_t pid);
+    static ProgramIdentity ofFile(const std::string& path);
     friend bool operator==(const ProgramIdentity&, const ProgramIdentity&) = default;
 };
 

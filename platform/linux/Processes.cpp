@@ -7,7 +7,6 @@
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
-#include <sys/stat.h>
 #include <unistd.h>
 
 namespace platform::linux_ {
@@ -22,18 +21,21 @@ Result<std::string> Processes::executablePath(std::int32_t pid, std::size_t buff
     if (size == static_cast<ssize_t>(sizeof buffer)) return systemError(ENAMETOOLONG, process);
     std::string path(buffer, static_cast<std::size_t>(size));
 
-    ProgramIdentity program = ProgramIdentity::ofProcess(pid);
-    struct stat named{};
-    if (stat(path.c_str(), &named) != 0 || program != ProgramIdentity{named.st_dev, named.st_ino})
+    const ProgramIdentity program = ProgramIdentity::ofProcess(pid);
+    if (!program.isKnown() || ProgramIdentity::ofFile(path) != program)
         return systemError(program.isKnown() ? ENOENT : ESRCH, process);
     if (path.size() >= bufferSize) return systemError(ENAMETOOLONG, process);
     return path;
 }
 
 Result<std::string> Processes::executablePath(const AuditToken& peer, std::size_t bufferSize) {
-    auto process = std::dynamic_pointer_cast<const LinuxPeerProcess>(peer.process);
+    const auto process = std::dynamic_pointer_cast<const LinuxPeerProcess>(peer.process);
     if (!process) return systemError(ESRCH, "process " + std::to_string(peer.pid));
-    auto path = executablePath(process->pid(), bufferSize);
+    // Mostly the path that was read first still leads to the program.
+    const std::string& known = process->executablePath();
+    const bool isKnown =
+        !known.empty() && known.size() < bufferSize && ProgramIdentity::ofFile(known) == process->program();
+    Result<std::string> path = isKnown ? known : executablePath(process->pid(), bufferSize);
     // Asked last: what was read before it belongs to the program that connected.
     if (!process->isUnchanged()) return systemError(ESRCH, "process " + std::to_string(peer.pid));
     return path;
