@@ -37,6 +37,10 @@ using Stage = InstalledBundles::Stage;
 /// Candidates of one query that are looked at for it alone. Of more the registry's thread soon knows, too.
 constexpr std::size_t maximumLooks = 500;
 
+/// Milliseconds in which the first hosts ask for plug-ins that are known already, and need not share the processor with
+/// the look at the disk. Whoever needs that one ends the delay.
+constexpr int startDelay = 100;
+
 constexpr const char* placeholderKey = "VBBundleIsPlaceholder";
 
 /// The path with its symbolic links resolved; none for what does not exist.
@@ -262,6 +266,7 @@ private:
 
     void awaitStage(Stage stage) {
         if (_stage.load(std::memory_order_acquire) >= stage) return;
+        wake();
         std::unique_lock lock(_mutex);
         _stageReached.wait(lock, [&] { return _stage.load(std::memory_order_relaxed) >= stage; });
     }
@@ -273,6 +278,8 @@ private:
     }
 
     void run() {
+        pollfd wanted{_wake.get(), POLLIN, 0};
+        (void)poll(&wanted, 1, startDelay);
         while (_bundles.stage() < Stage::watched) publish(_bundles.catchUp());
         while (true) {
             pollfd waiting[] = {{_bundles.descriptor(), POLLIN, 0}, {_wake.get(), POLLIN, 0}};
