@@ -37,11 +37,7 @@ using Overrides = std::unordered_map<std::string, MutableDictionary>;
 
 std::string_view textOf(const Value& value) { return value.string().value_or(""); }
 
-std::string describe(const ZBDPlugInRef& candidate) {
-    const auto kept = candidate->keptForm();
-    return platform::format("%@(%@) %@", candidate->identifier(), kept ? kept->version : candidate->version(),
-                            candidate->uuidText());
-}
+std::string listing(const ZBDPlugInRef& candidate) { return candidate->listing(candidate->keptForm()); }
 
 // Both lists are made as they are printed: the log shows the first few dozen of thousands.
 
@@ -50,7 +46,7 @@ void logCandidates(const Candidates& candidates) {
         log::ops().info("Candidate plugin count: 0");
     } else {
         log::ops().info("Candidate plugin count: %u, info: %{public}@", candidates.size(),
-                        std::views::transform(candidates, describe));
+                        std::views::transform(candidates, listing));
     }
 }
 

@@ -172,6 +172,10 @@ ZBDPlugIn::KeptFormRef ZBDPlugIn::keptForm() const {
 
 bool ZBDPlugIn::requiresEntitlement() const { return static_cast<bool>(pluginKey(manifest::hostEntitlement)); }
 
+std::string ZBDPlugIn::listing(const KeptFormRef& kept) const {
+    return kept ? kept->listing : platform::format("%@(%@) %@", identifier(), version(), uuidText());
+}
+
 MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFormRef& known) const {
     if (known) return MutableDictionary::extending(known->form);
     const auto manifest = bundleInfoDictionary();
@@ -190,6 +194,7 @@ MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFor
                                                                .form = form.keepingEncoding(),
                                                                .tokens = tokenNeeds(),
                                                                .version = version(),
+                                                               .listing = listing(nullptr),
                                                                .isDedicated = isDedicated(),
                                                                .requiresEntitlement = requiresEntitlement()}));
     _formKeeper.set(keeper);

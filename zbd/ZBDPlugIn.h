@@ -89,6 +89,7 @@ public:
         platform::Dictionary form;     // with its encoding, and with the annotations and tokens of the last answer
         TokenNeeds tokens;
         platform::Value version;
+        std::string listing; // what lists of candidates in the log show
         bool isDedicated = false;
         bool requiresEntitlement = false; // of its hosts
     };
@@ -103,6 +104,9 @@ public:
     /// they are the same nothing changes. `kept` is what `keptForm` has just answered.
     platform::MutableDictionary currentForm(platform::Failure* error, const KeptFormRef& kept) const;
     platform::MutableDictionary currentForm(platform::Failure* error) const { return currentForm(error, keptForm()); }
+
+    /// Identifier, version and UUID, as lists in the log show them. `kept` is what `keptForm` has just answered.
+    std::string listing(const KeptFormRef& kept) const;
 
     // ZBDPlugInTokens.cpp
 
