@@ -24,8 +24,8 @@ inline constexpr std::size_t maximumLineLength = 4096;
 /// written as escapes, so that no peer forges a line or steers a terminal. Cut to `limit` bytes.
 std::string printableLine(std::string_view message, std::size_t limit);
 
-/// The log on Linux: the journal, or lines on a descriptor.
-class SystemLog final : public platform::SystemLog, private LogSink {
+/// The log on Linux: the journal, or lines on a descriptor. A subclass may send the lines elsewhere.
+class SystemLog : public platform::SystemLog, private LogSink {
 public:
     enum class Destination {
         automatic, // the journal when it is there and the descriptor is no terminal

@@ -13,22 +13,18 @@ using zembra::ZBBundle;
 TEST(Bundle, ExecutablePathFallsBackToTheDirectory) {
     support::FakeBundles bundles;
     bundles.add("/App.app", {}, "/App.app/Run");
-    bundles.add("/Data.app", {});
     bundles.mainExecutable = "/App.app/Run";
     EXPECT_EQ(ZBBundle::initForMainBundle(bundles)->path(), "/App.app");
-    EXPECT_EQ(ZBBundle::initWithExecutablePath(bundles, "/App.app/Run")->path(), "/App.app");
-    const auto directory = ZBBundle::initWithExecutableURL(bundles, URL::file("/App.app/"));
-    EXPECT_EQ(directory->executablePath(), "/App.app/Run");
-    EXPECT_EQ(directory->url(), URL::file("/App.app"));
+    EXPECT_EQ(ZBBundle::initWithExecutablePath(bundles, "/App.app/Run")->url(), URL::file("/App.app"));
+    EXPECT_EQ(ZBBundle::initWithExecutableURL(bundles, URL::file("/App.app/"))->executablePath(), "/App.app/Run");
     EXPECT_EQ(ZBBundle::initWithURL(bundles, URL::file("/Data.app"))->executablePath(), "/Data.app");
     const auto nowhere = ZBBundle::initWithQMXBundle(bundles.fromPath("/none", BundleMode::executable));
-    EXPECT_EQ(nowhere->url(), std::nullopt);
-    EXPECT_EQ(nowhere->executablePath(), std::nullopt);
+    EXPECT_FALSE(nowhere->url() || nowhere->executablePath());
 }
 
-TEST(Bundle, SupportPathIsKeptOnceKnown) {
+TEST(Bundle, KeepsItsSupportPathAndLogsThatThereIsNoInfoDictionary) {
     support::FakeBundles bundles;
-    auto& content = bundles.add("/App.app", {});
+    auto& content = bundles.add("/App.app", {{"VBBundleIdentifier", "org.example.app"}});
     const auto bundle = ZBBundle::initWithPath(bundles, "/App.app");
     content.hasSupportPath = false;
     EXPECT_EQ(bundle->plugInsPath(), std::nullopt);
@@ -36,23 +32,17 @@ TEST(Bundle, SupportPathIsKeptOnceKnown) {
     EXPECT_EQ(bundle->plugInsPath(), "/App.app/PlugIns");
     content.hasSupportPath = false;
     EXPECT_EQ(bundle->bundleDirectory(""), "/App.app");
-}
 
-TEST(Bundle, InfoDictionaryIsLoggedWhenThereIsNone) {
-    support::FakeBundles bundles;
-    auto& content = bundles.add("/App.app", {{"VBBundleIdentifier", "org.example.app"}});
-    const auto bundle = ZBBundle::initWithPath(bundles, "/App.app");
     processLog.clear();
     EXPECT_EQ(bundle->bundleIdentifier(), "org.example.app");
     content.manifest = {{"VBBundleIdentifier", 5}};
-    EXPECT_EQ(bundle->bundleIdentifier(), std::nullopt);
-    EXPECT_TRUE(processLog.lines().empty());
+    EXPECT_FALSE(bundle->bundleIdentifier() || !processLog.lines().empty());
     content.hasReadableManifest = false;
     EXPECT_EQ(bundle->bundleIdentifier(), std::nullopt);
-    for (const char* line : {"failed to retrieve Info.vlist for /App.app through <bundle /App.app>",
-                             "failed to convert Info.vlist to dictionary: /App.app source=(null)"}) {
-        EXPECT_TRUE(processLog.contains(LogLevel::info, "ops", line)) << line;
-    }
+    EXPECT_EQ(processLog.messages("ops"),
+              (std::vector<std::string>{"failed to retrieve Info.vlist for /App.app through <bundle /App.app>",
+                                        "failed to convert Info.vlist to dictionary: /App.app source=(null)"}));
+    EXPECT_EQ(processLog.lines().front().level, LogLevel::info);
 }
 
 } // namespace

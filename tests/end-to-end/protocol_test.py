@@ -1,128 +1,121 @@
-#!/usr/bin/env python3
-"""Every reply of the requests that the daemon serves, asked for by a client that shares no code with it."""
+"""Every reply of every request type, asked for by a client that shares no code with the daemon."""
 
+import concurrent.futures
 import os
 import unittest
 import uuid
 
-import bundles
 import qmx
 import scratch
+from scratch import error, manifest
 
+ALL, PLUG_INS = 0x200, 1  # flags of "match" and of "lock"
+NOWHERE = uuid.UUID("00000000-0000-4000-8000-000000000000")
 FORM_KEYS = {"hubProtocolVersion", "path", "systemResident", "identifier", "original-identifier", "version",
              "bundleInfo", "info", "uuid", "lastmodified", "annotations", "localizedFilevaneActionNames"}
+OPTIONAL_KEYS = {"containingPath", "extensions", "localizedDisplayName", "localizedShortName",
+                 "localizedContainingDisplayName"}
 
 
-class ProtocolTest(unittest.TestCase):
-    @classmethod
-    def setUpClass(cls):
-        cls.platform = scratch.Platform(samples=False)
-        cls.addClassCleanup(cls.platform.__exit__, None, None, None)
-        cls.app = bundles.application(cls.platform.root, "Paper", {
-            "Data.plugin": bundles.manifest("com.example.data", Shared=["."]),
-            "Other.plugin": bundles.manifest("com.example.other"),
-        })
-        cls.data = bundles.plugin_path(cls.app, "Data.plugin")
-        cls.other = bundles.plugin_path(cls.app, "Other.plugin")
-        cls.platform.start()
+class Protocol(scratch.Case):
+    def prepare(self):
+        self.app = self.application("Paper", {"Data.plugin": manifest("data", Shared=["."]),
+                                              "Other.plugin": manifest("other")})
+        self.data, self.other = self.app + "/PlugIns/Data.plugin", self.app + "/PlugIns/Other.plugin"
+        self.start()
 
-    @classmethod
-    def tearDownClass(cls):
-        cls.platform.stop()
+    def test_error_replies(self):
+        known, text = self.uuid(self.data), str(self.uuid(self.data))
+        empty, loop, endless = self.path("empty"), self.path("loop"), self.path("a/" * 3000)
+        os.makedirs(empty)
+        os.symlink("loop", loop)
+        malformed, unknown = "invalid request format", "no such plugin (uuid not found)"
+        rules, dictionary = malformed + " (bad rules dictionary)", malformed + " (bad annotations dictionary)"
+        one, election = {"uuids": [known]}, {"election": 1}
+        for kind, code, expected, *messages in (
+            ("bulk", 7, "unsupported protocol version 4 (current 3)", {"version": 4}),
+            # What is no unsigned number reads as none at all.
+            ("bulk", 7, "unsupported protocol version 0 (current 3)", {"version": "3"}, {"version": -3},
+             {"version": 3.0}, {"version": True}),
+            (4, 4, malformed + " (missing type)", {}),
+            ("Find", 4, "unrecognized request", {}),
+            ("find", 15, "Cannot locate PlugIn", {}, {"uuids": [known]}, {"uuids": text}, {"uuids": NOWHERE},
+             {"uuids": known, "paths": "file:///nowhere"}, {"paths": ["file://" + self.data]},
+             *({"paths": path} for path in (self.data, "https://example.com" + self.data, "", "file://%",
+                                            f"file://{self.data}%00", "file://" + "/x" * 100_000))),
+            ("add", 4, malformed, {}, {"paths": "text"}, {"paths": [5]}, {"paths": [self.data, {}]}),
+            ("add", 9, "absolute path required: x", {"paths": ["x"]}),
+            ("add", 9, "invalid plugin path: " + loop, {"paths": [loop]}),
+            ("add", 9, "invalid plugin path: " + endless, {"paths": [endless]}),
+            ("add", 2, "unable to register plug-in at " + empty, {"paths": [empty]}),
+            ("remove", 11, "caller lacks entitlement for this operation", {"paths": [self.data, self.other]}),
+            ("match", 4, rules, {"rules": "x"}, {"rules": []}, {"rules": 1}),
+            ("match", 11, "unauthorized discovery flag (ZBDiscoverAll)", {"flags": ALL}),
+            ("ready", 4, unknown, {"uuids": [NOWHERE]}),
+            ("access", 4, unknown, {"uuids": [NOWHERE]}),
+            ("annotate", 4, dictionary, one, {**one, "annotations": []}),
+            ("annotate", 4, malformed + " (annotation election)", {**one, "annotations": {"election": "1"}}),
+            ("annotate", 4, malformed + " (annotation extension)",
+             {**one, "annotations": {**election, "extension": 1}}),
+            ("annotate", 4, malformed + " (uuid)", {"uuids": known, "annotations": election}),
+            ("annotate", 4, "invalid request (bad uuid array)", {"uuids": [text], "annotations": election}),
+            ("annotate", 4, unknown, {"uuids": [NOWHERE], "paths": [self.data] * 2, "annotations": election},
+             {"uuids": [NOWHERE], "paths": ["/nowhere"], "annotations": election}),
+            ("bulk-annotate", 4, dictionary, {}, {"annotations": []}),
+            ("bulk-annotate", 18, "annotations values must be dictionaries", {"annotations": {text: 1}}),
+            ("bulk-annotate", 18, "invalid plug-in UUID value", {"annotations": {"x": {}}}),
+            ("bulk-annotate", 2, "no plug-in with the requested uuid", {"annotations": {str(NOWHERE): {}}}),
+            ("lock", 4, malformed, {}, {"paths": self.app}, {"paths": [1]}, {"uuids": NOWHERE}),
+            ("lock", 9, "absolute path required: x", {"paths": ["x"]}),
+            ("lock", 9, "invalid path: /nowhere", {"paths": [self.app, "/nowhere"]}),
+            ("lock", 9, "no plug-in at path:" + self.app, {"paths": [self.app], "flags": PLUG_INS}),
+        ):
+            for message in messages:
+                with self.subTest(f"{kind} {message}"[:200]):
+                    self.assertEqual(self.request(kind, **message), error(code, expected))
+        # Nothing was removed or elected, and nothing is held.
+        self.assertEqual(len(self.match(rules={"VKUserElection": "0"})), 2)
+        refusal = f"pid={os.getpid()} to remove plug-in at {self.data} - client lacks required entitlement"
+        self.wait_for_log("refused request from " + refusal)
 
-    def request(self, message, version=3):
-        if version is not None:
-            message = {**message, "version": version}
-        with qmx.Connection(self.platform.socket_path) as connection:
-            return connection.request(message)
-
-    def form(self, path):
-        return qmx.decode_matches(self.request({"request": "find", "paths": "file://" + path})["matches"])
-
-    def assert_error(self, reply, code, text):
-        self.assertEqual((reply.get("errorcode"), reply.get("error")), (code, text))
-        self.assertNotIn("matches", reply)
-
-    def assert_not_found(self, message, **more):
-        self.assert_error(self.request({"request": "find", **message, **more}), 15, "Cannot locate PlugIn")
-
-    def test_versions_and_types(self):
-        self.assert_error(self.request({"request": "bulk"}, 4), 7, "unsupported protocol version 4 (current 3)")
-        for version in (None, "3", -3, 3.0, True):  # what is no unsigned number reads as none at all
-            self.assert_error(self.request({"request": "bulk"}, version), 7, "unsupported protocol version 0 (current 3)")
-        for version in (2, 3):
-            self.assertEqual(self.request({"request": "bulk", "flags": 5}, version), {})
-        for message in ({}, {"request": 4}, {"request": ["find"]}):
-            self.assert_error(self.request(message), 4, "invalid request format (missing type)")
-        for kind in ("", "Find", "find ", "\u00e9", "x" * 100_000):
-            self.assert_error(self.request({"request": kind}), 4, "unrecognized request")
-
-    def test_find(self):
-        known = uuid.UUID(self.form(self.data)["uuid"])
-        for location, identifier in (({"uuids": known}, "com.example.data"),
-                                     ({"uuids": known, "paths": "file://" + self.other}, "com.example.other")):
-            matches = self.request({"request": "find", **location})["matches"]
-            self.assertEqual(qmx.decode_matches(matches)["identifier"], identifier)
-        self.assertEqual(self.request({"request": "find", "uuids": known}, 2), {})
-        for wrong in ({}, {"uuids": [known]}, {"uuids": str(known)}, {"uuids": uuid.uuid4()},
-                      {"uuids": known, "paths": "file:///nowhere"}):
-            self.assert_not_found(wrong)
-        for path in (["file://" + self.data], self.data, "https://example.com" + self.data, "", "file://%",
-                     "file://" + self.data + "%00", "file://" + "/x" * 100_000):
-            self.assert_not_found({"paths": path})
-
-    def test_the_form(self):
-        form = self.form(self.data)
-        self.assertEqual(set(form) ^ FORM_KEYS, {"containingPath", "extensions", "localizedDisplayName",
-                                                 "localizedShortName", "localizedContainingDisplayName"} & set(form))
-        known = {"path": self.data, "containingPath": self.app, "uuid": form["uuid"].upper(), "systemResident": False,
-                 "version": "1.0", "hubProtocolVersion": 2, "annotations": {}, "info": form["bundleInfo"]["VKExtension"]}
-        self.assertEqual({key: form[key] for key in known}, known)
+    def test_replies_of_success(self):
+        known, form = self.uuid(self.data), self.find(self.data)
+        for kind, message in (
+            ("bulk", {"version": 2}), ("bulk", {"flags": 5}), ("add", {"paths": []}),
+            ("add", {"paths": [self.data]}), ("remove", {"paths": []}), ("match", {"version": 2}),
+            ("find", {"version": 2, "uuids": known}), ("annotate", {"annotations": {"other": 1}}),
+            ("bulk-annotate", {"annotations": {}}), ("lock", {"uuids": [NOWHERE, "x", 1]}),
+            ("ready", {"uuids": [known]}),
+        ):
+            self.assertEqual(self.request(kind, **message), {}, (kind, message))
+        tokens = self.request("access", uuids=[known, NOWHERE], paths=["", self.other])["extensions"]
+        self.assertEqual(len(set(tokens)), 2)
+        for message in ({}, {"flags": "8"}, {"flags": -1}, {"rules": {}}):
+            self.assertEqual(len(self.match(**message)), 2, message)
+        self.assertEqual(qmx.decode(self.request("find", uuids=known)["matches"]), form)
+        self.assertEqual(set(form) - OPTIONAL_KEYS, FORM_KEYS)
+        info = form["bundleInfo"]["VKExtension"]
+        expected = {"path": self.data, "containingPath": self.app, "uuid": str(known).upper(), "info": info,
+                    "version": "1.0", "systemResident": False, "hubProtocolVersion": 2}
+        self.assertEqual({key: form[key] for key in expected}, expected)
         self.assertEqual(list(form["extensions"]), ["."])
         self.assertGreater(form["lastmodified"], 1_700_000_000)
 
-    def test_add(self):
-        outside = self.platform.path("elsewhere/Out.app")
-        bundles.write(outside + "/Info.vlist", {"VBBundleIdentifier": "com.example.out"})
-        plugin, link, empty, missing = (outside + name for name in ("/PlugIns/Out.plugin", "/link", "/empty", "/missing"))
-        bundles.write(plugin + "/Info.vlist", bundles.manifest("com.example.outplugin"))
-        os.symlink(plugin, link)
-        os.makedirs(empty)
-        self.assertEqual(self.request({"request": "add", "paths": []}), {})
-        self.assert_not_found({"paths": "file://" + plugin})
-        self.assert_error(self.request({"request": "add", "paths": [plugin, missing, self.data]}), 9,
-                          "invalid plugin path: " + missing)
-        self.assertEqual(self.form(plugin)["containingPath"], outside)  # what came before the failing path stays
-        self.assertEqual(self.request({"request": "add", "paths": [link]}), {})
-        self.assert_error(self.request({"request": "add", "paths": [empty]}), 2, "unable to register plug-in at " + empty)
-        for paths in ("text", [5], [plugin, {}]):
-            self.assert_error(self.request({"request": "add", "paths": paths}), 4, "invalid request format")
-        self.assert_error(self.request({"request": "add", "paths": ["Out.plugin"]}), 9,
-                          "absolute path required: Out.plugin")
+    def test_each_client_gets_its_own_replies_in_order(self):
+        known = self.uuid(self.data)
 
-    def test_remove_needs_the_manager_entitlement(self):
-        reply = self.request({"request": "remove", "paths": [self.data, self.other]})
-        self.assert_error(reply, 11, "caller lacks entitlement for this operation")
-        self.form(self.data)
-        self.assertEqual(self.request({"request": "remove", "paths": []}), {})
-        refusals = self.platform.wait_for_log(r"refused request from pid=(\d+) to remove plug-in at (\S+) - client lacks "
-                                              r"required entitlement")
-        self.assertEqual(refusals, [(str(os.getpid()), self.data)])
+        def ask(_):
+            with qmx.Connection(self.socket_path) as connection:
+                connection.send([1, 2, "no dictionary"])  # gets no reply
+                asked = [known, NOWHERE, known] * 333
+                ids = [connection.send({"request": "find", "version": 3, "uuids": i}) for i in asked]
+                replies = [connection.receive() for _ in ids]
+            self.assertEqual([answered for answered, _ in replies], ids)
+            self.assertEqual(["error" in reply for _, reply in replies], [i == NOWHERE for i in asked])
 
-    def test_requests_of_one_connection_are_answered_in_order(self):
-        with qmx.Connection(self.platform.socket_path) as connection:
-            known = uuid.UUID(self.form(self.data)["uuid"])
-            ids = [connection.send({"request": "find", "version": 3, "uuids": known if i % 3 else uuid.uuid4()})
-                   for i in range(3000)]
-            replies = [connection.receive() for _ in ids]
-        self.assertEqual([answered for answered, _ in replies], ids)
-        self.assertEqual(["matches" in reply for _, reply in replies], [bool(i % 3) for i in range(3000)])
-
-    def test_a_value_that_is_no_dictionary_gets_no_reply_and_costs_nothing(self):
-        with qmx.Connection(self.platform.socket_path) as connection:
-            connection.send([1, 2, "three"])
-            self.assertEqual(connection.request({"request": "bulk", "version": 3}), {})
-        self.platform.wait_for_log(rf"unexpected message: .* from: {os.getpid()}")
+        with concurrent.futures.ThreadPoolExecutor(8) as pool:
+            list(pool.map(ask, range(8)))  # raises what a thread raised
+        self.wait_for_log(rf"unexpected message: .* from: {os.getpid()}", 8)
 
 
 if __name__ == "__main__":

@@ -1,116 +1,101 @@
-"""A scratch platform for the end-to-end tests: real bundles below a temporary root and the real zbd process on it.
+"""A scratch platform for each test: bundles below a temporary root, the real zbd process, clients of it."""
 
-    with scratch.Platform() as platform:
-        platform.start()
-        platform.zbctl("find", platform.path("Applications/Editor.app/PlugIns/WordCount.appex"))
-        log = platform.stop()
-
-The build directory comes from the environment variable ZBD_BUILD.
-"""
-
-import contextlib
-import ctypes
+import json
 import os
 import re
-import select
 import shutil
-import signal
-import stat
 import subprocess
 import tempfile
+import threading
 import time
+import unittest
+import uuid
 
 import qmx
 
-SOURCE = os.path.dirname(os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
-BUILD = os.path.abspath(os.environ.get("ZBD_BUILD", os.path.join(SOURCE, "build", "release")))
+BUILD = os.path.abspath(os.environ.get("ZBD_BUILD", __file__ + "/../../../build/release"))
+ZBD, ZBCTL = BUILD + "/bin/zbd", BUILD + "/bin/zbctl"
 SERVICE = "com.nordane.zembra.zbd"
+MANAGER = "com.nordane.private.zembra.manager"
 DEADLINE = 60  # seconds; only ever reached by a failure, so it may be generous
 
-_IN_MODIFY, _IN_CREATE, _IN_MOVED_TO = 0x2, 0x100, 0x80
-_libc = ctypes.CDLL(None, use_errno=True)
+
+def vlist(value):
+    return b"vlist16\n" + qmx.encode(value)
 
 
-@contextlib.contextmanager
-def _changes(directory):
-    """Gives what waits for a change in `directory`, for some seconds at the most."""
-    descriptor = _libc.inotify_init1(os.O_CLOEXEC | os.O_NONBLOCK)
-    mask = _IN_MODIFY | _IN_CREATE | _IN_MOVED_TO
-    if descriptor < 0 or _libc.inotify_add_watch(descriptor, os.fsencode(directory), mask) < 0:
-        raise OSError(ctypes.get_errno(), "inotify on " + directory)
-
-    def wait(seconds):
-        if select.select([descriptor], [], [], seconds)[0]:
-            os.read(descriptor, 65536)
-
-    try:
-        yield wait
-    finally:
-        os.close(descriptor)
+def write(path, content):
+    """Replaces a file at once, by bytes or by the property list of a dictionary."""
+    os.makedirs(os.path.dirname(path), exist_ok=True)
+    with open(path + ".new", "wb") as file:
+        file.write(content if isinstance(content, bytes) else vlist(content))
+    os.rename(path + ".new", path)
 
 
-class Platform:
-    """One scratch root. Leaving the context kills what still runs and removes the directory."""
+def manifest(name, version="1.0", attributes=None, **extension):
+    """A well-configured data-only plug-in's; keywords replace or add entries of its plug-in dictionary."""
+    extension = {"VKExtensionPointIdentifier": "com.example.point", "VKExtensionProtocol": "#Data",
+                 "VKExtensionAttributes": {"VKExtensionVersion": version, **(attributes or {})}, **extension}
+    return {"VBBundleIdentifier": "com.example." + name, "VBBundleDisplayName": "com.example." + name,
+            "VBBundleVersion": "1", "VKExtension": extension}
 
-    def __init__(self, samples=True):
-        self.directory = os.path.realpath(tempfile.mkdtemp(prefix="zbd-test-"))
-        self.root = os.path.join(self.directory, "root")
-        self.log_path = os.path.join(self.directory, "zbd.log")
-        self.environment = {
-            **{name: value for name, value in os.environ.items() if not name.startswith(("NORDANE_", "LISTEN_"))},
-            "NORDANE_ROOT": self.root,
-        }
-        self.client_environment = dict(self.environment)
-        self.environment["NORDANE_LOG"] = "debug,private,stderr"
-        self.process = None
-        for directory in ("Applications", "System/Library/PlugIns", "var/db", "run/nordane"):
-            os.makedirs(self.path(directory))
-        if samples:
-            script = os.path.join(SOURCE, "samples", "layout.sh")
-            subprocess.run([script, BUILD, self.root], check=True, stdout=subprocess.DEVNULL)
 
-    def __enter__(self):
-        return self
+def error(code, text):
+    return {"errorcode": code, "error": text}
 
-    def __exit__(self, *_):
-        if self.process and self.process.poll() is None:
-            self.process.kill()
-            self.process.wait()
-        # A test may have taken its own rights away below the root.
-        for directory, names, _ in os.walk(self.directory):
-            for name in names:
-                path = os.path.join(directory, name)
-                if not os.path.islink(path):
-                    os.chmod(path, stat.S_IRWXU)
-        shutil.rmtree(self.directory)
+
+def names(forms):
+    return sorted(form["identifier"].removeprefix("com.example.") + " " + form["version"] for form in forms)
+
+
+class Case(unittest.TestCase):
+    """Each test has its own platform, which `prepare` furnishes; at its end zbd stops and all is removed."""
+
+    def setUp(self):
+        self.directory = os.path.realpath(self.enterContext(tempfile.TemporaryDirectory(prefix="zbd-test-")))
+        self.environment = {name: value for name, value in os.environ.items()
+                            if not name.startswith(("NORDANE_", "LISTEN_"))}
+        self.environment["NORDANE_ROOT"] = self.path("")
+        self.daemon_environment = {**self.environment, "NORDANE_LOG": "debug,private,stderr"}
+        self._logged = threading.Event()
+        for below in ("Applications", "var/db", "run/nordane"):
+            os.makedirs(self.path(below))
+        self.socket_path = self.path("run/nordane/" + SERVICE)
+        self.prepare()
+
+    def prepare(self):
+        """Before each test."""
 
     def path(self, below):
-        return os.path.join(self.root, below)
+        return os.path.join(self.directory, "root", below)
 
-    @property
-    def socket_path(self):
-        return self.path("run/nordane/" + SERVICE)
+    def application(self, name, plugins):
+        """Lays out an application, which appears as a whole; `plugins` maps bundles' names to manifests."""
+        aside, path = self.path("var/" + name), self.path(f"Applications/{name}.app")
+        write(aside + "/Info.vlist", {"VBBundleIdentifier": "com." + name, "VBBundleExecutable": "host"})
+        for plugin, content in plugins.items():
+            write(f"{aside}/PlugIns/{plugin}/Info.vlist", content)
+        os.rename(aside, path)
+        return path
 
-    def start(self, *options, service=SERVICE, wrapper=()):
-        """Starts zbd and returns when a connection to its socket is accepted by the system."""
-        assert self.process is None or self.process.poll() is not None, "one daemon at a time"
-        with _changes(self.path("run/nordane")) as wait:
-            with open(self.log_path, "ab") as log:
-                self.process = subprocess.Popen([*wrapper, os.path.join(BUILD, "bin", "zbd"), *options],
-                                                env=self.environment, stdin=subprocess.DEVNULL,
-                                                stdout=log, stderr=log)
-            # The event of the name; listening follows it without an event of its own.
-            self._until(lambda: self._listens(self.path("run/nordane/" + service)), lambda: wait(0.05), "zbd listens")
-        return self.process
+    # The daemon.
 
-    def _until(self, ask, wait, what):
-        """What `ask` answers once that is true; fails when zbd has ended or after a long time."""
-        deadline = time.monotonic() + DEADLINE
-        while not (answer := ask()):
-            if self.process.poll() is not None or time.monotonic() > deadline:
-                raise AssertionError(f"not seen: {what}; zbd's status is {self.process.returncode}:\n{self.log()}")
-            wait()
-        return answer
+    def start(self, *options, service=SERVICE):
+        """Starts zbd and returns when the system accepts connections to its socket."""
+        self.process = subprocess.Popen([ZBD, *options], stdin=subprocess.DEVNULL, stderr=subprocess.PIPE,
+                                        env=self.daemon_environment, text=True, errors="replace")
+        self._log = []
+        self._log_reader = threading.Thread(target=self._read_log, args=[self.process.stderr])
+        self._log_reader.start()
+        self.addCleanup(self.kill)
+        self.addCleanup(self._stop_if_running)
+        self._until(lambda: self._listens(self.path("run/nordane/" + service)), "zbd listens")
+
+    def _read_log(self, pipe):
+        with pipe:
+            for line in pipe:
+                self._log.append(line)
+                self._logged.set()
 
     @staticmethod
     def _listens(path):
@@ -120,45 +105,82 @@ class Platform:
         except (FileNotFoundError, ConnectionRefusedError):
             return False
 
-    def stop(self):
-        """SIGTERM, exit status 0, and the whole log."""
-        self.process.send_signal(signal.SIGTERM)
-        try:
-            status = self.process.wait(DEADLINE)
-        except subprocess.TimeoutExpired:
-            raise AssertionError("zbd does not stop:\n" + self.log()) from None
-        assert status == 0, f"zbd ended with {status}:\n{self.log()}"
-        return self.log()
-
-    def kill(self):
-        self.process.kill()
-        self.process.wait()
+    def _until(self, ask, what):
+        """What `ask` answers once that is true; fails when zbd has ended or after a long time."""
+        end = time.monotonic() + DEADLINE
+        while not (answer := ask()):
+            if not self._log_reader.is_alive() or time.monotonic() > end:
+                self.fail(f"not seen: {what}; zbd's status is {self.process.poll()}:\n{self.log()}")
+            self._logged.wait(0.05)  # listening is no event, so it is looked for as well
+            self._logged.clear()
+        return answer
 
     def log(self):
-        with open(self.log_path, encoding="utf-8", errors="replace") as log:
-            return log.read()
+        return "".join(self._log)
 
     def wait_for_log(self, pattern, count=1):
-        """Returns the matches once the log holds `count` of the regular expression; fails after a long time."""
+        """Returns the matches once the log holds `count` of the regular expression."""
         def found():
             matches = re.findall(pattern, self.log())
             return matches if len(matches) >= count else None
 
-        with _changes(self.directory) as wait:
-            return self._until(found, lambda: wait(1), f"{pattern!r} {count} times in the log")
+        return self._until(found, f"{pattern!r} {count} times in the log")
 
-    def run(self, *command, **options):
-        """Runs a client program on this platform; its output is captured as text."""
-        options = {"env": self.client_environment, "stdout": subprocess.PIPE, **options}
-        if "input" not in options:
-            options["stdin"] = subprocess.DEVNULL
-        return subprocess.run(command, stderr=subprocess.PIPE, text=True, errors="backslashreplace", timeout=DEADLINE,
-                              check=False, **options)
+    def stop(self):
+        """SIGTERM, exit status 0, and the whole log."""
+        self.process.terminate()
+        self.assertEqual(self.process.wait(DEADLINE), 0, self.log())
+        self._log_reader.join()
+        return self.log()
 
-    def zbctl(self, *arguments, program=None, **options):
-        return self.run(program or os.path.join(BUILD, "bin", "zbctl"), *arguments, **options)
+    def _stop_if_running(self):
+        if self.process.poll() is None:
+            self.stop()
+
+    def kill(self):
+        self.process.kill()
+        self.process.wait()
+        self._log_reader.join()
+
+    # Clients.
+
+    def request(self, kind, version=3, **message):
+        with qmx.Connection(self.socket_path) as connection:
+            return connection.request({"request": kind, "version": version, **message})
+
+    def find(self, path):
+        return qmx.decode(self.request("find", paths="file://" + path)["matches"])
+
+    def uuid(self, path):
+        return uuid.UUID(self.find(path)["uuid"])
+
+    def match(self, flags=0, **message):
+        return qmx.decode(self.request("match", flags=flags, **message)["matches"])
+
+    def run_program(self, *command, **options):
+        """Runs a client program on this platform; its outputs are captured as text."""
+        options = {"env": self.environment, "input": "", "stdout": subprocess.PIPE, **options}
+        return subprocess.run(command, stderr=subprocess.PIPE, text=True, errors="backslashreplace",
+                              timeout=DEADLINE, check=False, **options)
+
+    def zbctl(self, status, *arguments, program=ZBCTL, **options):
+        result = self.run_program(program, *arguments, **options)
+        self.assertEqual(result.returncode, status, (arguments, result.stdout, result.stderr))
+        return result
+
+    def zbctl_json(self, *arguments, **options):
+        return json.loads(self.zbctl(0, "--json", *arguments, **options).stdout)
 
     def start_zbctl(self, *arguments):
         """For a verb that runs on: the process, its outputs as text in pipes."""
-        return subprocess.Popen([os.path.join(BUILD, "bin", "zbctl"), *arguments], env=self.client_environment,
-                                stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        process = self.enterContext(subprocess.Popen([ZBCTL, *arguments], env=self.environment, text=True,
+                                                     stdout=subprocess.PIPE, stderr=subprocess.PIPE))
+        self.addCleanup(process.kill)
+        return process
+
+    def copy_of_zbctl(self, path, *signing):
+        """A host of its own there; `signing` gives it entitlements."""
+        shutil.copy(ZBCTL, path)
+        if self.run_program(ZBCTL, "sign", path, *signing).returncode != 0:
+            self.skipTest("the file system keeps no extended attributes")
+        return path

@@ -14,8 +14,8 @@ using platform::BundleProperty;
 using platform::Dictionary;
 using platform::Value;
 
-/// Bundles on disk.
 struct LinuxBundles {
+    /// Adds or replaces a bundle, its executable beside the manifest.
     void add(const std::string& name, const Dictionary& manifest, const std::string& executable = "") {
         std::string bytes(platform::compactMagic); // the other encoding is used in the cases for this implementation
         platform::appendCompact(bytes, manifest);
@@ -23,6 +23,7 @@ struct LinuxBundles {
         if (!executable.empty()) support::writeFile(path(name + "/" + executable), "program");
     }
     std::string path(const std::string& name) const { return scratch / name; }
+    auto bundle(const std::string& name) { return bundles.fromPath(path(name), BundleMode::directory); }
 
     support::ScratchDirectory scratch;
     platform::linux_::Files files{platform::linux_::Root("/")};
@@ -31,10 +32,11 @@ struct LinuxBundles {
 
 struct FakeBundles {
     void add(const std::string& name, const Dictionary& manifest, const std::string& executable = "") {
-        bundles.add(path(name), manifest,
-                    executable.empty() ? std::nullopt : std::optional(path(name + "/" + executable)));
+        const auto program = path(name + "/" + executable);
+        bundles.add(path(name), manifest, executable.empty() ? std::nullopt : std::optional(program));
     }
     std::string path(const std::string& name) const { return "/scratch/" + name; }
+    auto bundle(const std::string& name) { return bundles.fromPath(path(name), BundleMode::directory); }
 
     support::FakeBundles bundles;
 };
@@ -46,26 +48,21 @@ protected:
 using Worlds = testing::Types<LinuxBundles, FakeBundles>;
 TYPED_TEST_SUITE(BundlesConformance, Worlds);
 
-TYPED_TEST(BundlesConformance, DirectoryModeDescribesTheBundle) {
+TYPED_TEST(BundlesConformance, DirectoryModeDescribesWhatIsThere) {
     auto& here = this->world;
     here.add("A.app", {{"VBBundleIdentifier", "a"}, {"VBBundleExecutable", "bin/a"}}, "bin/a");
-    const auto bundle = here.bundles.fromPath(here.path("A.app") + "/", BundleMode::directory);
+    const auto bundle = here.bundle("A.app/");
     EXPECT_EQ(bundle->property(BundleProperty::path), here.path("A.app"));
     EXPECT_EQ(bundle->property(BundleProperty::supportPath), here.path("A.app"));
     EXPECT_EQ(bundle->property(BundleProperty::executablePath), here.path("A.app/bin/a"));
-    const auto identifier = [&] { return bundle->infoDictionary().value_or(Dictionary{})["VBBundleIdentifier"]; };
-    EXPECT_EQ(identifier(), Value("a"));
-
-    here.add("A.app", {{"VBBundleIdentifier", "b"}});
-    EXPECT_EQ(identifier(), Value("b")) << "the manifest is read anew";
-}
-
-TYPED_TEST(BundlesConformance, DirectoryModeOfNoBundleHasThePathAlone) {
-    const std::string path = this->world.path("nothing");
-    const auto bundle = this->world.bundles.fromPath(path, BundleMode::directory);
-    EXPECT_EQ(bundle->property(BundleProperty::path), path);
-    EXPECT_FALSE(bundle->property(BundleProperty::supportPath) || bundle->property(BundleProperty::executablePath) ||
-                 bundle->infoDictionary());
+    for (const char* identifier : {"a", "b"}) {
+        here.add("A.app", {{"VBBundleIdentifier", identifier}});
+        EXPECT_EQ(bundle->infoDictionary()->string("VBBundleIdentifier"), identifier) << "the manifest is read anew";
+    }
+    const auto none = here.bundle("nothing");
+    EXPECT_EQ(none->property(BundleProperty::path), here.path("nothing"));
+    EXPECT_FALSE(none->property(BundleProperty::supportPath) || none->property(BundleProperty::executablePath) ||
+                 none->infoDictionary());
 }
 
 TYPED_TEST(BundlesConformance, ExecutableModeFindsTheBundleAround) {
@@ -81,8 +78,9 @@ TYPED_TEST(BundlesConformance, ExecutableModeFindsTheBundleAround) {
         EXPECT_FALSE(pathOf(other)) << other;
 }
 
-TEST(BundlesExecutable, MustLieInsideTheBundle) {
-    LinuxBundles world;
+using BundlesOnLinux = BundlesConformance<LinuxBundles>;
+
+TEST_F(BundlesOnLinux, ExecutablesLieInsideTheBundle) {
     const std::string link = world.path("A.app/link");
     support::writeFile(world.path("outside"), "program");
     std::filesystem::create_directories(world.path("A.app/directory"));
@@ -90,36 +88,29 @@ TEST(BundlesExecutable, MustLieInsideTheBundle) {
     for (const Value& name : {Value("/bin/sh"), Value("../outside"), Value("link"), Value("missing"), Value("."),
                               Value(""), Value("directory"), Value(7)}) {
         world.add("A.app", {{"VBBundleExecutable", name}});
-        const auto bundle = world.bundles.fromPath(world.path("A.app"), BundleMode::directory);
-        EXPECT_FALSE(bundle->property(BundleProperty::executablePath)) << name.description();
+        EXPECT_FALSE(world.bundle("A.app")->property(BundleProperty::executablePath)) << name.description();
         EXPECT_FALSE(world.bundles.fromPath(link, BundleMode::executable)->property(BundleProperty::path));
     }
+    EXPECT_EQ(world.bundles.main()->property(BundleProperty::path),
+              std::filesystem::read_symlink("/proc/self/exe").string())
+        << "a program outside bundles";
 }
 
-TEST(BundlesManifest, UnusableOnesAreNone) {
-    LinuxBundles world;
-    const std::string manifest = world.path("A.app/Info.vlist");
-    const auto read = [&] {
-        return world.bundles.fromPath(world.path("A.app"), BundleMode::directory)->infoDictionary();
+TEST_F(BundlesOnLinux, UnusableManifestsAreNone) {
+    const auto read = [&](const Value& manifest) {
+        support::writeManifest(world.path("A.app"), manifest);
+        return world.bundle("A.app")->infoDictionary();
     };
-    platform::Value deepest = "core";
+    Value deepest = "core";
     for (std::size_t i = 0; i < platform::maximumManifestNesting; ++i) deepest = Dictionary{{"key", deepest}};
-    support::writeFile(manifest, *platform::encodeXML(deepest));
-    EXPECT_TRUE(read());
-    for (const Value& unusable : {Value(platform::Array{"no dictionary"}), Value(Dictionary{{"key", deepest}}),
-                                  Value(Dictionary{{"big", std::string(1U << 20U, 'x')}})}) {
-        support::writeFile(manifest, *platform::encodeXML(unusable));
-        EXPECT_FALSE(read()) << unusable.description().substr(0, 60);
-    }
+    EXPECT_TRUE(read(deepest));
+    EXPECT_FALSE(read(Dictionary{{"key", deepest}}));
+    EXPECT_FALSE(read(platform::Array{"no dictionary"}));
+    EXPECT_FALSE(read(Dictionary{{"big", std::string(1U << 20U, 'x')}}));
+    const std::string manifest = world.path("A.app/Info.vlist");
     std::filesystem::remove(manifest);
     ASSERT_EQ(mkfifo(manifest.c_str(), 0600), 0);
-    EXPECT_FALSE(read()) << "and does not wait for a writer";
-}
-
-TEST(BundlesMain, OfAProgramOutsideBundlesIsTheProgram) {
-    LinuxBundles world;
-    EXPECT_EQ(world.bundles.main()->property(BundleProperty::path),
-              std::filesystem::read_symlink("/proc/self/exe").string());
+    EXPECT_FALSE(world.bundle("A.app")->infoDictionary()) << "and does not wait for a writer";
 }
 
 } // namespace

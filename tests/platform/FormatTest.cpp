@@ -2,96 +2,73 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
-#include <limits>
 
 namespace {
 
 using namespace platform;
+using enum FormatFault;
 
 struct Described {
     mutable int asked = 0;
-    std::string description() const {
-        ++asked;
-        return "described";
-    }
+    std::string description() const { return "described " + std::to_string(++asked); }
 };
 enum class Choice : std::uint8_t { second = 1 };
 
 const UUID uuid = *UUID::parse("01234567-89AB-CDEF-0123-456789ABCDEF");
 
-// What must not compile. `formatFault` is what a `FormatString` asks.
-static_assert(formatFault<int>("%d%%") == FormatFault::none);
-static_assert(formatFault<>("%d") == FormatFault::tooFewArguments);
-static_assert(formatFault<int, int>("%d") == FormatFault::tooManyArguments);
-static_assert(formatFault<int>("%s") == FormatFault::wrongKindOfArgument);
-static_assert(formatFault<int>("%@") == FormatFault::wrongKindOfArgument);
-static_assert(formatFault<int>("%p") == FormatFault::wrongKindOfArgument);
-static_assert(formatFault<std::string>("%d") == FormatFault::wrongKindOfArgument);
-static_assert(formatFault<Described>("%s") == FormatFault::wrongKindOfArgument);
-static_assert(formatFault<std::string>("%{uuid_t}.16P") == FormatFault::wrongKindOfArgument);
-static_assert(formatFault<UUID>("%{uuid_t}.8P") == FormatFault::unknownConversion);
-static_assert(formatFault<UUID>("%.16P") == FormatFault::unknownOption);
-static_assert(formatFault<std::string>("%{errno}s") == FormatFault::unknownOption);
-static_assert(formatFault<std::string>("%{pubic}s") == FormatFault::unknownOption);
-static_assert(formatFault<std::string>("%{public@") == FormatFault::unknownOption);
-static_assert(formatFault<std::string>("%ls") == FormatFault::unknownConversion);
-static_assert(formatFault<double>("%f") == FormatFault::unknownConversion);
-static_assert(formatFault<int>("%") == FormatFault::unknownConversion);
-static_assert(formatFault<std::vector<int>>("%@") == FormatFault::unprintableArgument);
-static_assert(formatFault<std::optional<int>>("%@") == FormatFault::unprintableArgument);
+/// Whether a `FormatString`, which asks `formatFault`, would find this fault in each of the texts.
+template <class... Args> consteval bool have(FormatFault fault, std::initializer_list<std::string_view> texts) {
+    return std::ranges::all_of(texts, [=](auto text) { return formatFault<Args...>(text) == fault; });
+}
+
+// What must not compile.
+static_assert(have<int>(none, {"%d%%"}) && have<>(tooFewArguments, {"%d"}) && have<int, int>(tooManyArguments, {"%d"}));
+static_assert(have<int>(wrongKindOfArgument, {"%s", "%@", "%p"}) && have<Described>(wrongKindOfArgument, {"%s"}));
+static_assert(have<std::string>(wrongKindOfArgument, {"%d", "%{uuid_t}.16P"}));
+static_assert(have<std::string>(unknownOption, {"%{errno}s", "%{pubic}s", "%{public@"}));
+static_assert(have<UUID>(unknownOption, {"%.16P"}) && have<UUID>(unknownConversion, {"%{uuid_t}.8P"}));
+static_assert(have<std::string>(unknownConversion, {"%ls"}) && have<double>(unknownConversion, {"%f", "%"}));
+static_assert(have<std::vector<int>>(unprintableArgument, {"%@"}));
+static_assert(have<std::optional<int>>(unprintableArgument, {"%@"}));
 
 TEST(Format, IntegersOfEveryWidthKeepTheirValue) {
-    constexpr auto smallest = std::numeric_limits<std::int64_t>::min();
-    constexpr auto largest = std::numeric_limits<std::uint64_t>::max();
-    EXPECT_EQ(format("%d %i %lld %d", std::int8_t{-1}, -2, smallest, largest),
-              "-1 -2 -9223372036854775808 18446744073709551615");
-    EXPECT_EQ(format("%u %lu %llu %zu", std::uint16_t{65535}, 5L, largest, sizeof(char)),
-              "65535 5 18446744073709551615 1");
-    EXPECT_EQ(format("%u 0x%lx %llx %x", -1, 48879, largest, std::int8_t{-1}), "4294967295 0xbeef ffffffffffffffff ff");
-    EXPECT_EQ(format("%d %d %d", true, Choice::second, 'a'), "1 1 97");
-    EXPECT_EQ(format("%{errno}d", ENOENT), "[2: No such file or directory]");
-    EXPECT_EQ(format("no arguments, 100%%"), "no arguments, 100%");
+    EXPECT_EQ(format("%d %i %lld %d, 100%%", std::int8_t{-1}, -2, INT64_MIN, UINT64_MAX),
+              "-1 -2 -9223372036854775808 18446744073709551615, 100%");
+    EXPECT_EQ(format("%u %zu %u", std::uint16_t{65535}, sizeof(char), -1), "65535 1 4294967295");
+    EXPECT_EQ(format("0x%lx %llx %x", 48879, UINT64_MAX, std::int8_t{-1}), "0xbeef ffffffffffffffff ff");
+    EXPECT_EQ(format("%d %d %d %{errno}d", true, Choice::second, 'a', ENOENT), "1 1 97 [2: No such file or directory]");
 }
 
 TEST(Format, TextsAndObjectsPrintThemselves) {
-    const std::string text = "text";
-    const char* none = nullptr;
-    EXPECT_EQ(format("%s %s %s %s", text, std::string_view("view"), "literal", none), "text view literal (null)");
-    EXPECT_EQ(format("%@ %@ %s", text, std::optional<std::string>(), std::optional<std::string>("in")),
-              "text (null) in");
-    EXPECT_EQ(format("%@ %{uuid_t}.16P %{uuid_t}.16P", uuid, uuid, uuid.bytes),
-              "01234567-89AB-CDEF-0123-456789ABCDEF 01234567-89AB-CDEF-0123-456789ABCDEF "
-              "01234567-89AB-CDEF-0123-456789ABCDEF");
-    EXPECT_EQ(format("%@ %@", URL::file("/a b"), Error{"Domain", 4}), "file:///a%20b Domain error 4");
-    EXPECT_EQ(format("%@ %@ %@", Value("string"), Value(), Failure(Error{"D", 1, "failed"})), "string (null) failed");
-    const Array array{Value(1), Value("two")};
-    EXPECT_EQ(format("%@", array), Value(array).description());
-
+    const char* nothing = nullptr;
+    EXPECT_EQ(format("%s %s %s %s", std::string("text"), std::string_view("view"), "literal", nothing),
+              "text view literal (null)");
+    EXPECT_EQ(format("%@ %s", std::optional<std::string>(), std::optional<std::string>("in")), "(null) in");
+    EXPECT_EQ(format("%@, %{uuid_t}.16P, %{uuid_t}.16P", uuid, uuid, uuid.bytes),
+              uuid.text() + ", " + uuid.text() + ", " + uuid.text());
+    EXPECT_EQ(format("%@ %@ %@ %@ %@ %@", URL::file("/a b"), Error{"Domain", 4}, Failure(Error{"D", 1, "failed"}),
+                     Value("string"), Value(), Array{1, "two"}),
+              "file:///a%20b Domain error 4 failed string (null) (1, two)");
     const Described object;
     const auto shared = std::make_shared<const Described>();
-    const std::unique_ptr<Described> gone;
-    EXPECT_EQ(format("%@ %@ %@ %@ %@", object, &object, shared, gone, nullptr),
-              "described described described (null) (null)");
+    EXPECT_EQ(format("%@ %@ %@ %@ %@", object, &object, shared, std::unique_ptr<Described>(), nullptr),
+              "described 1 described 2 described 1 (null) (null)");
     EXPECT_EQ(format("%@ %@", std::vector<std::shared_ptr<const Described>>{shared, nullptr}, std::vector<UUID>()),
-              "(described, (null)) ()");
+              "(described 2, (null)) ()");
 }
 
 TEST(Format, AddressesAreThoseOfTheObjects) {
     const auto shared = std::make_shared<Described>();
     const std::string address = format("%p", static_cast<void*>(shared.get()));
-    EXPECT_EQ(address.substr(0, 2), "0x");
-    EXPECT_EQ(format("%p %p %p", shared, shared.get(), *shared), address + " " + address + " " + address);
-    EXPECT_EQ(format("%p", std::shared_ptr<Described>()), "(null)");
-    const std::string text = uuid.text();
-    EXPECT_EQ(format("(%public}@)", text), "(" + format("%p", static_cast<const void*>(&text)) + "ublic}@)");
+    EXPECT_EQ(format("%p %p %p", shared, *shared, std::shared_ptr<Described>()), address + " " + address + " (null)");
+    EXPECT_TRUE(address.starts_with("0x")) << address;
 }
 
 TEST(Format, LongListsAreCut) {
-    const std::vector<std::string> list(100'000, "an element");
-    const std::string text = format("%@", list);
-    EXPECT_LT(text.size(), maximumListDescription + 100);
-    EXPECT_TRUE(text.ends_with(", ...)"));
+    const std::string text = format("%@", std::vector<std::string>(100'000, "an element"));
+    EXPECT_TRUE(text.size() < maximumListDescription + 100 && text.ends_with(", ...)")) << text;
     // An earlier argument does not use up the room of a later one, and texts are never cut here.
     const std::string large(2 * maximumListDescription, 'x');
     EXPECT_EQ(format("%@%@", large, std::vector<std::string>{"a", "b"}), large + "(a, b)");
@@ -104,10 +81,9 @@ TEST(Format, HiddenArgumentsAreNotAskedForTheirText) {
                                                 FormatArgument(uuid)};
     constexpr std::string_view text = "%@ %{public}@ %s %{public}s %d %{private}d %{uuid_t}.16P";
     EXPECT_EQ(formatArguments(text, arguments, PrivateArguments::hidden),
-              "<private> described <private> text 7 <private> 01234567-89AB-CDEF-0123-456789ABCDEF");
-    EXPECT_EQ(object.asked, 1);
+              "<private> described 1 <private> text 7 <private> " + uuid.text());
     EXPECT_EQ(formatArguments(text, arguments, PrivateArguments::shown),
-              "described described text text 7 8 01234567-89AB-CDEF-0123-456789ABCDEF");
+              "described 2 described 3 text text 7 8 " + uuid.text());
 }
 
 } // namespace

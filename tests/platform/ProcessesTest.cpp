@@ -6,10 +6,10 @@
 #include "tests/support/ProcessesFake.h"
 #include "tests/support/ScratchDirectory.h"
 
-#include <gtest/gtest.h>
-
 #include <climits>
+#include <gtest/gtest.h>
 #include <sys/mount.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 
@@ -19,8 +19,6 @@ namespace fs = std::filesystem;
 namespace {
 
 constexpr std::size_t anySize = 2048;
-
-std::string ownPath() { return fs::read_symlink("/proc/self/exe").string(); }
 
 /// A token as the transport makes it for a peer that connects now.
 AuditToken tokenOf(pid_t pid) { return {pid, getuid(), getgid(), linux_::LinuxPeerProcess::look(pid)}; }
@@ -34,168 +32,129 @@ protected:
     /// As an installer does: replaces by another file at the same path.
     void install(const std::string& path) {
         fs::copy_file("/bin/cat", scratch / "next");
-        chmod((scratch / "next").c_str(), 0755);
         fs::rename(scratch / "next", path);
     }
     /// errno for the path of a process, 0 when it has one.
-    template <class Process> std::int64_t pathError(const Process& process) {
+    std::int64_t pathError(const auto& process) {
         const auto path = processes.executablePath(process, anySize);
         return path ? 0 : path.error().code;
     }
 
     support::ScratchDirectory scratch;
-    std::string program = scratch / "program";
+    const std::string program = scratch / "program";
     linux_::Processes processes;
 };
 
 class LinuxCodeSigning : public LinuxProcesses {
 protected:
     void SetUp() override {
-        auto failure = linux_::writeEntitlements(program, manager);
-        if (failure) GTEST_SKIP() << failure->text(); // no privilege, or no attributes here
+        if (const auto failure = linux_::writeEntitlements(program, manager))
+            GTEST_SKIP() << failure->text(); // no privilege, or no attributes here
     }
-    std::shared_ptr<SecTask> taskOf(pid_t pid) { return codeSigning.taskFromAuditToken(tokenOf(pid)); }
-    bool isBelieved(const std::string& path) {
-        auto entitlements = linux_::readEntitlements(path);
+    EntitlementValue entitlement(pid_t pid) {
+        return codeSigning.copyEntitlement(codeSigning.taskFromAuditToken(tokenOf(pid)), "manager");
+    }
+    static bool isBelieved(const std::string& path) {
+        const auto entitlements = linux_::readEntitlements(path);
         return entitlements && entitlements->has_value();
     }
 
     linux_::CodeSigning codeSigning;
-    const Dictionary manager{{"manager", true}, {"name", "any"}};
+    const Dictionary manager{{"manager", true}};
 };
 
-struct FakeSubject {
-    support::FakeProcesses processes;
-    FakeSubject() { processes.paths[getpid()] = ownPath(); }
-};
-struct LinuxSubject {
-    linux_::Processes processes;
-};
-template <class Subject> class ProcessesConformance : public testing::Test {
-protected:
-    Subject subject;
-};
-using Subjects = testing::Types<FakeSubject, LinuxSubject>;
-TYPED_TEST_SUITE(ProcessesConformance, Subjects);
-
-} // namespace
-
-TYPED_TEST(ProcessesConformance, PathFitsWithItsNulOrFails) {
-    platform::Processes& processes = this->subject.processes;
-    const std::string path = ownPath();
-    const AuditToken token = tokenOf(getpid());
-    EXPECT_EQ(*processes.executablePath(getpid(), path.size() + 1), path);
-    EXPECT_EQ(*processes.executablePath(token, path.size() + 1), path);
-    EXPECT_EQ(processes.executablePath(getpid(), path.size()).error().code, ENAMETOOLONG);
-    EXPECT_EQ(processes.executablePath(token, path.size()).error().code, ENAMETOOLONG);
-    for (std::int32_t nobody : {-1, 0, INT_MAX})
-        EXPECT_EQ(processes.executablePath(nobody, anySize).error().code, ESRCH) << nobody;
-    EXPECT_EQ(processes.executablePath(AuditToken(), anySize).error().code, ESRCH);
-    EXPECT_FALSE(processes.environmentVariable("ZBD_TEST_VARIABLE_THAT_IS_NOT_SET"));
+TEST(ProcessesConformance, PathFitsWithItsNulOrFails) {
+    support::FakeProcesses twin;
+    linux_::Processes real;
+    const std::string path = fs::read_symlink("/proc/self/exe").string();
+    twin.paths[getpid()] = path;
+    for (platform::Processes* processes :
+         {static_cast<platform::Processes*>(&twin), static_cast<platform::Processes*>(&real)}) {
+        const auto expect = [&](const auto& process, const auto& nobody) {
+            EXPECT_EQ(*processes->executablePath(process, path.size() + 1), path);
+            EXPECT_EQ(processes->executablePath(process, path.size()).error().code, ENAMETOOLONG);
+            EXPECT_EQ(processes->executablePath(nobody, anySize).error().code, ESRCH);
+        };
+        for (const std::int32_t nobody : {-1, 0, INT_MAX}) expect(getpid(), nobody);
+        expect(tokenOf(getpid()), AuditToken());
+        EXPECT_FALSE(processes->environmentVariable("ZBD_TEST_VARIABLE_THAT_IS_NOT_SET"));
+    }
 }
 
 TEST_F(LinuxProcesses, PathOfAProcessThatIsGoneIsNobodys) {
     support::WaitingProgram child(program);
-    ASSERT_TRUE(child.runs());
     const pid_t pid = child.pid();
     const AuditToken token = tokenOf(pid);
+    const int handle = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
     EXPECT_EQ(*processes.executablePath(token, anySize), program);
     kill(pid, SIGKILL);
     siginfo_t ended{};
     ASSERT_EQ(waitid(P_PID, static_cast<id_t>(pid), &ended, WEXITED | WNOWAIT), 0); // a zombie has no program either
-    EXPECT_EQ(pathError(pid), ESRCH);
-    EXPECT_EQ(pathError(token), ESRCH);
+    EXPECT_TRUE(pathError(pid) == ESRCH && pathError(token) == ESRCH);
     child.end();
-    EXPECT_EQ(pathError(pid), ESRCH);
-    EXPECT_EQ(pathError(token), ESRCH);
-}
-
-TEST_F(LinuxProcesses, TokenDoesNotFitAnotherPid) {
-    support::WaitingProgram gone(program);
-    support::WaitingProgram other(program);
+    EXPECT_TRUE(pathError(pid) == ESRCH && pathError(token) == ESRCH);
     // As if the pid had been used again: the number of a living process, the handle of one that has ended.
-    int handle = static_cast<int>(syscall(SYS_pidfd_open, gone.pid(), 0));
-    gone.end();
-    EXPECT_FALSE(linux_::LinuxPeerProcess::look(other.pid(), linux_::Descriptor(handle)));
+    EXPECT_FALSE(linux_::LinuxPeerProcess::look(getpid(), linux_::Descriptor(handle)));
 }
 
 TEST_F(LinuxProcesses, DeletedAndReplacedProgramsHaveNoPath) {
-    support::WaitingProgram child(program);
+    const support::WaitingProgram child(program);
     fs::remove(program);
     EXPECT_EQ(pathError(child.pid()), ENOENT);
     const std::string odd = program + " (deleted)"; // the text that the kernel gives names this file now
     install(odd);
     EXPECT_EQ(pathError(child.pid()), ENOENT);
-    support::WaitingProgram oddlyNamed(odd);
+    const support::WaitingProgram oddlyNamed(odd);
     EXPECT_EQ(*processes.executablePath(oddlyNamed.pid(), anySize), odd);
     install(odd);
     EXPECT_EQ(pathError(oddlyNamed.pid()), ENOENT);
     EXPECT_EQ(pathError(tokenOf(oddlyNamed.pid())), ENOENT);
 }
 
-TEST_F(LinuxProcesses, MountNamespaceOfItsOwnLendsNoPath) {
-    const std::string own = scratch / "own";
-    install(own);
-    support::WaitingProgram child(program, [&] {
-        return unshare(CLONE_NEWNS) == 0 && mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
-               mount(own.c_str(), program.c_str(), nullptr, MS_BIND, nullptr) == 0;
-    });
-    if (!child.runs()) GTEST_SKIP() << "may not mount";
-    ASSERT_EQ(fs::read_symlink("/proc/" + std::to_string(child.pid()) + "/exe"), program);
-    EXPECT_EQ(pathError(child.pid()), ENOENT);
-}
-
 TEST_F(LinuxCodeSigning, EntitlementsAreThoseOfTheProgramThatConnected) {
     support::WaitingProgram child(program);
-    auto task = taskOf(child.pid());
-    auto unasked = taskOf(child.pid());
+    const auto task = codeSigning.taskFromAuditToken(tokenOf(child.pid()));
+    const auto unasked = codeSigning.taskFromAuditToken(tokenOf(child.pid()));
     install(program); // without entitlements; what runs has them
+    const support::WaitingProgram unsignedChild(program);
     EXPECT_EQ(codeSigning.copyEntitlement(task, "manager").value, Value(true));
-    auto absent = codeSigning.copyEntitlement(task, "other");
-    EXPECT_FALSE(absent.value || absent.error);
     child.end();
-    EXPECT_EQ(codeSigning.copyEntitlement(task, "name").value, Value("any")) << "read once";
-    EXPECT_EQ(codeSigning.copyEntitlement(unasked, "name").error->code, ESRCH);
-    support::WaitingProgram unsignedChild(program);
-    absent = codeSigning.copyEntitlement(taskOf(unsignedChild.pid()), "manager");
-    EXPECT_FALSE(absent.value || absent.error);
+    EXPECT_EQ(codeSigning.copyEntitlement(task, "manager").value, Value(true)) << "read once";
+    EXPECT_EQ(codeSigning.copyEntitlement(unasked, "manager").error->code, ESRCH);
+    for (const auto& absent : {codeSigning.copyEntitlement(task, "other"), entitlement(unsignedChild.pid())})
+        EXPECT_FALSE(absent.value || absent.error);
 }
 
 // The trick of connecting as oneself and then becoming a program that has entitlements.
 TEST_F(LinuxCodeSigning, AnotherProgramInTheSameProcessLendsNothing) {
-    int go[2];
-    int became[2]; // closed by the exec
-    ASSERT_TRUE(pipe2(go, O_CLOEXEC) == 0 && pipe2(became, O_CLOEXEC) == 0);
-    pid_t child = fork();
+    int ends[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
+    const pid_t child = fork();
+    char letter = 0;
     if (child == 0) {
-        char letter = 0;
-        (void)!read(go[0], &letter, 1);
-        dup2(go[0], STDIN_FILENO);
-        close(go[1]);
-        execl(program.c_str(), program.c_str(), nullptr);
+        dup2(ends[1], STDIN_FILENO);
+        dup2(ends[1], STDOUT_FILENO);
+        if (read(STDIN_FILENO, &letter, 1) == 1) execl(program.c_str(), program.c_str(), nullptr);
         _exit(1);
     }
+    close(ends[1]);
     const AuditToken token = tokenOf(child);
-    auto task = codeSigning.taskFromAuditToken(token);
-    ASSERT_EQ(write(go[1], "x", 1), 1);
-    close(became[1]);
-    char none = 0;
-    ASSERT_EQ(read(became[0], &none, 1), 0);
-    auto result = codeSigning.copyEntitlement(task, "manager");
+    ASSERT_EQ(write(ends[0], "xy", 2), 2);
+    ASSERT_EQ(read(ends[0], &letter, 1), 1) << "the program gives back what it is given";
+    const auto result = codeSigning.copyEntitlement(codeSigning.taskFromAuditToken(token), "manager");
     EXPECT_TRUE(result.error && !result.value);
     EXPECT_EQ(pathError(token), ESRCH);
-    EXPECT_TRUE(codeSigning.copyEntitlement(taskOf(child), "manager").value) << "a connection of its own has them";
-    for (int descriptor : {go[0], go[1], became[0]}) close(descriptor);
-    kill(child, SIGKILL);
+    EXPECT_TRUE(entitlement(child).value) << "a connection of its own has them";
+    close(ends[0]); // ends the program
     waitpid(child, nullptr, 0);
 }
 
 TEST_F(LinuxCodeSigning, BrokenEntitlementsAndUnknownProcessesAreErrors) {
-    support::WaitingProgram child(program);
+    const support::WaitingProgram child(program);
     const char* name = geteuid() == 0 ? linux_::entitlementsAttribute : linux_::userEntitlementsAttribute;
     for (std::string_view broken : {"", "garbage", "<vlist version=\"1.0\"><array/></vlist>"}) {
         ASSERT_EQ(setxattr(program.c_str(), name, broken.data(), broken.size(), 0), 0);
-        auto result = codeSigning.copyEntitlement(taskOf(child.pid()), "manager");
+        const auto result = entitlement(child.pid());
         EXPECT_TRUE(result.error && !result.value) << broken;
     }
     EXPECT_FALSE(codeSigning.taskFromAuditToken({getpid(), getuid(), getgid(), nullptr}));
@@ -203,19 +162,17 @@ TEST_F(LinuxCodeSigning, BrokenEntitlementsAndUnknownProcessesAreErrors) {
 }
 
 TEST_F(LinuxCodeSigning, AttributeIsBelievedOnlyWhereItsSignerVouchesForTheBytes) {
-    const bool isRoot = geteuid() == 0;
-    const std::pair<mode_t, bool> modes[] = {{0511, true}, {0775, false}, {0757, false}, {0722, false}, {0755, true}};
-    for (const auto& [mode, believed] : modes) {
-        ASSERT_EQ(chmod(program.c_str(), mode), 0);
+    for (const auto& [mode, believed] : {std::pair(0511U, true), {0775U, false}, {0757U, false}, {0755U, true}}) {
+        chmod(program.c_str(), mode);
         EXPECT_EQ(isBelieved(program), believed) << std::oct << mode;
-        if (mode == 0511 && !isRoot) continue; // to be read, not to be signed anew
-        EXPECT_EQ(!linux_::writeEntitlements(program, manager), believed) << std::oct << mode;
+        const bool isWritten = mode != 0511 && !linux_::writeEntitlements(program, manager);
+        EXPECT_EQ(isWritten, believed && mode != 0511) << std::oct << mode;
     }
     // Copies, as anybody can make them, carry nothing.
     const std::string copy = scratch / "copy";
     fs::copy_file(program, copy);
     EXPECT_FALSE(isBelieved(copy));
-    if (!isRoot) return;
+    if (geteuid() != 0) return;
 
     // root's daemon: not another user's file, not the attribute that its owner can write. One user's daemon: that
     // attribute, on that user's files alone, and what root signed.
@@ -226,18 +183,19 @@ TEST_F(LinuxCodeSigning, AttributeIsBelievedOnlyWhereItsSignerVouchesForTheBytes
     EXPECT_FALSE(isBelieved(program));
     EXPECT_EQ(isBelievedByUser(program), 1);
     const std::string bytes = *encodeXML(Value(manager));
-    ASSERT_EQ(setxattr(copy.c_str(), linux_::userEntitlementsAttribute, bytes.data(), bytes.size(), 0), 0);
-    EXPECT_FALSE(isBelieved(copy));
-    EXPECT_EQ(isBelievedByUser(copy), 0);
-    ASSERT_EQ(setxattr(copy.c_str(), linux_::entitlementsAttribute, bytes.data(), bytes.size(), 0), 0);
-    EXPECT_EQ(isBelievedByUser(copy), 1);
+    for (const auto& [name, believed] :
+         {std::pair(linux_::userEntitlementsAttribute, false), {linux_::entitlementsAttribute, true}}) {
+        ASSERT_EQ(setxattr(copy.c_str(), name, bytes.data(), bytes.size(), 0), 0);
+        EXPECT_EQ(isBelieved(copy), believed) << name;
+        EXPECT_EQ(isBelievedByUser(copy), int{believed}) << name;
+    }
 }
 
 // A stick or a FUSE file system that a user may mount claims any owner and any attribute.
 TEST_F(LinuxCodeSigning, FileSystemWithoutPrivilegesLendsNone) {
     if (geteuid() != 0) GTEST_SKIP() << "for root's daemon";
     const char* directory = scratch.path().c_str();
-    int result = support::resultInChild([&] {
+    const int result = support::resultInChild([&] {
         if (unshare(CLONE_NEWNS) != 0 || mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
             mount(directory, directory, nullptr, MS_BIND, nullptr) != 0 || !isBelieved(program) ||
             mount("none", directory, nullptr, MS_REMOUNT | MS_BIND | MS_NOSUID, nullptr) != 0)
@@ -247,3 +205,5 @@ TEST_F(LinuxCodeSigning, FileSystemWithoutPrivilegesLendsNone) {
     if (result == 9) GTEST_SKIP() << "may not mount";
     EXPECT_EQ(result, 0);
 }
+
+} // namespace

@@ -5,7 +5,6 @@
 #include "tests/support/RegistryFake.h"
 #include "tests/support/ScratchDirectory.h"
 
-#include <algorithm>
 #include <gtest/gtest.h>
 
 // What every registry does, on the one in memory and on the one on disk.
@@ -13,163 +12,123 @@
 namespace {
 
 using namespace platform;
+using Identifiers = std::vector<std::string>;
+using Strings = std::map<std::string, std::string>;
+using support::plugInInfo;
 
-/// A registry with two plug-ins in one application and one on the system volume.
-class World {
-public:
-    virtual ~World() = default;
-    virtual Registry& registry() = 0;
-    virtual std::string application() const = 0;
-    virtual std::string systemPlugIn() const = 0;
-    virtual void installOneMore() = 0;
-    virtual void allowRegistration() = 0;
-    std::string plugIn(const std::string& name) const { return application() + "/PlugIns/" + name + ".appex"; }
-};
+const Strings greeting{{"greeting", "Hello"}};
+const Dictionary pointDictionary{{"key", "value"}};
 
-const std::string greeting = "greeting";
+// Each has two plug-ins in one application and one on the system volume.
 
-class MemoryWorld final : public World {
-public:
+struct MemoryWorld {
     MemoryWorld() {
-        auto record = std::make_shared<const ApplicationRecord>(ApplicationRecord{
-            .bundleURL = URL::file(application()), .bundleIdentifier = "app", .localizedName = std::nullopt});
+        const auto record =
+            std::make_shared<const ApplicationRecord>(ApplicationRecord{URL::file(application), {}, {}});
         for (const char* name : {"b", "a"})
-            _registry.install({.path = plugIn(name), .info = support::plugInInfo(name), .containingBundle = record});
-        _registry.install({.path = systemPlugIn(), .info = support::plugInInfo("system"), .onSystemPartition = true});
-        _registry.setStringTable(systemPlugIn(), "Localizable", {{greeting, "Hello"}});
-        _registry.setSDKDictionary("point", Dictionary{{"key", "value"}});
+            registry.install({.path = plugIns + name, .info = plugInInfo(name), .containingBundle = record});
+        registry.install({.path = systemPlugIn, .info = plugInInfo("system"), .onSystemPartition = true});
+        registry.setStringTable(systemPlugIn, "Localizable", greeting);
+        registry.setSDKDictionary("point", pointDictionary);
     }
-    Registry& registry() override { return _registry; }
-    std::string application() const override { return "/Applications/One.app"; }
-    std::string systemPlugIn() const override { return "/System/Library/PlugIns/system.plugin"; }
-    void installOneMore() override { _registry.install({.path = plugIn("c"), .info = support::plugInInfo("c")}); }
-    void allowRegistration() override {
-        _registry.allowRegistration();
-        _registry.onUnregister([this](const URL& url) { _registry.uninstall(*_registry.plugInForURL(url)->uuid); });
+    void allowRegistration() {
+        registry.allowRegistration();
+        registry.onUnregister([this](const URL& url) { registry.uninstall(*registry.plugInForURL(url)->uuid); });
     }
 
-private:
-    support::FakeRegistry _registry;
+    const std::string application = "/Applications/One.app";
+    const std::string plugIns = application + "/PlugIns/";
+    const std::string systemPlugIn = "/System/Library/PlugIns/system.plugin";
+    support::FakeRegistry registry;
 };
 
-class DiskWorld final : public World {
-public:
+struct DiskWorld {
     DiskWorld() {
-        support::writeApplication(application(), {"b", "a"});
-        support::writeManifest(systemPlugIn(), support::plugInInfo("system"));
-        support::writeFile(systemPlugIn() + "/Resources/en/Localizable.vlist",
-                           *encodeXML(Dictionary{{greeting, "Hello"}}));
-        support::writeFile(_scratch / "System/Library/SDKs/point.vlist", *encodeXML(Dictionary{{"key", "value"}}));
-        _registry.emplace(linux_::Root(_scratch.path()), _locale, _containers);
+        support::writeApplication(application);
+        for (const char* name : {"b", "a"}) support::writeManifest(plugIns + name, plugInInfo(name));
+        support::writeManifest(systemPlugIn, plugInInfo("system"));
+        support::writeFile(systemPlugIn + "/Resources/en/Localizable.vlist",
+                           *encodeXML(Dictionary{{"greeting", "Hello"}}));
+        support::writeFile(scratch / "System/Library/SDKs/point.vlist", *encodeXML(pointDictionary));
+        registry.settle();
     }
-    Registry& registry() override { return *_registry; }
-    std::string application() const override { return _scratch / "Applications/One.app"; }
-    std::string systemPlugIn() const override { return _scratch / "System/Library/PlugIns/system.plugin"; }
-    void installOneMore() override {
-        support::writeManifest(plugIn("c"), support::plugInInfo("c"));
-        _registry->settle();
-    }
-    void allowRegistration() override {}
+    void allowRegistration() {}
 
-private:
-    support::ScratchDirectory _scratch;
-    support::FakeLocale _locale;
-    linux_::Containers _containers{linux_::Root(_scratch.path())};
-    std::optional<linux_::Registry> _registry;
+    support::ScratchDirectory scratch;
+    const std::string application = scratch / "Applications/One.app";
+    const std::string plugIns = application + "/PlugIns/";
+    const std::string systemPlugIn = scratch / "System/Library/PlugIns/system.plugin";
+    support::FakeLocale locale;
+    linux_::Containers containers{linux_::Root(scratch.path())};
+    linux_::Registry registry{linux_::Root(scratch.path()), locale, containers};
 };
 
-class AnyRegistry : public testing::TestWithParam<bool> {
+template <class World> class AnyRegistry : public testing::Test {
 protected:
-    std::unique_ptr<World> world =
-        GetParam() ? std::unique_ptr<World>(new DiskWorld) : std::unique_ptr<World>(new MemoryWorld);
-    Registry& registry = world->registry();
+    World world;
+    const URL a = URL::file(world.plugIns + "a");
 };
+using Worlds = testing::Types<MemoryWorld, DiskWorld>;
+TYPED_TEST_SUITE(AnyRegistry, Worlds);
 
-INSTANTIATE_TEST_SUITE_P(Registries, AnyRegistry, testing::Bool(),
-                         [](const auto& world) { return world.param ? "Disk" : "Memory"; });
-
-std::vector<std::string> identifiers(const std::vector<PlugInProxyRef>& proxies) {
-    std::vector<std::string> names;
-    for (const auto& proxy : proxies) names.push_back(proxy->plugInIdentifier.value_or("none"));
+Identifiers identifiers(const std::vector<PlugInProxyRef>& proxies) {
+    Identifiers names;
+    for (const auto& proxy : proxies) names.push_back(proxy ? *proxy->plugInIdentifier : "none");
     return names;
 }
 
-TEST_P(AnyRegistry, InstalledPlugInsAreOrderedAndFoundByUUID) {
-    const auto installed = registry.installedPlugIns();
-    ASSERT_TRUE(installed);
-    ASSERT_EQ(installed->size(), 3U);
-    EXPECT_TRUE(std::ranges::is_sorted(*installed, {}, [](const auto& proxy) { return proxy->uuid; }));
-    for (const auto& proxy : *installed) {
-        ASSERT_NE(registry.plugInForUUID(*proxy->uuid), nullptr);
-        EXPECT_EQ(registry.plugInForUUID(*proxy->uuid)->plugInIdentifier, proxy->plugInIdentifier);
-    }
+TYPED_TEST(AnyRegistry, LookUpsFindWhatIsInstalled) {
+    const auto& here = this->world;
+    Registry& registry = this->world.registry;
+    const auto installed = *registry.installedPlugIns();
+    EXPECT_EQ(installed.size(), 3U);
+    EXPECT_TRUE(std::ranges::is_sorted(installed, {}, [](const auto& proxy) { return proxy->uuid; }));
+    for (const auto& proxy : installed)
+        EXPECT_EQ(identifiers({registry.plugInForUUID(*proxy->uuid)}), identifiers({proxy}));
     EXPECT_EQ(registry.plugInForUUID(UUID::random()), nullptr);
+    const auto isNotA = [](const auto& identifier, const auto&) { return identifier != "a"; };
+    const auto kept = identifiers(*registry.plugInsMatching({}, isNotA));
+    EXPECT_EQ(std::multiset(kept.begin(), kept.end()), (std::multiset<std::string>{"b", "system"}));
 
-    const auto kept =
-        registry.plugInsMatching({}, [](const auto& identifier, const auto&) { return identifier != "a"; });
-    ASSERT_TRUE(kept);
-    auto names = identifiers(*kept);
-    std::ranges::sort(names);
-    EXPECT_EQ(names, (std::vector<std::string>{"b", "system"})) << "what the filter keeps";
-}
-
-TEST_P(AnyRegistry, PlugInForURLTakesFileURLsOfPlugInsOnly) {
-    const std::string path = world->plugIn("a");
-    for (const auto& url : {URL::file(path), URL::file(path + "/")}) {
-        ASSERT_NE(registry.plugInForURL(url), nullptr) << url.absoluteString();
-        EXPECT_EQ(registry.plugInForURL(url)->plugInIdentifier, "a");
-    }
-    for (const auto& url : {URL::file(path + "x"), URL::file(world->application()), *URL::parse("https://host" + path)})
+    const std::string path = here.plugIns + "a";
+    EXPECT_EQ(identifiers({registry.plugInForURL(this->a), registry.plugInForURL(URL::file(path + "/"))}),
+              (Identifiers{"a", "a"}));
+    for (const auto& url : {URL::file(path + "x"), URL::file(here.application), *URL::parse("https://host" + path)})
         EXPECT_EQ(registry.plugInForURL(url), nullptr) << url.absoluteString();
-}
 
-TEST_P(AnyRegistry, ApplicationGivesItsPlugInsInTheOrderOfTheirPaths) {
-    const auto application = registry.applicationForURL(URL::file(world->application()));
+    const auto application = registry.applicationForURL(URL::file(here.application));
     ASSERT_NE(application, nullptr);
     EXPECT_TRUE(application->isApplication);
-    EXPECT_EQ(identifiers(registry.plugInsOfApplication(*application)), (std::vector<std::string>{"a", "b"}));
-    const auto inside = registry.plugInForURL(URL::file(world->plugIn("a")));
+    EXPECT_EQ(identifiers(registry.plugInsOfApplication(*application)), (Identifiers{"a", "b"})) << "by their paths";
+    EXPECT_EQ(registry.applicationForURL(URL::file(here.application + "x")), nullptr);
+    EXPECT_TRUE(registry.plugInsOfApplication(ApplicationRecord{URL::file("/none.app"), {}, {}}).empty());
+    const auto inside = registry.plugInForURL(this->a);
     EXPECT_EQ(inside->containingBundle->bundleURL, application->bundleURL);
     EXPECT_FALSE(inside->onSystemPartition);
-    EXPECT_EQ(registry.applicationForURL(URL::file(world->application() + "x")), nullptr);
-    EXPECT_TRUE(registry.plugInsOfApplication(ApplicationRecord{URL::file("/none.app"), {}, {}}).empty());
-
-    const auto outside = registry.plugInForURL(URL::file(world->systemPlugIn()));
-    ASSERT_NE(outside, nullptr);
+    const auto outside = registry.plugInForURL(URL::file(here.systemPlugIn));
     EXPECT_TRUE(outside->onSystemPartition);
     EXPECT_EQ(outside->containingBundle, nullptr);
+
+    EXPECT_EQ(registry.localizedStrings(*outside, {"greeting", "none"}, "Localizable"), greeting);
+    EXPECT_EQ(registry.localizedStrings(*outside, {"greeting"}, "Other"), Strings());
+    EXPECT_EQ(registry.sdkDictionary("point"), pointDictionary);
+    EXPECT_FALSE(registry.sdkDictionary("other"));
 }
 
-TEST_P(AnyRegistry, KnowledgeChangesWithTheDataAndOnlyThen) {
-    const auto before = registry.knowledgeUUID();
+TYPED_TEST(AnyRegistry, WhatIsUnregisteredIsGoneAndChangesTheKnowledge) {
+    Registry& registry = this->world.registry;
+    const auto uuid = *registry.plugInForURL(this->a)->uuid;
+    const auto knowledge = registry.knowledgeUUID();
     const auto sequence = registry.knowledgeSequenceNumber();
-    (void)registry.installedPlugIns();
-    registry.clearSchemaCaches();
-    EXPECT_EQ(registry.knowledgeUUID(), before);
-    world->installOneMore();
-    EXPECT_NE(registry.knowledgeUUID(), before);
-    EXPECT_GT(registry.knowledgeSequenceNumber(), sequence);
-    EXPECT_NE(registry.plugInForURL(URL::file(world->plugIn("c"))), nullptr);
-}
-
-TEST_P(AnyRegistry, RegistrationIsRefusedAndUnregisteredIsGone) {
     EXPECT_FALSE(registry.registerPlugIn(URL::file("/nowhere.appex")));
     EXPECT_FALSE(registry.unregisterPlugIn(URL::file("/nowhere.appex")));
-    world->allowRegistration();
-    const auto uuid = *registry.plugInForURL(URL::file(world->plugIn("a")))->uuid;
-    EXPECT_TRUE(registry.unregisterPlugIn(URL::file(world->plugIn("a"))));
-    EXPECT_EQ(registry.plugInForURL(URL::file(world->plugIn("a"))), nullptr);
+    EXPECT_EQ(registry.knowledgeUUID(), knowledge);
+    this->world.allowRegistration();
+    EXPECT_TRUE(registry.unregisterPlugIn(this->a));
+    EXPECT_EQ(registry.plugInForURL(this->a), nullptr);
     EXPECT_EQ(registry.plugInForUUID(uuid), nullptr);
-}
-
-TEST_P(AnyRegistry, StringsAndSDKsAreFoundByName) {
-    const auto proxy = registry.plugInForURL(URL::file(world->systemPlugIn()));
-    using Strings = std::map<std::string, std::string>;
-    EXPECT_EQ(registry.localizedStrings(*proxy, {greeting, "none"}, "Localizable"), (Strings{{greeting, "Hello"}}));
-    EXPECT_EQ(registry.localizedStrings(*proxy, {greeting}, "Other"), Strings());
-    ASSERT_TRUE(registry.sdkDictionary("point"));
-    EXPECT_EQ(registry.sdkDictionary("point")->string("key"), "value");
-    EXPECT_FALSE(registry.sdkDictionary("other"));
+    EXPECT_NE(registry.knowledgeUUID(), knowledge);
+    EXPECT_GT(registry.knowledgeSequenceNumber(), sequence);
 }
 
 } // namespace

@@ -16,18 +16,18 @@ namespace {
 
 using platform::Array;
 using platform::Dictionary;
-using Types = std::map<std::string, std::vector<std::string>>;
+using Types = std::map<std::string, std::set<std::string>>;
 
-class LinuxTypes {
-public:
-    void write(const std::string& name, const std::string& bytes) const {
-        umask(022); // what a group could write is not believed
-        support::writeFile(scratch / name, bytes);
+struct LinuxTypes {
+    LinuxTypes() { umask(022); } // what a group could write is not believed
+    void write(const std::string& name, const std::string& bytes) const { support::writeFile(scratch / name, bytes); }
+    void write(const std::string& name, const Dictionary& types, const Dictionary& aliases = {}) const {
+        write(name, *platform::encodeXML(Dictionary{{"types", types}, {"aliases", aliases}}));
     }
     void declare(const Types& types) {
         platform::MutableDictionary entries;
         for (const auto& [type, supertypes] : types) entries.set(type, Array::of(supertypes));
-        write(system, *platform::encodeXML(Dictionary{{"types", entries}}));
+        write(system, entries);
         load();
     }
     void load() {
@@ -40,12 +40,10 @@ public:
     std::unique_ptr<platform::TypeConformance> conformance;
 };
 
-class FakeTypes {
-public:
+struct FakeTypes {
     void declare(const Types& types) const {
-        for (const auto& [type, supertypes] : types) {
+        for (const auto& [type, supertypes] : types)
             for (const auto& supertype : supertypes) conformance->declare(type, supertype);
-        }
     }
     std::unique_ptr<support::FakeTypeConformance> conformance = std::make_unique<support::FakeTypeConformance>();
 };
@@ -62,20 +60,17 @@ TYPED_TEST(TypeConformanceConformance, FollowsEverySupertypeUpwardsOnly) {
                    {"text", {"data"}},
                    {"egg", {"hen"}},
                    {"hen", {"egg", "data"}}});
-    const std::map<std::string, std::set<std::string>> expected{{"svg", {"svg", "image", "xml", "text", "data"}},
-                                                                {"image", {"image", "data"}},
-                                                                {"hen", {"hen", "egg", "data"}},
-                                                                {"egg", {"hen", "egg", "data"}},
-                                                                {"data", {"data"}},
-                                                                {"SVG", {"SVG"}},
-                                                                {"unknown", {"unknown"}}};
-    for (const auto& [type, supertypes] : expected) {
+    for (const auto& [type, supertypes] : Types{{"svg", {"svg", "image", "xml", "text", "data"}},
+                                                {"hen", {"hen", "egg", "data"}},
+                                                {"egg", {"hen", "egg", "data"}},
+                                                {"data", {"data"}},
+                                                {"SVG", {"SVG"}},
+                                                {"unknown", {"unknown"}}}) {
         const auto found = world.conformance->supertypes(type);
         EXPECT_EQ(found.front(), type);
         EXPECT_EQ(std::multiset(found.begin(), found.end()), std::multiset(supertypes.begin(), supertypes.end()));
-        for (const char* super : {"svg", "image", "xml", "text", "data", "egg", "hen", "Data", "unknown", ""}) {
+        for (const char* super : {"svg", "image", "xml", "text", "data", "egg", "hen", "Data", "unknown", ""})
             EXPECT_EQ(world.conformance->conforms(type, super), supertypes.contains(super)) << type << " to " << super;
-        }
     }
 }
 
@@ -85,28 +80,21 @@ TEST(TypeConformanceOnLinux, FilesAddUpAndDoWithoutTheRefused) {
     EXPECT_FALSE(world.conformance->conforms("a", "b"));
     EXPECT_EQ(support::processLog.lines().size(), 1U) << "no types at all";
 
-    const auto table = [](const char* type) {
-        return *platform::encodeXML(Dictionary{{"types", Dictionary{{type, Array{"other"}}, {"wrong", 1}}}});
-    };
+    const std::string folder = "etc/nordane/types.d";
     world.declare({{"png", {"image"}}});
-    world.write("etc/nordane/types.d/1.vlist",
-                *platform::encodeXML(Dictionary{{"types", Dictionary{{"png", Array{"texture"}}}},
-                                                {"aliases", Dictionary{{"image/png", "png"}}}}));
-    world.write("etc/nordane/types.d/2.vlist", "<vlist>");
-    world.write("etc/nordane/types.d/3.vlist", table("unsafe"));
-    world.write("etc/nordane/types.d/4.vlist", table("last"));
-    chmod((world.scratch / "etc/nordane/types.d/3.vlist").c_str(), 0666);
+    world.write(folder + "/1.vlist", {{"png", Array{"texture"}}}, {{"image/png", "png"}});
+    world.write(folder + "/2.vlist", "<vlist>");
+    world.write(folder + "/3.vlist", {{"unsafe", Array{"other"}}});
+    world.write(folder + "/4.vlist", {{"last", Array{"other"}}, {"wrong", 1}});
+    chmod((world.scratch / folder + "/3.vlist").c_str(), 0666);
     world.load();
-    for (const char* type : {"png", "image/png"}) {
-        for (const char* super : {"png", "image/png", "image", "texture"}) {
+    for (const char* type : {"png", "image/png"})
+        for (const char* super : {"png", "image/png", "image", "texture"})
             EXPECT_TRUE(world.conformance->conforms(type, super)) << type << " to " << super;
-        }
-    }
     EXPECT_TRUE(world.conformance->conforms("last", "other"));
     EXPECT_FALSE(world.conformance->conforms("unsafe", "other"));
     EXPECT_EQ(support::processLog.lines().size(), 3U) << "two files, and the type whose supertypes are no array";
-
-    chmod((world.scratch / "etc/nordane/types.d").c_str(), 0777);
+    chmod((world.scratch / folder).c_str(), 0777);
     world.load();
     EXPECT_FALSE(world.conformance->conforms("last", "other"));
 }
@@ -128,16 +116,13 @@ TEST(TypeConformanceOnLinux, TheShippedTableIsWhole) {
     LinuxTypes world;
     world.write(world.system, bytes);
     world.load();
-    const auto table = platform::decodePropertyList(bytes);
-    ASSERT_TRUE(table);
-    const auto types = *table->dictionary()->dictionary("types");
+    const auto types = *platform::decodePropertyList(bytes)->dictionary()->dictionary("types");
     for (const auto& type : types) {
         EXPECT_TRUE(world.conformance->conforms(type.name(), "nordane.type.data") ||
                     world.conformance->conforms(type.name(), "nordane.type.folder"))
             << type.name();
-        for (const auto& super : world.conformance->supertypes(type.name())) {
+        for (const auto& super : world.conformance->supertypes(type.name()))
             EXPECT_TRUE(types.contains(super) || super.find('/') != std::string::npos) << super;
-        }
     }
     EXPECT_TRUE(world.conformance->conforms("image/svg+xml", "nordane.type.text"));
 }

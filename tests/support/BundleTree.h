@@ -4,9 +4,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <string>
-#include <string_view>
-#include <utility>
 
 namespace support {
 

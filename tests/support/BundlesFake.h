@@ -3,15 +3,16 @@
 #include "platform/Bundles.h"
 
 #include <map>
-#include <memory>
-#include <optional>
-#include <string>
 #include <utility>
 
 namespace support {
 
 /// Bundles in memory. Nothing is a bundle until it is added; any other path has its path and nothing more.
 class FakeBundles final : public platform::Bundles {
+    using BundleRef = std::shared_ptr<const platform::BundleObject>;
+    using Property = platform::BundleProperty;
+    using Mode = platform::BundleMode;
+
 public:
     struct Content {
         platform::Dictionary manifest;
@@ -32,23 +33,17 @@ public:
     /// The running program.
     std::string mainExecutable = "/usr/bin/program";
 
-    std::shared_ptr<const platform::BundleObject> main() override {
-        auto bundle = fromPath(mainExecutable, platform::BundleMode::executable);
-        if (bundle->property(platform::BundleProperty::path)) return bundle;
-        return fromPath(mainExecutable, platform::BundleMode::directory);
+    BundleRef main() override {
+        auto bundle = fromPath(mainExecutable, Mode::executable);
+        return bundle->property(Property::path) ? bundle : fromPath(mainExecutable, Mode::directory);
     }
-
-    std::shared_ptr<const platform::BundleObject> fromPath(const std::string& path,
-                                                           platform::BundleMode mode) override {
-        if (mode == platform::BundleMode::directory) {
-            std::string trimmed = path;
-            while (trimmed.size() > 1 && trimmed.back() == '/') trimmed.pop_back();
-            const auto found = _bundles.find(trimmed);
-            return std::make_shared<Object>(trimmed, found == _bundles.end() ? nullptr : found->second);
+    BundleRef fromPath(const std::string& path, Mode mode) override {
+        if (mode == Mode::directory) {
+            const std::string trimmed = path.ends_with('/') ? path.substr(0, path.size() - 1) : path;
+            return std::make_shared<Object>(trimmed, _bundles.contains(trimmed) ? _bundles[trimmed] : nullptr);
         }
-        for (const auto& [directory, content] : _bundles) {
+        for (const auto& [directory, content] : _bundles)
             if (content->executablePath == path) return std::make_shared<Object>(directory, content);
-        }
         return std::make_shared<Object>(std::nullopt, nullptr);
     }
 
@@ -58,15 +53,14 @@ private:
         Object(std::optional<std::string> path, std::shared_ptr<const Content> content)
             : _path(std::move(path)), _content(std::move(content)) {}
 
-        std::optional<std::string> property(platform::BundleProperty property) const override {
-            if (property == platform::BundleProperty::path) return _path;
+        std::optional<std::string> property(Property property) const override {
+            if (property == Property::path) return _path;
             if (!_content) return std::nullopt;
-            if (property == platform::BundleProperty::executablePath) return _content->executablePath;
+            if (property == Property::executablePath) return _content->executablePath;
             return _content->hasSupportPath ? _path : std::nullopt;
         }
         std::optional<platform::Dictionary> infoDictionary() const override {
-            if (!_content || !_content->hasReadableManifest) return std::nullopt;
-            return _content->manifest;
+            return _content && _content->hasReadableManifest ? std::optional(_content->manifest) : std::nullopt;
         }
         std::string description() const override { return "<bundle " + _path.value_or("none") + ">"; }
 

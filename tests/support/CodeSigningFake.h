@@ -4,7 +4,6 @@
 
 #include <cerrno>
 #include <map>
-#include <optional>
 
 namespace support {
 
@@ -21,9 +20,9 @@ public:
 
     platform::EntitlementValue copyEntitlement(const std::shared_ptr<platform::SecTask>& task,
                                                const std::string& name) override {
-        auto known = std::dynamic_pointer_cast<Task>(task);
+        const auto known = std::dynamic_pointer_cast<Task>(task);
         if (!known) return {platform::Value(), platform::Error{platform::posixErrorDomain, EINVAL, "no task"}};
-        auto granted = entitlements.find(known->pid);
+        const auto granted = entitlements.find(known->pid);
         return {granted == entitlements.end() ? platform::Value() : granted->second[name], failure};
     }
 

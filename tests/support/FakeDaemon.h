@@ -40,14 +40,12 @@ struct FakeDaemon {
     /// The reply to `message` over `connection`; none when there was none.
     std::optional<platform::Dictionary> ask(const std::shared_ptr<platform::Connection>& connection,
                                             const platform::Dictionary& message) {
-        auto answer = std::make_shared<std::optional<platform::Dictionary>>();
+        auto answer = std::make_shared<platform::ReplyOrError>(platform::TransportError{});
         connection->sendWithReply(message, fake.queues.makeSerial("replies"),
-                                  [answer](const platform::ReplyOrError& reply) {
-                                      if (const auto* content = std::get_if<platform::Dictionary>(&reply))
-                                          *answer = *content;
-                                  });
+                                  [answer](const platform::ReplyOrError& reply) { *answer = reply; });
         fake.transport.deliver();
-        return *answer;
+        const auto* content = std::get_if<platform::Dictionary>(answer.get());
+        return content != nullptr ? std::optional(*content) : std::nullopt;
     }
 
     /// The same over a connection of its own, in the current version.

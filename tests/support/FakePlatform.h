@@ -24,6 +24,20 @@
 
 namespace support {
 
+/// A manifest with what every plug-in states, and its plug-in dictionary.
+inline platform::Dictionary manifestOf(const std::string& identifier, platform::Dictionary extension) {
+    return {{"VBBundleIdentifier", identifier}, {"VBBundleVersion", "1"}, {"VKExtension", extension}};
+}
+
+/// A well-configured data-only plug-in on the system volume.
+inline FakePlugIn dataPlugIn(const std::string& name, const std::string& version = "1.0") {
+    return {.path = "/System/Library/PlugIns/" + name + ".plugin",
+            .info = manifestOf("com.example." + name,
+                               {{"VKExtensionProtocol", "#Data"},
+                                {"VKExtensionAttributes", platform::Dictionary{{"VKExtensionVersion", version}}}}),
+            .onSystemPartition = true};
+}
+
 /// The whole platform in memory: what the daemon is constructed on in unit tests. Queues run their items in place.
 /// Only what the daemon cannot start without is allowed: a place for the annotation file, and the container that older
 /// annotations are looked for in.
@@ -47,10 +61,7 @@ struct FakePlatform {
     FakeActivationRules activationRules;
     FakePrivacyConsent privacyConsent;
     FakeProcessAssertions processAssertions;
-    platform::Platform platform{queues,          runLoop,         transport,      registry,         serviceManager,
-                                sandbox,         codeSigning,     bundles,        interfaces,       preferences,
-                                containers,      notifications,   locale,         processes,        files,
-                                typeConformance, activationRules, privacyConsent, processAssertions};
+    platform::Platform platform = with(queues, transport);
 
     FakePlatform() {
         files.addDirectory("/var/db");
@@ -59,27 +70,18 @@ struct FakePlatform {
         processLog.clear();
     }
 
-    /// This platform, but with services that do their work on other threads.
-    platform::Platform with(platform::WorkQueues& otherQueues, platform::Transport& otherTransport,
-                            platform::Notifications& otherNotifications) {
-        return {otherQueues, runLoop,         otherTransport,  registry,       serviceManager,     sandbox, codeSigning,
-                bundles,     interfaces,      preferences,     containers,     otherNotifications, locale,  processes,
+    /// A data plug-in of that name, installed.
+    platform::PlugInProxyRef install(const std::string& name, std::optional<platform::Dictionary> entitlements = {}) {
+        auto plugIn = dataPlugIn(name);
+        plugIn.entitlements = std::move(entitlements);
+        return registry.install(plugIn);
+    }
+    /// This platform, but with queues and a transport that do their work on other threads.
+    platform::Platform with(platform::WorkQueues& otherQueues, platform::Transport& otherTransport) {
+        return {otherQueues, runLoop,         otherTransport,  registry,       serviceManager,   sandbox, codeSigning,
+                bundles,     interfaces,      preferences,     containers,     notifications,    locale,  processes,
                 files,       typeConformance, activationRules, privacyConsent, processAssertions};
     }
 };
-
-/// The text of a file URL, or a path: what most tests say of a plug-in.
-inline platform::Dictionary manifestOf(const std::string& identifier, platform::Dictionary extension) {
-    return {{"VBBundleIdentifier", identifier}, {"VBBundleVersion", "1"}, {"VKExtension", extension}};
-}
-
-/// A well-configured data-only plug-in on the system volume.
-inline FakePlugIn dataPlugIn(const std::string& name) {
-    return {.path = "/System/Library/PlugIns/" + name + ".plugin",
-            .info = manifestOf("com.example." + name,
-                               {{"VKExtensionProtocol", "#Data"},
-                                {"VKExtensionAttributes", platform::Dictionary{{"VKExtensionVersion", "1.0"}}}}),
-            .onSystemPartition = true};
-}
 
 } // namespace support

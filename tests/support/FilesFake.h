@@ -2,11 +2,9 @@
 
 #include "platform/Files.h"
 
-#include <cstdint>
 #include <map>
 #include <optional>
 #include <set>
-#include <string>
 
 namespace support {
 
@@ -22,10 +20,9 @@ public:
     std::optional<platform::Error> readFailure;
     std::optional<platform::Error> writeFailure;
     std::optional<platform::Error> setAsideFailure;
-    std::optional<platform::Error> realPathFailure;
     int writes = 0; // attempts, failed ones too
 
-    void addDirectory(const std::string& path) { _directories[path] = true; }
+    void addDirectory(const std::string& path) { _directories.insert(path); }
     /// From now on peers of that user reach everything here; others reach nothing.
     void allowPeers(std::uint32_t user) { _users.insert(user); }
 
@@ -33,9 +30,9 @@ public:
 
     platform::Result<std::string> read(const std::string& path, std::size_t limit) override {
         if (readFailure) return *readFailure;
-        std::string target = follow(path);
+        const std::string target = follow(path);
         if (_directories.contains(target)) return error(platform::fileReadUnknownCode, "Is a directory");
-        auto file = files.find(target);
+        const auto file = files.find(target);
         if (file == files.end()) return error(platform::fileReadNoSuchFileCode, "No such file or directory");
         if (file->second.size() > limit) return error(platform::fileReadTooLargeCode, "too large");
         return file->second;
@@ -44,10 +41,9 @@ public:
     platform::Failure writeAtomically(const std::string& path, std::string_view bytes) override {
         ++writes;
         if (writeFailure) return writeFailure;
-        std::string target = follow(path);
-        if (_directories.contains(target)) return error(platform::fileWriteUnknownCode, "Is a directory");
-        if (!_directories.contains(target.substr(0, target.rfind('/'))))
-            return error(platform::fileWriteUnknownCode, "No such file or directory");
+        const std::string target = follow(path);
+        if (_directories.contains(target) || !_directories.contains(target.substr(0, target.rfind('/'))))
+            return error(platform::fileWriteUnknownCode, "no file, or nothing to hold it");
         files[target] = bytes;
         return std::nullopt;
     }
@@ -63,14 +59,12 @@ public:
     }
 
     platform::Result<std::string> realPath(const std::string& path, std::size_t limit) override {
-        if (realPathFailure) return *realPathFailure;
         std::string target = follow(path);
         if (!files.contains(target) && !_directories.contains(target))
             return error(platform::fileReadNoSuchFileCode, "No such file or directory");
         if (target.size() >= limit) return error(platform::fileReadUnknownCode, "File name too long");
         return target;
     }
-
     platform::Result<std::string> realPath(const std::string& path, std::size_t limit,
                                            const platform::AuditToken& peer) override {
         if (!_users.contains(peer.uid)) return error(platform::fileReadNoPermissionCode, "Permission denied");
@@ -85,7 +79,7 @@ private:
         return path;
     }
 
-    std::map<std::string, bool> _directories;
+    std::set<std::string> _directories;
     std::set<std::uint32_t> _users;
 };
 

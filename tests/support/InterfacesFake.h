@@ -2,11 +2,6 @@
 
 #include "platform/linux/Interfaces.h"
 
-#include <memory>
-#include <set>
-#include <string>
-#include <utility>
-
 namespace support {
 
 /// The table of interfaces, which is memory in the real service too, with failures on demand. It starts empty, so every

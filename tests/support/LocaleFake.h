@@ -3,12 +3,6 @@
 #include "platform/Locale.h"
 #include "platform/linux/QueuedObservers.h"
 
-#include <memory>
-#include <mutex>
-#include <string>
-#include <utility>
-#include <vector>
-
 namespace support {
 
 /// The languages that the test sets; "en" alone at first. Callable from any thread.

@@ -2,11 +2,9 @@
 
 #include <chrono>
 #include <condition_variable>
-#include <cstddef>
 #include <deque>
 #include <mutex>
 #include <optional>
-#include <utility>
 
 namespace support {
 

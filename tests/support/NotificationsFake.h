@@ -3,10 +3,6 @@
 #include "platform/Notifications.h"
 #include "platform/linux/QueuedObservers.h"
 
-#include <memory>
-#include <mutex>
-#include <string>
-#include <utility>
 #include <vector>
 
 namespace support {

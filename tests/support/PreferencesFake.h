@@ -3,7 +3,6 @@
 #include "platform/Preferences.h"
 
 #include <map>
-#include <string>
 
 namespace support {
 
@@ -20,15 +19,12 @@ public:
 
     void addDomain(const std::string& domain) override { _read.try_emplace(domain); }
     bool synchronize(const std::string& domain) override {
-        const auto found = _read.find(domain);
-        if (found == _read.end() || isUnreadable) return false;
-        found->second = _stored[domain];
+        if (!_read.contains(domain) || isUnreadable) return false;
+        _read[domain] = _stored[domain];
         return true;
     }
     platform::Value value(const std::string& domain, const std::string& key) override {
-        const auto found = _read.find(domain);
-        if (found == _read.end() || !found->second.contains(key)) return {};
-        return found->second.at(key);
+        return _read.contains(domain) ? _read[domain][key] : platform::Value();
     }
 
 private:

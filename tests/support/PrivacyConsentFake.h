@@ -3,9 +3,6 @@
 #include "platform/PrivacyConsent.h"
 
 #include <map>
-#include <optional>
-#include <string>
-#include <vector>
 
 namespace support {
 
@@ -26,23 +23,20 @@ public:
     void flushBundleCaches(const platform::BundleObject& bundle) override { _told.erase(pathOf(bundle)); }
     std::optional<std::vector<platform::ConsentRecord>>
     informationForBundle(const platform::BundleObject& bundle) override {
-        const std::string path = pathOf(bundle);
-        asked.push_back(path);
+        asked.push_back(pathOf(bundle));
         const auto manifest = bundle.infoDictionary();
         const auto identifier = manifest ? manifest->string("VBBundleIdentifier") : std::nullopt;
         if (isUnavailable || !identifier) return std::nullopt;
-        return _told.try_emplace(path, _decided[std::string(*identifier)]).first->second;
+        return _told.try_emplace(asked.back(), _decided[std::string(*identifier)]).first->second;
     }
 
 private:
-    using Records = std::vector<platform::ConsentRecord>;
-
     static std::string pathOf(const platform::BundleObject& bundle) {
         return bundle.property(platform::BundleProperty::path).value_or("");
     }
 
-    std::map<std::string, Records> _decided;
-    std::map<std::string, Records> _told;
+    std::map<std::string, std::vector<platform::ConsentRecord>> _decided;
+    std::map<std::string, std::vector<platform::ConsentRecord>> _told;
 };
 
 } // namespace support

@@ -4,7 +4,6 @@
 
 #include <cerrno>
 #include <map>
-#include <string>
 
 namespace support {
 
@@ -13,23 +12,21 @@ class FakeProcesses final : public platform::Processes {
 public:
     std::map<std::int32_t, std::string> paths;
     std::map<std::string, std::string> environment;
-    std::uint32_t user = 1000;
 
     platform::Result<std::string> executablePath(std::int32_t pid, std::size_t bufferSize) override {
-        auto path = paths.find(pid);
+        const auto path = paths.find(pid);
         if (path == paths.end()) return platform::Error{platform::posixErrorDomain, ESRCH, "No such process"};
-        if (path->second.size() >= bufferSize)
-            return platform::Error{platform::posixErrorDomain, ENAMETOOLONG, "File name too long"};
-        return path->second;
+        if (path->second.size() < bufferSize) return path->second;
+        return platform::Error{platform::posixErrorDomain, ENAMETOOLONG, "File name too long"};
     }
     platform::Result<std::string> executablePath(const platform::AuditToken& peer, std::size_t bufferSize) override {
         return executablePath(peer.pid, bufferSize);
     }
     std::optional<std::string> environmentVariable(const std::string& name) override {
-        auto variable = environment.find(name);
+        const auto variable = environment.find(name);
         return variable == environment.end() ? std::nullopt : std::optional(variable->second);
     }
-    std::uint32_t currentUser() override { return user; }
+    std::uint32_t currentUser() override { return 1000; }
 };
 
 } // namespace support

@@ -27,4 +27,10 @@ private:
     std::string _path;
 };
 
+/// Moves what is at `path` aside and puts a symbolic link to it there.
+inline void putBehindLink(const std::string& path) {
+    std::filesystem::rename(path, path + ".moved");
+    std::filesystem::create_symlink(path + ".moved", path);
+}
+
 } // namespace support

@@ -2,12 +2,14 @@
 
 #include "platform/ServiceManager.h"
 
+#include <atomic>
 #include <cerrno>
 #include <deque>
 #include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
 #include <string>
 #include <utility>
 #include <vector>
@@ -27,51 +29,38 @@ public:
     };
 
     /// From now on services are added, and removals are done: they end the instances of `addInstance`.
-    void allow() {
-        const std::lock_guard lock(_mutex);
-        _isAllowed = true;
-    }
+    void allow() { _isAllowed = true; }
+    /// Answers additions with `number`, and nothing is added; 0 ends it.
+    void failAdditions(int number) { _additionFailure = number; }
+    /// From now on answers wait for `answer`.
+    void holdAnswers() { _isHolding = true; }
     void addInstance(const std::string& bundleIdentifier, const std::string& version) {
         const std::lock_guard lock(_mutex);
-        ++_instances[{bundleIdentifier, version}];
-    }
-    /// Answers additions with `number`, and nothing is added; 0 ends it.
-    void failAdditions(int number) {
-        const std::lock_guard lock(_mutex);
-        _additionFailure = number;
-    }
-    /// Every service that was added, in order.
-    std::vector<ExternalService> additions() const {
-        const std::lock_guard lock(_mutex);
-        return _additions;
+        _instances.insert({bundleIdentifier, version});
     }
     /// Answers removals of this service with `result`, and nothing is ended.
     void fail(const std::string& bundleIdentifier, const std::string& version, int result) {
         const std::lock_guard lock(_mutex);
         _failures[{bundleIdentifier, version}] = result;
     }
-    /// From now on answers wait for `answer`.
-    void holdAnswers() {
+    /// Every service that was added, in order.
+    std::vector<ExternalService> additions() const {
         const std::lock_guard lock(_mutex);
-        _isHolding = true;
-    }
-    /// Gives the oldest answer that waits. False when none does.
-    bool answer() {
-        const std::lock_guard lock(_mutex);
-        if (_held.empty()) return false;
-        const Answer oldest = std::move(_held.front());
-        _held.pop_front();
-        oldest.send(oldest.result);
-        return true;
+        return _additions;
     }
     /// Every removal asked for.
     std::vector<Service> removals() const {
         const std::lock_guard lock(_mutex);
         return _removals;
     }
-
-    ~FakeServiceManager() override {
-        for (const auto& answer : _held) answer.send(ECANCELED);
+    /// Gives the oldest answer that waits. False when none does.
+    bool answer() {
+        const std::lock_guard lock(_mutex);
+        if (_held.empty()) return false;
+        const auto oldest = std::move(_held.front());
+        _held.pop_front();
+        oldest();
+        return true;
     }
 
     int addExternalServiceForHost(const platform::AuditToken& host, const std::string& executablePath,
@@ -88,25 +77,16 @@ public:
         const std::lock_guard lock(_mutex);
         const Service service{bundleIdentifier, version};
         _removals.push_back(service);
-        const Answer answer{std::move(queue), std::move(completion), resultFor(service)};
-        if (_isHolding) {
+        const auto answer = [queue = std::move(queue), call = std::move(completion), result = resultFor(service)] {
+            queue->async([call, result] { call(result); });
+        };
+        if (_isHolding)
             _held.push_back(answer);
-        } else {
-            answer.send(answer.result);
-        }
+        else
+            answer();
     }
 
 private:
-    struct Answer {
-        std::shared_ptr<platform::WorkQueue> queue;
-        std::function<void(int)> completion;
-        int result;
-
-        void send(int number) const {
-            queue->async([call = completion, number] { call(number); });
-        }
-    };
-
     int resultFor(const Service& service) {
         if (const auto failure = _failures.find(service); failure != _failures.end()) return failure->second;
         if (!_isAllowed) return EPERM;
@@ -114,14 +94,14 @@ private:
     }
 
     mutable std::recursive_mutex _mutex; // a queue may run answers in place, and they may ask again
-    bool _isAllowed = false;
-    bool _isHolding = false;
-    int _additionFailure = 0;
+    std::atomic<bool> _isAllowed = false;
+    std::atomic<bool> _isHolding = false;
+    std::atomic<int> _additionFailure = 0;
     std::vector<ExternalService> _additions;
-    std::map<Service, int> _instances;
+    std::set<Service> _instances;
     std::map<Service, int> _failures;
     std::vector<Service> _removals;
-    std::deque<Answer> _held;
+    std::deque<std::function<void()>> _held;
 };
 
 } // namespace support

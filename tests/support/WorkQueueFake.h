@@ -2,13 +2,10 @@
 
 #include "platform/WorkQueue.h"
 
-#include <cstddef>
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
-#include <memory>
-#include <string>
-#include <utility>
 #include <vector>
 
 namespace support {
@@ -21,7 +18,8 @@ public:
         inPlace, // items run when submitted, or after the item of the same queue that is running
     };
 
-    explicit FakeWorkQueues(Mode mode = Mode::manual) : _line(std::make_shared<Line>()) { _line->mode = mode; }
+    explicit FakeWorkQueues(Mode mode = Mode::manual) { setMode(mode); }
+    void setMode(Mode mode) { _line->mode = mode; }
 
     struct Made {
         std::string label;
@@ -29,8 +27,6 @@ public:
     };
     /// Every queue made so far.
     std::vector<Made> made;
-
-    void setMode(Mode mode) { _line->mode = mode; }
 
     std::shared_ptr<platform::WorkQueue>
     makeSerial(std::string label, platform::QualityOfService quality = platform::QualityOfService::standard) override {
@@ -46,20 +42,25 @@ public:
         while (runOne()) ++count;
         return count;
     }
-    std::size_t waiting() const { return _line->items.size(); }
 
 private:
     class Queue;
-    struct Waiting {
-        std::shared_ptr<Queue> queue; // lives until its items have run
-        platform::WorkQueue::Item item;
-    };
     struct Line {
         Mode mode = Mode::manual;
-        std::deque<Waiting> items;
+        std::deque<std::pair<std::shared_ptr<Queue>, platform::WorkQueue::Item>>
+            items; // a queue lives until its own ran
 
         /// Of `queue`, or of any when null.
-        bool runFirst(const Queue* queue);
+        bool runFirst(const Queue* queue) {
+            const auto next = std::ranges::find_if(items, [queue](const auto& each) {
+                return !each.first->isCurrent() && (!queue || each.first.get() == queue);
+            });
+            if (next == items.end()) return false;
+            const auto [its, item] = std::move(*next);
+            items.erase(next);
+            its->run(item);
+            return true;
+        }
     };
 
     class Queue final : public platform::WorkQueue, public std::enable_shared_from_this<Queue> {
@@ -67,14 +68,14 @@ private:
         Queue(std::string label, std::shared_ptr<Line> line) : _label(std::move(label)), _line(std::move(line)) {}
 
         void async(Item item) override {
-            _line->items.push_back({shared_from_this(), std::move(item)});
+            _line->items.emplace_back(shared_from_this(), std::move(item));
             if (_line->mode == Mode::inPlace) runWaiting();
         }
         void asyncOnCaller(Item item) override { async(std::move(item)); }
         bool isCurrent() const override { return _isRunning; }
         std::string_view label() const override { return _label; }
 
-        template <class F> void runNow(F& item) {
+        void run(const Item& item) {
             _isRunning = true;
             item();
             _isRunning = false;
@@ -87,8 +88,7 @@ private:
                 std::abort();
             }
             runWaiting();
-            auto item = [&] { call.invoke(call.context); };
-            runNow(item);
+            run([&] { call.invoke(call.context); });
             if (_line->mode == Mode::inPlace) runWaiting();
         }
         void runWaiting() {
@@ -101,18 +101,7 @@ private:
         bool _isRunning = false;
     };
 
-    std::shared_ptr<Line> _line;
+    const std::shared_ptr<Line> _line = std::make_shared<Line>();
 };
-
-inline bool FakeWorkQueues::Line::runFirst(const Queue* queue) {
-    for (auto candidate = items.begin(); candidate != items.end(); ++candidate) {
-        if (candidate->queue->isCurrent() || (queue && candidate->queue.get() != queue)) continue;
-        Waiting next = std::move(*candidate);
-        items.erase(candidate);
-        next.queue->runNow(next.item);
-        return true;
-    }
-    return false;
-}
 
 } // namespace support

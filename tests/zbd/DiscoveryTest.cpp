@@ -1,290 +1,176 @@
-#include "tests/support/FakeDaemon.h"
-#include "zbd/Transaction.h"
+#include "tests/support/Requests.h"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 namespace {
 
-using platform::Array;
-using platform::Dictionary;
-using platform::LogLevel;
-using platform::MutableDictionary;
-using platform::URL;
-using platform::UUID;
-using platform::Value;
+using namespace platform;
 using support::errorReply;
-using support::FakePlugIn;
-using support::processLog;
 
-constexpr std::uint64_t all = zembra::ZBDiscoverAll;
+struct Discovery : support::Requests {
+    Discovery() { fake.preferences.addDomain("com.nordane.zembra.userprefs"); }
 
-/// UUIDs that sort by their number, so that answers have an order that a test can state.
-UUID uuid(int number) { return *UUID::parse("00000000-0000-0000-0000-00000000000" + std::to_string(number)); }
-
-struct Discovery : testing::Test {
-    support::FakeDaemon daemon;
-
-    Discovery() { daemon.fake.preferences.addDomain("com.nordane.zembra.userprefs"); }
-
-    /// A data plug-in in the application A, or on the system volume.
-    FakePlugIn described(int number, const std::string& name, const std::string& version = "1.0",
-                         const std::string& application = "/Applications/A.app") {
-        auto plugIn = support::dataPlugIn(name);
-        plugIn.uuid = uuid(number);
-        plugIn.path = application + "/PlugIns/" + std::to_string(number) + ".plugin";
-        plugIn.info = support::manifestOf(
-            "com.example." + name,
-            {{"VKExtensionProtocol", "#Data"}, {"VKExtensionAttributes", Dictionary{{"VKExtensionVersion", version}}}});
-        plugIn.onSystemPartition = application.starts_with("/System");
-        plugIn.containingBundle = std::make_shared<platform::ApplicationRecord>(
-            platform::ApplicationRecord{URL::file(application), "com.example.a", "A"});
-        return plugIn;
+    void becomeManager() {
+        fake.sandbox.unconfined.insert(77);
+        grant({{"com.nordane.private.zembra.manager", true}});
     }
-    void install(const FakePlugIn& plugIn) { daemon.fake.registry.install(plugIn); }
-    void grant(const Dictionary& entitlements) { daemon.fake.codeSigning.entitlements[77] = entitlements; }
-
-    std::vector<Dictionary> forms(std::uint64_t flags = 0, const Value& rules = {}) {
-        MutableDictionary message{{"flags", flags}};
-        if (rules) message.set("rules", rules);
-        const auto reply = daemon.ask("match", message);
-        std::vector<Dictionary> found;
-        const auto bytes = reply["matches"].data();
-        if (!bytes) {
-            ADD_FAILURE() << Value(reply).description();
-            return found;
-        }
-        const auto matches = *platform::decodeCompact(*bytes, platform::UUIDs::refused)->array();
-        for (const Value& form : matches) found.push_back(*form.dictionary());
-        return found;
+    /// What the reply to a match or a find carries.
+    Value matches(const std::string& type, const MutableDictionary& message) {
+        return *decodeCompact(daemon.ask(type, message)["matches"].data().value(), UUIDs::refused);
     }
+    Array forms(std::uint64_t flags = 0) { return *matches("match", {{"flags", flags}}).array(); }
     /// The last digits of the UUIDs answered, in order.
-    std::string answer(std::uint64_t flags = 0, const Value& rules = {}) {
+    std::string answer(std::uint64_t flags = 0) {
         std::string digits;
-        for (const Dictionary& form : forms(flags, rules)) digits += form.string("uuid")->back();
+        for (const Value& form : forms(flags)) digits += form.dictionary()->string("uuid")->back();
         return digits;
     }
-    bool logged(LogLevel level, const std::string& message) { return processLog.contains(level, "ops", message); }
 };
-
-TEST_F(Discovery, RefusesBadRulesAndTheUnprivilegedFlag) {
-    EXPECT_EQ(daemon.ask("match", {{"rules", "x"}}), errorReply(4, "invalid request format (bad rules dictionary)"));
-    const auto refusal = errorReply(11, "unauthorized discovery flag (ZBDiscoverAll)");
-    daemon.fake.sandbox.unconfined.insert(77);
-    EXPECT_EQ(daemon.ask("match", {{"flags", all}}), refusal);
-    grant({{"com.nordane.private.zembra.manager", true}});
-    EXPECT_EQ(answer(all), "");
-    daemon.fake.sandbox.unconfined.clear();
-    EXPECT_EQ(daemon.ask("match", {{"flags", all}}), refusal);
-}
 
 TEST_F(Discovery, AnswersInTheOrderOfUUIDsAndLogsWhatItFound) {
     EXPECT_EQ(answer(), "");
-    EXPECT_TRUE(logged(LogLevel::info, "Candidate plugin count: 0"));
-    EXPECT_TRUE(logged(LogLevel::info, "Resulting plugin count: 0"));
-    for (const int number : {3, 1, 2}) install(described(number, "p" + std::to_string(number)));
+    expectLogged(info, "Candidate plugin count: 0");
+    expectLogged(info, "Resulting plugin count: 0");
+    installThree();
     EXPECT_EQ(answer(), "123");
-    const auto lines = processLog.messages("ops");
-    EXPECT_EQ(std::count_if(lines.begin(), lines.end(),
-                            [](const auto& line) { return line.starts_with("Candidate plugin count: 3, info: "); }),
-              1);
-    EXPECT_TRUE(logged(LogLevel::info, "Resulting plugin count: 3, UUIDs: " +
-                                           Value(Array{uuid(1).text(), uuid(2).text(), uuid(3).text()}).description()));
-    EXPECT_TRUE(logged(LogLevel::debug, "reply marshalled"));
-    daemon.fake.registry.answerNothing();
+    EXPECT_TRUE(support::logged(info, "Candidate plugin count: 3, info: "));
+    expectLogged(info, "Resulting plugin count: 3, UUIDs: " + Value(Array{idOf(1), idOf(2), idOf(3)}).description());
+    expectLogged(debug, "reply marshalled");
+    fake.registry.answerNothing();
     EXPECT_EQ(answer(), "");
 }
 
-TEST_F(Discovery, HostSideFiltersAreSkippedForAManagerThatAsks) {
-    auto loose = described(1, "loose");
+TEST_F(Discovery, HostSideFiltersAreSkippedForAnUnconfinedManagerThatAsks) {
+    auto loose = described(1, {{"VKExtensionProtocol", "#Data"}});
     loose.containingBundle = nullptr;
     loose.path = "/System/loose.plugin"; // below that directory, but on another volume
-    auto dedicated = described(3, "dedicated");
-    dedicated.info = support::manifestOf("com.example.dedicated",
-                                         {{"VKExtensionProtocol", "#Data"},
-                                          {"Dedicated", true},
-                                          {"VKExtensionAttributes", Dictionary{{"VKExtensionVersion", "1"}}}});
-    auto guarded = described(5, "guarded");
-    guarded.info = support::manifestOf("com.example.guarded", {{"VKExtensionProtocol", "#Data"},
-                                                               {"VKExtensionHostEntitlement", "needed"},
-                                                               {"VKExtensionAttributes", Dictionary()}});
-    install(loose);
-    install(described(2, "system", "1.0", "/System/Applications/S.app"));
-    install(dedicated);
-    install(described(4, "held"));
-    install(guarded);
-    const auto plugIn = daemon.server->findPlugIn(uuid(4));
-    daemon.server->addHold(zbd::ZBDPlugInHold::initWithPlugIns(daemon.fake.transport, {plugIn}, nullptr));
-
+    install({loose, described(2, {}, "/System/Applications/S.app"), described(3, {{"Dedicated", true}}), described(4),
+             described(5, {{"VKExtensionHostEntitlement", "needed"}})});
+    hold(4);
     EXPECT_EQ(answer(), "2");
-    EXPECT_EQ(answer(zembra::ZBDiscoverSystemOnly), "2");
-    EXPECT_TRUE(logged(LogLevel::info, "client 77 cannot use plugin " + uuid(5).text() +
-                                           ": the host does not have the \"needed\" entitlement"));
-    daemon.fake.sandbox.unconfined.insert(77);
-    grant({{"com.nordane.private.zembra.manager", true}});
-    EXPECT_EQ(answer(all | zembra::ZBDiscoverSystemOnly), "12345");
+    becomeManager();
+    EXPECT_EQ(answer(zembra::ZBDiscoverAll | zembra::ZBDiscoverSystemOnly), "12345");
+    fake.sandbox.unconfined.clear();
+    EXPECT_EQ(daemon.ask("match", {{"flags", 0x200}}), errorReply(11, "unauthorized discovery flag (ZBDiscoverAll)"));
     grant({{"needed", "for a string counts"}});
     EXPECT_EQ(answer(), "25");
     // The dedicated one is for the host whose bundle carries it.
-    daemon.fake.processes.paths[77] = "/Applications/A.app/host";
-    daemon.fake.bundles.add("/Applications/A.app", {}, "/Applications/A.app/host");
+    fake.processes.paths[77] = "/Applications/A.app/host";
+    fake.bundles.add(application, {}, "/Applications/A.app/host");
     EXPECT_EQ(answer(), "235");
+    EXPECT_EQ(answer(zembra::ZBDiscoverSystemOnly), "2");
 }
 
 TEST_F(Discovery, RulesExclusionsAndRestrictionsApply) {
-    for (const int number : {1, 2, 3}) install(described(number, "p" + std::to_string(number)));
-    EXPECT_EQ(answer(0, Dictionary{{"VKExtensionIdentifier", "com.example.p2"}}), "2");
+    const auto identified = [](const char* name) { return Dictionary{{"VKExtensionIdentifier", name}}; };
+    installThree();
+    EXPECT_EQ(matches("match", {{"rules", identified("com.example.2")}}).array()->size(), 1U);
     // What is no rules dictionary excludes nothing.
-    daemon.fake.preferences.store("com.nordane.zembra.userprefs", "exclusions",
-                                  Array{"p1", Dictionary{{"VKExtensionIdentifier", "com.example.p2"}}, 4});
-    daemon.fake.sandbox.unconfined.insert(77);
-    grant({{"com.nordane.private.zembra.manager", true}});
-    EXPECT_EQ(answer(all), "13");
-    EXPECT_TRUE(logged(LogLevel::info, "client 77 plugin " + uuid(2).text() + " globally excluded"));
-
-    grant({{"com.nordane.developer.zembra.allowedplugins", Dictionary{{"VKExtensionIdentifier", "com.example.p3"}}}});
-    EXPECT_EQ(answer(), "3");
-    EXPECT_TRUE(logged(LogLevel::info, "client 77 cannot use plugin " + uuid(1).text() +
-                                           ": the host's plug-in entitlement does not allow this plug-in"));
-    grant({{"com.nordane.developer.zembra.allowedplugins", true}});
-    EXPECT_EQ(answer(), "");
-    EXPECT_TRUE(logged(LogLevel::info,
-                       "client 77 cannot use plugin " + uuid(1).text() + ": invalid host restriction entitlement"));
+    fake.preferences.store("com.nordane.zembra.userprefs", "exclusions", Array{"1", identified("com.example.2"), 4});
+    becomeManager();
+    EXPECT_EQ(answer(zembra::ZBDiscoverAll), "13");
+    expectLogged(info, "client 77 plugin " + idOf(2) + " globally excluded");
+    const std::tuple<Value, const char*, const char*> restrictions[] = {
+        {identified("com.example.3"), "3", "the host's plug-in entitlement does not allow this plug-in"},
+        {true, "", "invalid host restriction entitlement"}};
+    for (const auto& [restriction, expected, reason] : restrictions) {
+        grant({{"com.nordane.developer.zembra.allowedplugins", restriction}});
+        EXPECT_EQ(answer(), expected);
+        expectLogged(info, "client 77 cannot use plugin " + idOf(1) + ": " + reason);
+    }
 }
 
-TEST_F(Discovery, OneOfEachIdentifierUnlessTheFlagsAskForMore) {
-    install(described(1, "p", "1.2"));
-    install(described(2, "p", "1.10"));
-    auto newer = described(3, "p", "1.10");
-    newer.registrationDate = platform::Date{2'000'000'000};
-    install(newer);
-    EXPECT_EQ(answer(), "3");
-    EXPECT_EQ(answer(zembra::ZBDiscoverAllVersions), "13");
-    EXPECT_EQ(answer(zembra::ZBDiscoverDuplicates), "3");
-    EXPECT_EQ(answer(zembra::ZBDiscoverAllVersions | zembra::ZBDiscoverDuplicates), "123");
-    install(described(4, "p", "1.10", "/System/Applications/S.app"));
-    EXPECT_EQ(answer(), "4") << "the system's own wins a tie";
-}
-
-TEST_F(Discovery, AHostPrefersThePlugInsThatItCarries) {
-    install(described(1, "p", "2.0"));
-    install(described(2, "p", "1.0", "/Applications/B.app"));
-    install(described(3, "other"));
-    daemon.fake.processes.paths[77] = "/Applications/B.app/host";
-    EXPECT_EQ(answer(), "23");
-    EXPECT_TRUE(logged(LogLevel::info, "Ignoring " + uuid(2).text() +
-                                           " @ '/Applications/A.app/PlugIns/1.plugin' in favor of bundle-relative "
-                                           "'/Applications/B.app/PlugIns/2.plugin'"));
-    daemon.fake.processes.paths.clear();
-    EXPECT_EQ(answer(), "13");
-    EXPECT_TRUE(logged(LogLevel::error, "Failed to determine path for pid 77, [3: No such process]"));
+TEST_F(Discovery, OneOfEachIdentifierUnlessTheHostCarriesAnotherOrTheFlagsAskForMore) {
+    const auto version = [this](int number, const char* text, const std::string& within = application) {
+        const Dictionary attributes{{"VKExtensionVersion", text}};
+        return described(number, {{"VKExtensionIdentifier", "p"}, {"VKExtensionAttributes", attributes}}, within);
+    };
+    auto newer = version(2, "1.10");
+    newer.registrationDate = Date{2'000'000'000};
+    install({version(1, "1.10"), newer, version(3, "1.2"), described(4)});
+    EXPECT_EQ(answer(), "24");
+    EXPECT_EQ(answer(zembra::ZBDiscoverAllVersions), "234");
+    EXPECT_EQ(answer(zembra::ZBDiscoverAllVersions | zembra::ZBDiscoverDuplicates), "1234");
+    install({version(5, "1.10", "/System/Applications/S.app")});
+    EXPECT_EQ(answer(), "45") << "the system's own wins a tie";
+    const std::string host = "/Applications/Host.app"; // whose program asks
+    install({version(6, "1.0", host)});
+    EXPECT_EQ(answer(), "46");
+    expectLogged(info, "Ignoring " + idOf(6) + " @ '" + pathOf(3) + "' in favor of bundle-relative '" +
+                           pathOf(6, host) + "'");
+    fake.processes.paths.clear();
+    EXPECT_EQ(answer(), "45");
+    expectLogged(error, "Failed to determine path for pid 77, [3: No such process]");
 }
 
 TEST_F(Discovery, ReplacingAndReplacedPlugInsPointAtEachOther) {
-    auto replacing = described(2, "replacing");
-    replacing.entitlements =
-        Dictionary{{"com.nordane.developer.replace-plugin", Array{"com.example.p", 7, "com.example.x"}}};
-    install(described(1, "p"));
-    install(replacing);
+    std::vector plugIns{described(1), described(2), described(3)};
+    const Array several{"com.example.1", 7, "com.example.x"};
+    plugIns[1].entitlements = Dictionary{{"com.nordane.developer.replace-plugin", several}};
+    plugIns[2].entitlements = Dictionary{{"com.nordane.developer.replace-plugin", "com.example.2"}};
+    install(plugIns);
     const auto found = forms();
-    ASSERT_EQ(found.size(), 2U);
-    EXPECT_EQ(found[0]["overrider"], Value(uuid(2).text()));
-    EXPECT_FALSE(found[0]["overriding"]);
-    EXPECT_EQ(found[1]["overriding"], Value("com.example.p"));
-    EXPECT_TRUE(logged(LogLevel::info, "plug-in " + uuid(2).text() + " overrides " + uuid(1).text()));
+    EXPECT_EQ(found[0].dictionary()->string("overrider"), idOf(2));
+    EXPECT_FALSE(found[0].dictionary()->contains("overriding"));
+    EXPECT_EQ(found[1].dictionary()->string("overriding"), "com.example.1");
+    EXPECT_EQ(found[1].dictionary()->string("overrider"), idOf(3));
+    EXPECT_EQ(found[2].dictionary()->string("overriding"), "com.example.2");
+    expectLogged(info, "plug-in " + idOf(2) + " overrides " + idOf(1));
 }
 
-TEST_F(Discovery, FormsCarryTheUsersAnnotations) {
-    install(described(1, "p"));
-    EXPECT_EQ(forms().at(0)["annotations"], Value(Dictionary()));
-    EXPECT_EQ(daemon.ask("annotate", {{"uuids", Array{uuid(1)}}, {"annotations", Dictionary{{"election", 1}}}}),
-              Dictionary());
-    EXPECT_TRUE(logged(LogLevel::info, "client 77 plug-in com.example.p(" + uuid(1).text() + ") election := 1"));
-    EXPECT_EQ(forms().at(0)["annotations"], Value(Dictionary{{"election", 1}}));
-    EXPECT_EQ(answer(0, Dictionary{{"VKUserElection", "1"}}), "1");
-    EXPECT_EQ(answer(0, Dictionary{{"VKUserElection", "0"}}), "");
-    // Stored and saved before the failure is told, and nobody notified.
-    const auto posts = daemon.fake.notifications.posts().size();
-    EXPECT_EQ(
-        daemon.ask("annotate", {{"uuids", Array{uuid(1), uuid(9)}}, {"annotations", Dictionary{{"election", 3}}}}),
-        errorReply(4, "no such plugin (uuid not found)"));
-    EXPECT_EQ(forms().at(0)["annotations"], Value(Dictionary{{"election", 3}}));
-    EXPECT_EQ(daemon.fake.notifications.posts().size(), posts);
-}
-
-TEST_F(Discovery, APlugInThatCannotBeExportedWholeIsAnsweredWithAnError) {
-    auto plugIn = described(1, "p");
-    install(plugIn);
-    daemon.server->findPlugIn(uuid(1));
-    daemon.fake.registry.before("knowledgeUUID", [&] { daemon.fake.registry.uninstall(uuid(1)); });
-    EXPECT_EQ(answer(), "1");
-    EXPECT_TRUE(logged(LogLevel::error,
-                       "failed to export matching plug-in " + uuid(1).text() + ": the plug-in has no \"bundleInfo\""));
+TEST_F(Discovery, APlugInThatVanishedIsSentAsFarAsItIsKnown) {
+    installThree();
+    const std::string description = record(1)->description();
+    const std::string line = "failed to export matching plug-in " + idOf(1) + ": the plug-in has no \"bundleInfo\"";
+    fake.registry.before("knowledgeUUID", [&] { fake.registry.uninstall(uuid(1)); });
+    EXPECT_EQ(answer(), "123");
+    expectLogged(error, line);
+    support::processLog.clear();
+    EXPECT_FALSE(matches("find", {{"uuids", uuid(1)}}).dictionary()->contains("bundleInfo"));
+    expectLogged(error, line);
+    expectLogged(standard, "plugin found " + description);
+    EXPECT_EQ(daemon.ask("find"), errorReply(15, "Cannot locate PlugIn"));
+    expectLogged(standard, "plugin not found");
 }
 
 TEST_F(Discovery, AnAnswerThatNoMessageHoldsIsAnError) {
     const Value filler = std::string(std::size_t{8} << 20U, 'x'); // twice in each form
-    for (int number = 1; number <= 5; ++number) {
-        auto plugIn = described(number, "p" + std::to_string(number));
-        plugIn.info = support::manifestOf(
-            "com.example.p" + std::to_string(number),
-            {{"VKExtensionProtocol", "#Data"}, {"VKExtensionAttributes", Dictionary()}, {"Filler", filler}});
-        install(plugIn);
-    }
-    EXPECT_EQ(daemon.ask("match", {}), errorReply(4, "the matching plug-ins are too many for one reply"));
+    for (int number = 1; number <= 5; ++number) install({described(number, {{"Filler", filler}})});
+    EXPECT_EQ(daemon.ask("match"), errorReply(4, "the matching plug-ins are too many for one reply"));
 }
 
-TEST_F(Discovery, AnnotationRequestsCheckBeforeTheyChange) {
-    install(described(1, "p"));
-    const auto posts = [&] { return daemon.fake.notifications.posts().size(); };
-    const std::string bad = "invalid request format (bad annotations dictionary)";
-    struct Case {
-        const char* type;
-        Value annotations;
-        Dictionary reply;
-        std::size_t notified;
+TEST_F(Discovery, FormsCarryWhatAnnotationRequestsChange) {
+    install({described(1)});
+    const Dictionary bad = errorReply(4, "invalid request format (annotation extension)");
+    const Dictionary unstorable{{"k", uuid(1)}};
+    const Dictionary large{{"k", std::string(64 << 10, 'x')}};
+    const Dictionary oneGoodOneBad{{idOf(1), Dictionary{{"a", 1}}}, {"x", Dictionary()}};
+    const std::tuple<const char*, Dictionary, Dictionary> cases[] = {
+        {"annotate", {{"extension", unstorable}}, bad},
+        {"annotate", {{"extension", large}}, bad},
+        {"annotate", {{"extension", Dictionary{{"b", 1}}}, {"other", 1}}, succeeded},
+        {"annotate", {{"election", 2}}, succeeded},
+        {"bulk-annotate", {{idOf(1), unstorable}}, errorReply(18, "the extension cannot be stored")},
+        {"bulk-annotate", {}, succeeded},
+        {"bulk-annotate", oneGoodOneBad, errorReply(18, "invalid plug-in UUID value")},
     };
-    const std::string known = uuid(1).text();
-    const std::vector<Case> cases{
-        {"annotate", {}, errorReply(4, bad), 0},
-        {"annotate", "x", errorReply(4, bad), 0},
-        {"annotate", Dictionary{{"election", "1"}}, errorReply(4, "invalid request format (annotation election)"), 0},
-        {"annotate", Dictionary{{"extension", 1}}, errorReply(4, "invalid request format (annotation extension)"), 0},
-        {"annotate", Dictionary{{"extension", Dictionary{{"id", uuid(1)}}}},
-         errorReply(4, "invalid request format (annotation extension)"), 0},
-        {"annotate", Dictionary{{"extension", Dictionary{{"k", std::string(64 << 10, 'x')}}}},
-         errorReply(4, "invalid request format (annotation extension)"), 0},
-        {"annotate", Dictionary{{"election", 7}, {"extension", 1}},
-         errorReply(4, "invalid request format (annotation extension)"), 0},
-        {"annotate", Dictionary{{"election", 2}}, Dictionary(), 1},
-        {"bulk-annotate", {}, errorReply(4, bad), 0},
-        {"bulk-annotate", Dictionary(), Dictionary(), 1},
-        {"bulk-annotate", Dictionary{{known, 1}}, errorReply(18, "annotations values must be dictionaries"), 0},
-        {"bulk-annotate", Dictionary{{known, Dictionary{{"id", uuid(1)}}}},
-         errorReply(18, "the extension cannot be stored"), 0},
-        {"annotate", Dictionary{{"extension", Dictionary{{"b", 1}}}, {"other", 1}}, Dictionary(), 1},
-        {"bulk-annotate", Dictionary{{known, Dictionary{{"a", 1}}}, {"x", Dictionary()}},
-         errorReply(18, "invalid plug-in UUID value"), 0},
-        {"bulk-annotate", Dictionary{{uuid(9).text(), Dictionary()}},
-         errorReply(2, "no plug-in with the requested uuid"), 0},
-    };
-    for (const Case& c : cases) {
-        MutableDictionary message{{"uuids", Array{uuid(1)}}};
-        if (c.annotations) message.set("annotations", c.annotations);
+    for (const auto& [type, annotations, reply] : cases) {
         const auto before = posts();
-        EXPECT_EQ(daemon.ask(c.type, message), c.reply) << c.type << " " << c.annotations.description();
-        EXPECT_EQ(posts() - before, c.notified) << c.type << " " << c.annotations.description();
+        EXPECT_EQ(daemon.ask(type, {{"uuids", Array{uuid(1)}}, {"annotations", annotations}}), reply);
+        EXPECT_EQ(posts() - before, reply.empty() ? 1U : 0U) << type << Value(annotations).description();
     }
-    // Without anything to store nobody looks at the UUIDs.
-    EXPECT_EQ(daemon.ask("annotate", {{"uuids", "x"}, {"annotations", Dictionary{{"other", 1}}}}), Dictionary());
-    // What came before a failure stays; an extension replaces no election.
-    EXPECT_EQ(daemon.server->annotationForPlugIn(*daemon.server->findPlugIn(uuid(1))),
-              (Dictionary{{"election", 2}, {"extension", Dictionary{{"a", 1}}}}));
-    EXPECT_TRUE(logged(LogLevel::debug, "bulk change requested for 2 plug-ins"));
-    const auto lines = processLog.messages("ops");
-    EXPECT_TRUE(std::any_of(lines.begin(), lines.end(), [](const auto& line) {
-        return line.starts_with("client 77 bulk plug-in com.example.p(") &&
-               line.ends_with(" annotation change: {a = 1}");
-    }));
+    // What came before a failure stays, though nobody is notified; an extension replaces no election.
+    const auto annotations = [&] { return *forms()[0].dictionary()->dictionary("annotations"); };
+    EXPECT_EQ(annotations(), (Dictionary{{"election", 2}, {"extension", Dictionary{{"a", 1}}}}));
+    const auto before = posts();
+    const Array known{uuid(1), uuid(9)};
+    EXPECT_TRUE(daemon.ask("annotate", {{"uuids", known}, {"annotations", Dictionary{{"election", 3}}}})["error"]);
+    EXPECT_EQ(posts(), before);
+    EXPECT_EQ(annotations()["election"], Value(3));
+    expectLogged(info, "client 77 plug-in com.example.1(" + idOf(1) + ") election := 3");
+    expectLogged(debug, "bulk change requested for 2 plug-ins");
+    const auto line = testing::MatchesRegex("client 77 bulk plug-in com.example.1\\(.*\\) annotation change: .a = 1.");
+    EXPECT_THAT(support::processLog.messages("ops"), testing::Contains(line));
 }
 
 } // namespace

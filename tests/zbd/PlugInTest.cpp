@@ -23,23 +23,18 @@ struct PlugIn : testing::Test {
         make(proxy)->augmentForm(form);
         return form;
     }
-    static PlugInProxy data(const std::string& name = "data") { return support::proxyFor(support::dataPlugIn(name)); }
-    /// A plug-in with code, in an application.
-    static PlugInProxy code(const std::string& name = "code", const std::string& suffix = ".plugin") {
-        auto described = support::dataPlugIn(name);
-        described.path = "/Applications/A.app/PlugIns/" + name + suffix;
-        described.info = support::manifestOf(
-            "com.example." + name, {{"VKExtensionProtocol", "Proto"}, {"VKExtensionAttributes", Dictionary()}});
+    static PlugInProxy data() { return support::proxyFor(support::dataPlugIn("data")); }
+    /// A plug-in with code, in an application. `extension` completes its dictionary.
+    static PlugInProxy code(const std::string& suffix = ".plugin", const Dictionary& extension = {}) {
+        auto described = support::dataPlugIn("code");
+        described.path = "/Applications/A.app/PlugIns/code" + suffix;
+        MutableDictionary declared{{"VKExtensionProtocol", "Proto"}, {"VKExtensionAttributes", Dictionary()}};
+        declared.merge(extension);
+        described.info = support::manifestOf("com.example.code", declared);
         described.onSystemPartition = false;
         described.containingBundle = std::make_shared<ApplicationRecord>(
             ApplicationRecord{URL::file("/Applications/A.app"), "com.example.a", "A"});
         return support::proxyFor(described);
-    }
-    static void extend(PlugInProxy& proxy, const Dictionary& more) {
-        auto extension = MutableDictionary::copyOf(*proxy.plugInDictionary);
-        extension.merge(more);
-        proxy.plugInDictionary = extension;
-        proxy.infoDictionary = dictionaryChanging(proxy.infoDictionary, "VKExtension", extension);
     }
 };
 
@@ -48,46 +43,23 @@ TEST_F(PlugIn, TakesItsFactsFromTheProxy) {
     proxy.localizedName = "Name";
     proxy.localizedShortName = "Short";
     proxy.originalIdentifier = "com.example.original";
+    proxy.registrationDate = Date{-1.9};
     proxy.entitlements = Dictionary{{"true", true}, {"false", false}, {"zero", 0}, {"text", "NO"}, {"array", Array()}};
     const auto plugIn = make(proxy);
-    ASSERT_TRUE(plugIn);
-    EXPECT_EQ(plugIn->identifier(), Value("com.example.code"));
-    EXPECT_EQ(plugIn->uuid(), proxy.uuid);
     EXPECT_EQ(plugIn->localizedName(), Value("Name"));
     EXPECT_EQ(plugIn->localizedShortName(), Value("Short"));
     EXPECT_EQ(plugIn->localizedContainingName(), Value("A"));
     EXPECT_EQ(plugIn->originalIdentifier(), Value("com.example.original"));
-    EXPECT_EQ(plugIn->dataContainerURL(), proxy.dataContainerURL);
-    EXPECT_EQ(plugIn->plugInDictionary(), proxy.plugInDictionary);
-    EXPECT_EQ(plugIn->containingPath(), Value("/Applications/A.app"));
-    EXPECT_FALSE(plugIn->onSystemVolume());
-    EXPECT_EQ(plugIn->localizedFilevaneActionNames(), Dictionary());
-    EXPECT_EQ(plugIn->entitlements(), proxy.entitlements);
+    EXPECT_EQ(plugIn->lastModified(), -1) << "truncated toward zero";
     // Entitlements count unless they are false.
     for (const char* held : {"true", "text", "array"}) EXPECT_TRUE(plugIn->hasEntitlement(held)) << held;
     for (const char* lacking : {"false", "zero", "absent"}) EXPECT_FALSE(plugIn->hasEntitlement(lacking)) << lacking;
-}
-
-TEST_F(PlugIn, RegistrationDateIsTruncatedTowardZero) {
-    for (const auto& [seconds, expected] : {std::pair{1.9, 1}, {-1.9, -1}, {0.0, 0}}) {
-        auto proxy = data();
-        proxy.registrationDate = Date{seconds};
-        EXPECT_EQ(make(proxy)->lastModified(), expected);
-    }
-}
-
-TEST_F(PlugIn, HubProtocolVersionIsStatedOrFollowsTheStyle) {
-    for (const auto& [isStated, isOldStyle, version] :
-         {std::tuple(true, true, 5U), {false, true, 1U}, {false, false, 2U}}) {
-        auto proxy = data();
-        if (isStated) extend(proxy, {{"HubProtocolVersion", 5}});
-        if (isOldStyle) {
-            auto info = MutableDictionary::copyOf(*proxy.infoDictionary);
-            info.set("Zembra", Dictionary());
-            proxy.infoDictionary = info;
-        }
-        EXPECT_EQ(make(proxy)->hubProtocolVersion(), version);
-    }
+    // The protocol's version is stated, or follows from the style.
+    EXPECT_EQ(plugIn->hubProtocolVersion(), 2U);
+    proxy.infoDictionary = dictionaryChanging(proxy.infoDictionary, "Zembra", Dictionary());
+    EXPECT_EQ(make(proxy)->hubProtocolVersion(), 1U);
+    proxy.plugInDictionary = dictionaryChanging(proxy.plugInDictionary, "HubProtocolVersion", 5);
+    EXPECT_EQ(make(proxy)->hubProtocolVersion(), 5U);
 }
 
 TEST_F(PlugIn, MisconfiguredOnesAreRefusedWithTheirReason) {
@@ -95,79 +67,57 @@ TEST_F(PlugIn, MisconfiguredOnesAreRefusedWithTheirReason) {
     uncontained.dataContainerURL.reset();
     auto outside = data();
     outside.bundleURL = URL::file("/SystemX/Library/data.plugin");
-    auto principal = code("principal", ".appex");
-    extend(principal, {{"PrincipalClass", "Other"}});
     for (const auto& [proxy, reason] : {std::pair(uncontained, "this plug-in has no sandbox data container"),
-                                        {outside, "plug-ins outside containing apps must be in /System"},
-                                        {principal, "Application Extensions may not use the \"PrincipalClass\" key"}}) {
-        EXPECT_FALSE(make(proxy)) << reason;
-        EXPECT_TRUE(
-            logged(LogLevel::info, "ignoring mis-configured plug-in at " + proxy.bundleURL->path() + ": " + reason));
+                                        {outside, "plug-ins outside containing apps must be in /System"}}) {
+        EXPECT_FALSE(make(proxy));
+        const std::string start = "ignoring mis-configured plug-in at " + proxy.bundleURL->path();
+        EXPECT_TRUE(logged(LogLevel::info, start + ": " + reason));
     }
-    processLog.clear();
     auto proxy = data();
     proxy.dataContainerURL.reset(); // which plug-ins without code need not have
     EXPECT_TRUE(make(proxy));
-    proxy.bundleURL.reset();
-    EXPECT_FALSE(make(proxy));
-    EXPECT_TRUE(processLog.messages("ops").empty());
-    proxy = data();
     proxy.plugInIdentifier.reset();
     EXPECT_FALSE(make(proxy));
-    EXPECT_TRUE(logged(LogLevel::error, "missing identifier in plug-in at " + proxy.bundleURL->path()));
+    proxy.bundleURL.reset();
+    EXPECT_FALSE(make(proxy));
 }
 
 TEST_F(PlugIn, ManifestFollowsTheRegistry) {
     auto proxy = data();
     const auto plugIn = make(proxy);
     const auto version = [&] { return plugIn->infoKey("VBBundleVersion"); };
-    fake.registry.resetCalls();
+    const auto lookUps = [&] { return fake.registry.calls("plugInForUUID"); };
+    const int before = lookUps();
     EXPECT_EQ(version(), Value("1"));
-    EXPECT_EQ(plugIn->version(), Value("1.0"));
-    EXPECT_EQ(fake.registry.calls("plugInForUUID"), 0) << "nothing changed since it was made";
-
+    EXPECT_EQ(lookUps(), before) << "nothing changed since it was made";
     proxy.infoDictionary = dictionaryChanging(proxy.infoDictionary, "VBBundleVersion", "2");
     fake.registry.install(proxy);
     for (int i = 0; i < 2; ++i) EXPECT_EQ(version(), Value("2"));
-    EXPECT_EQ(fake.registry.calls("plugInForUUID"), 1);
+    EXPECT_EQ(lookUps(), before + 1);
 
-    // A registry that knows no knowledge UUID is asked each time.
-    fake.registry.setKnowledgeUUID(std::nullopt);
-    for (int i = 0; i < 2; ++i) version();
-    EXPECT_EQ(fake.registry.calls("plugInForUUID"), 3);
-}
-
-TEST_F(PlugIn, GoneFromTheRegistryItKeepsItsFactsAndHasNoManifest) {
-    const auto proxy = data();
-    const auto plugIn = make(proxy);
     fake.registry.uninstall(*proxy.uuid);
-    EXPECT_FALSE(plugIn->infoKey("VBBundleVersion"));
-    EXPECT_TRUE(logged(LogLevel::error, "could not obtain fresh proxy for " + proxy.uuid->text()));
-    EXPECT_TRUE(logged(LogLevel::standard,
-                       "Failed to find Plugin by " + proxy.uuid->text() + " fallback to path " +
-                           proxy.bundleURL->absoluteString(),
-                       "cx"));
-    EXPECT_FALSE(plugIn->version());
-    EXPECT_EQ(plugIn->identifier(), Value("com.example.data"));
-    fake.registry.install(proxy);
-    EXPECT_EQ(plugIn->infoKey("VBBundleVersion"), Value("1"));
-}
-
-TEST_F(PlugIn, WithoutUUIDEachRecordHasItsOwnAndIsFoundByLocation) {
-    auto proxy = data();
+    EXPECT_FALSE(version());
+    EXPECT_EQ(plugIn->identifier(), Value("com.example.data")) << "facts stay";
+    const std::string uuid = proxy.uuid->text();
+    const std::string fallback = " fallback to path " + proxy.bundleURL->absoluteString();
+    EXPECT_TRUE(logged(LogLevel::error, "could not obtain fresh proxy for " + uuid));
+    EXPECT_TRUE(logged(LogLevel::standard, "Failed to find Plugin by " + uuid + fallback, "cx"));
     proxy.uuid.reset();
-    const auto first = make(proxy);
-    const auto second = make(proxy);
-    ASSERT_TRUE(first && second);
-    EXPECT_NE(first->uuid(), second->uuid());
-    EXPECT_EQ(first->infoKey("VBBundleVersion"), Value("1"));
+    fake.registry.install(proxy);
+    EXPECT_EQ(version(), Value("2")) << "found by its location";
+    EXPECT_NE(make(proxy)->uuid(), make(proxy)->uuid()) << "each record has its own";
+
+    fake.registry.setKnowledgeUUID(std::nullopt); // then the registry is asked each time
+    const int asked = lookUps();
+    for (int i = 0; i < 2; ++i) version();
+    EXPECT_EQ(lookUps(), asked + 2);
 }
 
 TEST_F(PlugIn, KeptFormFollowsTheRegistryAndTokensAreIssuedEachTime) {
-    for (const char* category : {"cx", "sandbox"}) processLog.setLevel(category, LogLevel::info);
-    auto proxy = code("ext", ".appex");
+    processLog.setLevel("cx", LogLevel::info);
+    auto proxy = code(".appex");
     fake.sandbox.allowFile(proxy.bundleURL->path());
-    fake.sandbox.services.insert("com.example.ext");
+    fake.sandbox.services.insert("com.example.code");
     const auto plugIn = make(proxy);
     const auto form = [&](bool isKept = true) {
         auto made = isKept ? plugIn->currentForm(nullptr) : plugIn->exportForm(nullptr);
@@ -192,17 +142,7 @@ TEST_F(PlugIn, KeptFormFollowsTheRegistryAndTokensAreIssuedEachTime) {
     }
     plugIn->setLocalizedName("Neu");
     EXPECT_EQ(form()["localizedDisplayName"], Value("Neu"));
-    for (const char* category : {"cx", "sandbox"}) processLog.setLevel(category, LogLevel::debug);
-}
-
-TEST_F(PlugIn, ActionNamesAreLocalizedOrThemselves) {
-    auto proxy = data();
-    const auto action = [](const char* name) { return Dictionary{{"VKExtensionFilevaneActionName", name}}; };
-    extend(proxy, {{"VKExtensionFilevaneActions",
-                    Array{action("turn"), action("turn"), action("flip"), Dictionary(), Value(3)}}});
-    fake.registry.setStringTable(proxy.bundleURL->path(), "Localizable", {{"turn", "Drehen"}});
-    EXPECT_EQ(make(proxy)->localizedFilevaneActionNames(), (Dictionary{{"turn", "Drehen"}, {"flip", "flip"}}));
-    EXPECT_TRUE(logged(LogLevel::error, "missing VKExtensionFilevaneActionName for plugin ", "cx"));
+    processLog.setLevel("cx", LogLevel::debug);
 }
 
 TEST_F(PlugIn, PrunedDictionaryLosesBuildToolEntries) {
@@ -210,44 +150,56 @@ TEST_F(PlugIn, PrunedDictionaryLosesBuildToolEntries) {
               (Dictionary{{"aDT", 3}, {"D", 4}}));
 }
 
+TEST_F(PlugIn, ActionNamesAreLocalizedOrThemselves) {
+    const auto action = [](const char* name) { return Dictionary{{"VKExtensionFilevaneActionName", name}}; };
+    const Array actions{action("turn"), action("turn"), action("flip"), Dictionary(), Value(3)};
+    const auto proxy = code(".plugin", {{"VKExtensionFilevaneActions", actions}});
+    fake.registry.setStringTable(proxy.bundleURL->path(), "Localizable", {{"turn", "Drehen"}});
+    EXPECT_EQ(make(proxy)->localizedFilevaneActionNames(), (Dictionary{{"turn", "Drehen"}, {"flip", "flip"}}));
+    EXPECT_TRUE(logged(LogLevel::error, "missing VKExtensionFilevaneActionName for plugin ", "cx"));
+}
+
 TEST_F(PlugIn, FormCarriesTheTokensThatTheSandboxGrants) {
-    fake.sandbox.services.insert("com.example.code");
-    auto proxy = code();
-    const std::string path = proxy.bundleURL->path();
-    const auto sharing = [&](const Value& shared) {
-        extend(proxy, {{"Shared", shared}});
-        return augmented(proxy);
+    for (const char* file : {".plugin", ".plugin/Fonts", ".appex", ".appex/Fonts"})
+        fake.sandbox.allowFile("/Applications/A.app/PlugIns/code" + std::string(file));
+    const auto shared = [&](const Value& resources, const std::string& suffix = ".plugin") {
+        const auto form = augmented(code(suffix, {{"Shared", resources}}));
+        std::vector<std::string> names;
+        for (const auto& entry : form.dictionary("extensions").value()) names.emplace_back(entry.name());
+        return names;
     };
-    EXPECT_FALSE(augmented(proxy).contains("extensions")) << "nothing is shared";
-    for (const char* file : {"", "/Fonts"}) fake.sandbox.allowFile(path + file);
-    fake.sandbox.files[path + "/link"] = "/etc/passwd";
-
-    const auto form = sharing(Array{"Fonts", 7, "Sounds", ".", "link"});
-    std::vector<std::string> resources;
-    const Dictionary extensions = *form.dictionary("extensions");
-    for (const auto& entry : extensions) resources.emplace_back(entry.name());
-    EXPECT_EQ(resources, (std::vector<std::string>{"Fonts", "."}));
-    EXPECT_TRUE(form.contains("service-extension"));
-    EXPECT_TRUE(logged(LogLevel::info, "failed to make extension for " + path + "/Sounds in plug-in at " + path +
-                                           ": Operation not permitted"));
-    EXPECT_EQ(sharing("Fonts").dictionary("extensions")->size(), 1U);
-    EXPECT_EQ(sharing(Array()).dictionary("extensions"), Dictionary());
-
-    fake.sandbox.services.clear();
-    EXPECT_FALSE(augmented(proxy).contains("service-extension"));
-    EXPECT_TRUE(logged(LogLevel::info, "failed to make mach extension for com.example.code in plug-in at " + path +
-                                           ": Operation not permitted"));
-    fake.sandbox.services.insert("com.example.data");
+    using Names = std::vector<std::string>;
+    EXPECT_EQ(shared(Array{"Fonts", 7, "Sounds", "."}), (Names{"Fonts", "."}));
+    EXPECT_EQ(shared("Fonts"), Names{"Fonts"});
+    EXPECT_EQ(shared(Array()), Names());
+    EXPECT_EQ(shared(Array{"Fonts"}, ".appex"), Names{"."}) << "the whole bundle";
+    EXPECT_TRUE(augmented(code()).empty()) << "nothing is shared, and no service known";
+    const std::string end = " in plug-in at /Applications/A.app/PlugIns/code.plugin: Operation not permitted";
+    EXPECT_TRUE(
+        logged(LogLevel::info, "failed to make extension for /Applications/A.app/PlugIns/code.plugin/Sounds" + end));
+    EXPECT_TRUE(logged(LogLevel::info, "failed to make mach extension for com.example.code" + end));
+    for (const char* identifier : {"com.example.code", "com.example.data"}) fake.sandbox.services.insert(identifier);
+    EXPECT_TRUE(augmented(code()).contains("service-extension"));
     EXPECT_TRUE(augmented(data()).empty()) << "without code there is no service";
 }
 
-TEST_F(PlugIn, ApplicationExtensionSharesItsWholeBundle) {
-    auto proxy = code("ext", ".appex");
-    for (const char* file : {"", "/Fonts"}) fake.sandbox.allowFile(proxy.bundleURL->path() + file);
-    extend(proxy, {{"Shared", Array{"Fonts"}}});
-    const auto extensions = *augmented(proxy).dictionary("extensions");
-    EXPECT_EQ(extensions.size(), 1U);
-    EXPECT_TRUE(extensions.contains("."));
+TEST(RecentForms, KeepsWhatComesBackBeforeManyOthers) {
+    constexpr std::size_t capacity = zbd::RecentForms::capacity;
+    zbd::RecentForms forms;
+    const auto [number, isAgain] = forms.countMade(0);
+    EXPECT_FALSE(isAgain) << "the first time";
+    for (std::size_t others = 1; others < capacity; ++others) forms.countMade(0);
+    EXPECT_TRUE(forms.countMade(number).second);
+    EXPECT_FALSE(forms.countMade(number).second) << "too many others";
+    std::vector<std::weak_ptr<int>> kept;
+    for (std::size_t i = 0; i < capacity + 2; ++i) {
+        const auto form = std::make_shared<int>();
+        kept.emplace_back(form);
+        forms.keep(form);
+        EXPECT_EQ(kept[0].expired(), i >= capacity) << "what was kept first goes first";
+    }
+    EXPECT_TRUE(kept[1].expired());
+    EXPECT_FALSE(kept[2].expired());
 }
 
 } // namespace
