@@ -69,10 +69,9 @@ bool isUsable(const PlugInProxyRef& proxy) {
     return true;
 }
 
-/// By UUID, and each UUID once. The registry mostly answers so already.
+/// By UUID, and each UUID once.
 void order(std::vector<ZBDPlugInRef>& plugIns) {
-    const auto uuid = [](const ZBDPlugInRef& plugIn) { return *plugIn->uuid(); };
-    if (!std::ranges::is_sorted(plugIns, {}, uuid)) std::ranges::sort(plugIns, {}, uuid);
+    std::ranges::sort(plugIns, {}, [](const ZBDPlugInRef& plugIn) { return *plugIn->uuid(); });
     const auto isSame = [](const ZBDPlugInRef& left, const ZBDPlugInRef& right) { return *left == *right; };
     plugIns.erase(std::unique(plugIns.begin(), plugIns.end(), isSame), plugIns.end());
 }
@@ -222,11 +221,15 @@ std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::findPlugIns(const std::opti
         if (!proxies) return std::nullopt;
         std::vector<ZBDPlugInRef> plugIns;
         plugIns.reserve(proxies->size());
+        bool isOrdered = true; // mostly so, and then thousands of records need not be looked at again
+        const UUID* last = nullptr;
         for (const PlugInProxyRef& proxy : *proxies) {
+            isOrdered = isOrdered && proxy->uuid && (last == nullptr || *last < *proxy->uuid);
+            last = isOrdered ? &*proxy->uuid : nullptr;
             if (!isUsable(proxy)) continue;
             if (auto plugIn = recordForProxy(proxy)) plugIns.push_back(std::move(plugIn));
         }
-        order(plugIns);
+        if (!isOrdered) order(plugIns);
         log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns.size(), countBefore, _cache.size());
         return plugIns;
     });

@@ -117,11 +117,6 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
         std::shared_ptr<const Index> index;
         std::vector<Postings> runs;
         std::size_t size = 0;
-
-        bool contains(std::uint32_t position) const {
-            return std::ranges::any_of(
-                runs, [&](Postings run) { return std::ranges::binary_search(run, position, {}, &Posting::position); });
-        }
     };
     std::vector<Answer> answers;
     for (const auto& test : tests) {
@@ -135,11 +130,13 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
         answers.push_back(std::move(answer));
     }
     std::ranges::sort(answers, {}, &Answer::size);
-    const auto others = std::span(answers).subspan(1);
     Positions positions;
     for (const auto& run : answers.front().runs) {
+        std::vector<std::vector<Postings>> others; // what is left of each: positions only rise
+        for (const auto& answer : std::span(answers).subspan(1)) others.push_back(answer.runs);
         for (const auto& [hash, position] : run) {
-            if (std::ranges::all_of(others, [&](const Answer& other) { return other.contains(position); }))
+            const auto isIn = [&](Postings& rest) { return skipTo(rest, position); };
+            if (std::ranges::all_of(others, [&](auto& runs) { return std::ranges::any_of(runs, isIn); }))
                 positions.push_back(position);
         }
     }
@@ -148,6 +145,19 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
     const auto doubles = std::ranges::unique(positions);
     positions.erase(doubles.begin(), doubles.end());
     return positions;
+}
+
+/// Leaves out what lies before `position`, in steps that double: answers of like sizes are walked side by side, and of
+/// a long one most is never looked at. True when `position` comes next.
+bool RegistrySnapshot::skipTo(Postings& rest, std::uint32_t position) {
+    std::size_t step = 1;
+    while (step < rest.size() && rest[step].position < position) step *= 2;
+    const auto end = rest.begin() + static_cast<std::ptrdiff_t>(std::min(step + 1, rest.size()));
+    const auto next =
+        std::lower_bound(rest.begin() + static_cast<std::ptrdiff_t>(std::min(step / 2, rest.size())), end, position,
+                         [](const Posting& posting, std::uint32_t wanted) { return posting.position < wanted; });
+    rest = {next, rest.end()};
+    return !rest.empty() && rest.front().position == position;
 }
 
 std::vector<InstalledPlugInRef> RegistrySnapshot::matching(const std::vector<EqualityTest>& tests) const {

@@ -62,6 +62,7 @@ private:
 
     std::shared_ptr<const Index> indexFor(const std::string& key) const;
     Positions positionsMatching(const std::vector<EqualityTest>& tests) const;
+    static bool skipTo(Postings& rest, std::uint32_t position);
 
     const Knowledge _knowledge;
     std::vector<InstalledPlugInRef> _plugIns;
