@@ -22,8 +22,6 @@ public:
     virtual Result<std::string> executablePath(const AuditToken& peer, std::size_t bufferSize) = 0;
     /// This process's own environment variable; none when it is not set.
     virtual std::optional<std::string> environmentVariable(const std::string& name) = 0;
-    /// The real user this process works for.
-    virtual std::uint32_t currentUser() = 0;
 };
 
 } // namespace platform

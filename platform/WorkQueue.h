@@ -25,10 +25,10 @@ public:
     /// itself. Items still waiting when the last reference goes are run first; the destructor does not wait.
     virtual void async(Item item) = 0;
 
-    /// As `async`, for items of microseconds: on an idle queue a thread of the platform that delivers events, such as
-    /// the transport's, may run the item (and others of its kind) itself once the delivery has returned, which saves a
-    /// wake-up that costs as much as the item.
-    virtual void asyncOnCaller(Item item) = 0;
+    /// As `async`, for items that may take microseconds only: on an idle queue a thread of the platform that delivers
+    /// events, such as the transport's, may run the item itself once the delivery has returned, which saves a wake-up
+    /// that costs as much as the item. It asks `isBrief` when it has come to the item, before it runs it.
+    virtual void asyncOnCaller(Item item, std::function<bool()> isBrief) = 0;
 
     /// Runs `item` now, after everything submitted before it, and returns its result when it is done.
     /// On an idle queue it runs on the caller's thread, at the cost of a lock. Calling it from the queue itself is a

@@ -65,7 +65,10 @@ std::shared_ptr<platform::Connection> Transaction::connection() const { return _
 bool Transaction::isBrief() const {
     const auto type = _request.string(key::request);
     const RequestType* known = type ? typeNamed(*type) : nullptr;
-    return known != nullptr && known->isBrief;
+    if (known == nullptr || !known->isBrief || _request[key::paths]) return false;
+    // A record that has to be made first takes files, and perhaps a look at the disk.
+    const auto uuid = _request.uuid(key::uuids);
+    return !uuid || server()->hasRecord(*uuid);
 }
 
 void Transaction::dispatch() {

@@ -30,7 +30,7 @@ public:
     static std::shared_ptr<Transaction> initWithRequest(const platform::ReceivedMessage& message,
                                                         std::shared_ptr<ZBDQmxClient> client);
 
-    /// Whether serving it is, but for the first time that a plug-in is seen, a matter of microseconds.
+    /// Whether serving it now, when its turn on the service queue has come, is a matter of microseconds.
     bool isBrief() const;
 
     /// Checks version and liveness, then calls the handler of the request's type. A request of a dead client is

@@ -15,8 +15,7 @@ using platform::UUID;
 ZBDPlugInRef Transaction::findPlugInByUUID(const UUID& uuid) { return server()->findPlugIn(uuid); }
 
 ZBDPlugInRef Transaction::findPlugInByPathURL(std::string_view text) {
-    const auto url = URL::parse(text);
-    return url ? server()->findPlugInAtPath(*url) : nullptr;
+    return server()->findPlugInAtPath(URL::parse(text));
 }
 
 void Transaction::findPlugIn() {

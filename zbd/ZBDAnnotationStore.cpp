@@ -157,7 +157,6 @@ URL ZBDAnnotationStore::globalURL(platform::Platform& platform) {
 URL ZBDAnnotationStore::containerURL(platform::Platform& platform) {
     const auto path = platform.containers.userContainer("com.nordane.zbd");
     if (path) return URL::file(*path);
-    log::ops().error("annotations of earlier versions cannot be looked for: %{public}@", path.error());
     const auto number = static_cast<std::uint64_t>(path.error().code);
     log::ops().error("failed to get storage container: error=%llu", number);
     zembra::fatalInternalError(platform::format("unable to locate user container: error %llu", number));

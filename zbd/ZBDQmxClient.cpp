@@ -72,16 +72,14 @@ void ZBDQmxClient::handleRequest(const ReceivedMessage& message) {
     if (platform::trace::requestInputEnabled()) {
         platform::trace::requestInput(pid(), message.content.description().c_str());
     }
-    auto transaction = Transaction::initWithRequest(message, shared_from_this());
-    const auto size = transaction->isBrief() ? ZBDServer::WorkSize::brief : ZBDServer::WorkSize::any;
-    _server->submitWork(
-        [self = shared_from_this(), transaction = std::move(transaction)] {
-            if (++self->_requestCount % requestCountInterval == 0) {
-                log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
-            }
-            transaction->dispatch();
-        },
-        size);
+    const auto transaction = Transaction::initWithRequest(message, shared_from_this());
+    const auto serve = [self = shared_from_this(), transaction] {
+        if (++self->_requestCount % requestCountInterval == 0) {
+            log::ops().debug("client %d used %u requests so far", self->pid(), self->_requestCount);
+        }
+        transaction->dispatch();
+    };
+    _server->submitWork(serve, [transaction] { return transaction->isBrief(); });
 }
 
 void ZBDQmxClient::dying() { log::ops().debug("client %d termination imminent", pid()); }

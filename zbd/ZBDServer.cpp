@@ -66,12 +66,8 @@ void ZBDServer::run() {
     platform().runLoop.run();
 }
 
-void ZBDServer::submitWork(platform::WorkQueue::Item item, WorkSize size) {
-    if (size == WorkSize::brief) {
-        _mainQueue->asyncOnCaller(std::move(item));
-    } else {
-        _mainQueue->async(std::move(item));
-    }
+void ZBDServer::submitWork(platform::WorkQueue::Item item, std::function<bool()> isBrief) {
+    _mainQueue->asyncOnCaller(std::move(item), std::move(isBrief));
 }
 
 void ZBDServer::stop() {

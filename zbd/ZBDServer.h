@@ -35,10 +35,9 @@ public:
     /// Resumes the listener and serves the main run loop. Main thread; does not return while the process lives.
     void run();
 
-    enum class WorkSize { any, brief };
-    /// Enqueues `item` on the service queue: it runs later, after everything submitted before it. Any thread. What is
-    /// done in microseconds is brief, and spared a hand-over that costs as much as the work.
-    void submitWork(platform::WorkQueue::Item item, WorkSize size = WorkSize::any);
+    /// Enqueues `item` on the service queue: it runs later, after everything submitted before it. Any thread. What
+    /// `isBrief`, asked when its turn comes, says to be done in microseconds is spared a hand-over that costs as much.
+    void submitWork(platform::WorkQueue::Item item, std::function<bool()> isBrief = nullptr);
 
     /// Accepts no further connections and releases every hold. Existing connections are not touched. Not on the holds
     /// queue.

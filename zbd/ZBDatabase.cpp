@@ -141,10 +141,14 @@ ZBDPlugInRef ZBDatabase::findPlugIn(const UUID& uuid) {
     });
 }
 
-ZBDPlugInRef ZBDatabase::findPlugInAtPath(const URL& url) {
-    const auto proxy = _workspace.plugInForURL(url);
+bool ZBDatabase::hasRecord(const UUID& uuid) const {
+    return _sync->sync([&] { return _cache.contains(uuid); });
+}
+
+ZBDPlugInRef ZBDatabase::findPlugInAtPath(const std::optional<URL>& url) {
+    const auto proxy = url ? _workspace.plugInForURL(*url) : nullptr;
     if (!proxy) {
-        log::ops().info("Catalix cannot find plug-in at path:%@", url.path());
+        log::ops().info("Catalix cannot find plug-in at path:%@", pathOf(url));
         return nullptr;
     }
     return proxy->uuid ? findPlugIn(*proxy->uuid) : plugInForProxy(proxy);

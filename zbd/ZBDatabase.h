@@ -48,7 +48,10 @@ public:
     /// its rules. None when the registry does not answer.
     std::optional<std::vector<ZBDPlugInRef>> findPlugIns(const std::optional<platform::Dictionary>& query);
     ZBDPlugInRef findPlugIn(const platform::UUID& uuid);
-    ZBDPlugInRef findPlugInAtPath(const platform::URL& url);
+    /// Whether the plug-in's record is cached.
+    bool hasRecord(const platform::UUID& uuid) const;
+    /// None also for what is no URL.
+    ZBDPlugInRef findPlugInAtPath(const std::optional<platform::URL>& url);
     /// None when the application is unknown or has no plug-ins.
     std::optional<std::vector<ZBDPlugInRef>> plugInsWithinApplication(const platform::URL& url);
 

@@ -588,6 +588,7 @@ void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, C
         if (known) change.removed.emplace(path, known);
         added.push_back(std::move(plugIn));
     }
+    noteMoved(added, change);
     for (const auto& [path, plugIn] : change.removed) {
         _plugIns.erase(path);
         _unsavedPlugIns.insert(path);
@@ -612,6 +613,19 @@ void InstalledBundles::takeInPlugIns(const Places& places, const Found& found, C
     }
 }
 
+/// A directory that is moved while its folder is read shows at both places; then the old one is gone by now, and its
+/// plug-ins go in the same change, so that the new ones are known for who they were.
+void InstalledBundles::noteMoved(const std::vector<std::shared_ptr<InstalledPlugIn>>& added, Change& change) const {
+    std::unordered_set<std::uint64_t> inodes;
+    for (const auto& plugIn : added) inodes.insert(plugIn->facts->identity.inode);
+    if (inodes.empty()) return;
+    for (const auto& [path, plugIn] : _plugIns) {
+        struct stat status{};
+        if (!inodes.contains(plugIn->facts->identity.inode) || lstat(path.c_str(), &status) == 0) continue;
+        if (errno == ENOENT) change.removed.emplace(path, plugIn);
+    }
+}
+
 /// Gives every plug-in the application that is known now. True when one had another one.
 bool InstalledBundles::repointPlugIns() {
     bool isChanged = false;
@@ -621,10 +635,17 @@ bool InstalledBundles::repointPlugIns() {
             auto& plugIn = _plugIns[plugInPath];
             if (!plugIn->application || plugIn->application->path != path || plugIn->application == application)
                 continue;
-            auto renewed = std::make_shared<InstalledPlugIn>(*plugIn);
-            renewed->application = application;
-            renewed->proxy = {};
-            plugIn = std::move(renewed);
+            // By name: what readers made of the old one is theirs, under a lock of theirs.
+            plugIn = std::make_shared<InstalledPlugIn>(InstalledPlugIn{
+                .path = plugIn->path,
+                .uuid = plugIn->uuid,
+                .identifier = plugIn->identifier,
+                .originalIdentifier = plugIn->originalIdentifier,
+                .registered = plugIn->registered,
+                .application = application,
+                .facts = plugIn->facts,
+                .proxy = {},
+            });
             _unsavedPlugIns.insert(plugInPath);
             isChanged = true;
         }

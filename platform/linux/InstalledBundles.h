@@ -119,6 +119,7 @@ private:
     bool takeInApplications(const Places& places, const Found& found);
     void takeInPlugIns(const Places& places, const Found& found, Change& change);
     bool repointPlugIns();
+    void noteMoved(const std::vector<std::shared_ptr<InstalledPlugIn>>& added, Change& change) const;
     void identify(std::vector<std::shared_ptr<InstalledPlugIn>> added, const PlugIns& removed);
     void save();
 

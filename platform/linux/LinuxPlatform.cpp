@@ -39,7 +39,7 @@ struct LinuxPlatform::Services {
     Processes processes;
     CodeSigning codeSigning;
     Containers containers{root};
-    Preferences preferences{root, files};
+    Preferences preferences{root};
     Locale locale{root, files};
     Bundles bundles{files};
     Interfaces interfaces;

@@ -1,11 +1,9 @@
 #include "platform/linux/Locale.h"
 
 #include "platform/PropertyList.h"
-#include "platform/linux/SystemError.h"
 
 #include <algorithm>
 #include <cctype>
-#include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 #include <sys/inotify.h>
@@ -48,8 +46,6 @@ std::optional<std::vector<std::string>> languagesOfFile(std::string_view bytes) 
     }
     return languages;
 }
-
-std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
 } // namespace
 
@@ -115,20 +111,6 @@ void Locale::read() {
         _languages = std::move(languages);
     }
     _observers->notifyAll();
-}
-
-Failure Locale::setLanguages(const std::vector<std::string>& languages) {
-    if (languages.size() > maximumLanguages) return systemError(E2BIG, languagesKey);
-    for (const auto& language : languages) {
-        if (!isLanguage(language)) return systemError(EINVAL, "language \"" + language + "\"");
-    }
-    const auto bytes = encodeXML(Dictionary{{languagesKey, Array::of(languages)}});
-    if (!bytes) return bytes.error();
-    std::error_code ignored; // shows when the file is written
-    std::filesystem::create_directories(parentOf(_path), ignored);
-    if (auto failure = _files.writeAtomically(_path, *bytes)) return failure;
-    if (isWatched()) _watcher.drain();
-    return std::nullopt;
 }
 
 std::vector<std::string> Locale::environmentLanguages() {

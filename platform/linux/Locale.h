@@ -26,10 +26,6 @@ public:
     std::unique_ptr<LocaleObservation> observeChanges(std::shared_ptr<WorkQueue> queue,
                                                       std::function<void()> handler) override;
 
-    /// Stores the languages of this platform. `languages` here tells them at once, elsewhere after the notice. Refuses
-    /// names that are no language tags, and more of them than are read.
-    Failure setLanguages(const std::vector<std::string>& languages);
-
     /// The languages of this process's environment, as `languagesOfName` reads the first of LC_ALL, LC_MESSAGES and
     /// LANG that is set.
     static std::vector<std::string> environmentLanguages();

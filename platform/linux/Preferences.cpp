@@ -8,7 +8,6 @@
 #include <cerrno>
 #include <climits>
 #include <fcntl.h>
-#include <sys/file.h>
 #include <utility>
 
 namespace platform::linux_ {
@@ -55,8 +54,7 @@ Result<std::string> readAll(int descriptor, const std::string& path) {
 
 } // namespace
 
-Preferences::Preferences(Root root, platform::Files& files, uid_t user)
-    : _root(std::move(root)), _files(files), _user(user), _host(hostName()) {}
+Preferences::Preferences(Root root, uid_t user) : _root(std::move(root)), _user(user), _host(hostName()) {}
 
 Preferences::Identity Preferences::identityOf(const struct stat& status) {
     return {status.st_dev, status.st_ino, status.st_size, status.st_mtim, status.st_ctim};
@@ -135,34 +133,6 @@ Result<Preferences::Stored> Preferences::read(const std::string& domain) const {
     const auto values = content->dictionary();
     if (!values) return Error{propertyListErrorDomain, 0, place + ": no dictionary"};
     return Stored{*values, isSettled ? std::optional(identity) : std::nullopt};
-}
-
-Failure Preferences::setValue(const std::string& domain, const std::string& key, const Value& value) {
-    for (const auto& name : {domain, fileName(domain)}) {
-        if (const int number = pathComponentError(name)) return systemError(number, "preferences domain");
-    }
-    const auto directory = openUserDirectory(_root.users(), _user, {directoryName}, MissingDirectory::made);
-    if (!directory) return directory.error();
-    // Held from reading to writing, so that two writers do not undo each other; ends with the descriptor.
-    while (::flock(directory->get(), LOCK_EX) != 0) {
-        if (errno != EINTR) return systemError(errno, path(domain));
-    }
-
-    MutableDictionary values;
-    if (const auto stored = read(domain)) {
-        values = MutableDictionary::copyOf(stored->values);
-    } else if (stored.error().domain != posixErrorDomain || stored.error().code != ENOENT) {
-        return stored.error();
-    }
-    if (value) {
-        values.set(key, value);
-    } else {
-        values.remove(key);
-    }
-    const auto bytes = encodeXML(values);
-    if (!bytes) return bytes.error();
-    if (bytes->size() > maximumFileSize) return systemError(EFBIG, path(domain));
-    return _files.writeAtomically(path(domain), *bytes);
 }
 
 } // namespace platform::linux_

@@ -1,7 +1,6 @@
 #pragma once
 
 #include "platform/Error.h"
-#include "platform/Files.h"
 #include "platform/Preferences.h"
 #include "platform/linux/Root.h"
 
@@ -22,17 +21,13 @@ namespace platform::linux_ {
 /// any thread.
 class Preferences final : public platform::Preferences {
 public:
-    Preferences(Root root, platform::Files& files, uid_t user = ::geteuid());
+    explicit Preferences(Root root, uid_t user = ::geteuid());
 
     /// A domain that cannot be part of a file name is not added.
     void addDomain(const std::string& domain) override;
     /// Costs one stat when the file is the one read last. A missing file holds no values.
     bool synchronize(const std::string& domain) override;
     Value value(const std::string& domain, const std::string& key) override;
-
-    /// Stores a value, for tools; an absent one removes the key. Writers in several processes take turns. Values here
-    /// change with the next `synchronize`.
-    Failure setValue(const std::string& domain, const std::string& key, const Value& value);
 
 private:
     /// What tells one state of a file from another without reading it.
@@ -60,7 +55,6 @@ private:
     Result<Stored> read(const std::string& domain) const;
 
     const Root _root;
-    platform::Files& _files;
     const uid_t _user;
     const std::string _host;
 

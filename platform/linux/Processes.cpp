@@ -46,6 +46,4 @@ std::optional<std::string> Processes::environmentVariable(const std::string& nam
     return value ? std::optional<std::string>(value) : std::nullopt;
 }
 
-std::uint32_t Processes::currentUser() { return getuid(); }
-
 } // namespace platform::linux_

@@ -12,7 +12,6 @@ public:
     Result<std::string> executablePath(std::int32_t pid, std::size_t bufferSize) override;
     Result<std::string> executablePath(const AuditToken& peer, std::size_t bufferSize) override;
     std::optional<std::string> environmentVariable(const std::string& name) override;
-    std::uint32_t currentUser() override;
 };
 
 } // namespace platform::linux_

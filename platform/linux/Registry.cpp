@@ -152,6 +152,7 @@ public:
     /// the bundles is not, theirs are looked at here.
     std::vector<InstalledPlugInRef> matching(const std::vector<EqualityTest>& tests) {
         if (!tests.empty() && _stage.load(std::memory_order_acquire) < Stage::verified) {
+            wake();
             auto plugIns = snapshot()->matching(tests); // meanwhile the other thread looks
             awaitStage(Stage::glanced);
             const auto isUnchanged = [&](const auto& plugIn) { return _bundles.isUnchanged(*plugIn); };
@@ -271,6 +272,11 @@ private:
         _stageReached.wait(lock, [&] { return _stage.load(std::memory_order_relaxed) >= stage; });
     }
 
+    bool isStopping() const {
+        const std::lock_guard lock(_mutex);
+        return _isStopping;
+    }
+
     void wake() const {
         const std::uint64_t one = 1;
         // Fails only when the counter is full, and then the thread is awake.
@@ -280,7 +286,7 @@ private:
     void run() {
         pollfd wanted{_wake.get(), POLLIN, 0};
         (void)poll(&wanted, 1, startDelay);
-        while (_bundles.stage() < Stage::watched) publish(_bundles.catchUp());
+        while (_bundles.stage() < Stage::watched && !isStopping()) publish(_bundles.catchUp());
         while (true) {
             pollfd waiting[] = {{_bundles.descriptor(), POLLIN, 0}, {_wake.get(), POLLIN, 0}};
             (void)poll(waiting, 2, -1);

@@ -55,7 +55,7 @@ public:
         (void)!::write(_event.get(), &one, sizeof one);
     }
 
-    void asyncOnCaller(Item item) override { async(std::move(item)); }
+    void asyncOnCaller(Item item, std::function<bool()> /*isBrief*/) override { async(std::move(item)); }
 
     bool isCurrent() const override { return std::this_thread::get_id() == _mainThread && _isRunning; }
 

@@ -425,7 +425,7 @@ void StreamConnection::onTurn() { read(); }
 void StreamConnection::read() {
     {
         const std::lock_guard lock(_mutex);
-        if (_state == State::closed || _paused) return; // unpausing gives another turn
+        if (_state == State::closed || _paused || _problem) return; // unpausing gives another turn
     }
     if (_frameBuffered) {
         deliverBuffered();
@@ -525,7 +525,7 @@ std::size_t StreamConnection::deliverFrames(std::string_view bytes) {
             break;
         }
         used += current.size;
-        if (_ending) return bytes.size();
+        if (_ending || _problem) return bytes.size();
         if (moreFollow && count == framesPerTurn) {
             _frameBuffered = true; // the others first
             break;
@@ -539,12 +539,16 @@ std::size_t StreamConnection::deliverFrames(std::string_view bytes) {
 }
 
 void StreamConnection::onServed() {
-    const std::lock_guard lock(_mutex);
-    if (!_gathering || _state != State::open) return;
-    _gathering = false;
-    flushOut();
-    updatePause();
-    updateInterest();
+    {
+        const std::lock_guard lock(_mutex);
+        if (_gathering && _state == State::open) {
+            _gathering = false;
+            flushOut();
+            updatePause();
+            updateInterest();
+        }
+    }
+    if (_problem) fail("malformed data (" + *_problem + ")");
 }
 
 /// False when the request must wait for replies to earlier ones.
@@ -631,7 +635,12 @@ void StreamConnection::deliverEvent(const std::shared_ptr<EventHandler>& handler
     });
 }
 
-void StreamConnection::malformed(const char* problem) { fail("malformed data (" + std::string(problem) + ")"); }
+/// Nothing more is read. The end comes after the replies to what came before, as far as this thread gives them.
+void StreamConnection::malformed(const char* problem) {
+    if (_problem) return;
+    _problem = problem;
+    _loop->whenServed(this);
+}
 
 void StreamConnection::fail(const std::string& reason) {
     Remains remains;

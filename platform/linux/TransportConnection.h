@@ -113,11 +113,12 @@ private:
     const std::shared_ptr<WorkQueue> _queue; // null: an accepted connection
 
     // The loop's thread only.
-    std::vector<char> _in;       // what came and was not delivered yet; its front is the start of a frame
-    Budget::Share _inShare;      // the capacity of `_in`
-    bool _frameBuffered = false; // `_in` may hold a complete frame
-    bool _ended = false;         // the peer sends no more
-    bool _draining = false;      // the peer is gone: what it sent before is delivered, then the connection is invalid
+    std::vector<char> _in;               // what came and was not delivered yet; its front is the start of a frame
+    Budget::Share _inShare;              // the capacity of `_in`
+    std::optional<std::string> _problem; // what is wrong with the data; nothing more is read then
+    bool _frameBuffered = false;         // `_in` may hold a complete frame
+    bool _ended = false;                 // the peer sends no more
+    bool _draining = false; // the peer is gone: what it sent before is delivered, then the connection is invalid
 
     std::atomic<bool> _ending = false; // cancelled or closed: nothing more is delivered
 

@@ -341,14 +341,15 @@ void StreamListener::accepted(Descriptor socket, AuditToken peer, Budget::Share 
 }
 
 void StreamListener::deliver(Event event) {
-    _queue->asyncOnCaller([listener = shared_from_this(), event = std::move(event)] {
+    const auto tell = [listener = shared_from_this(), event = std::move(event)] {
         std::shared_ptr<EventHandler> handler;
         {
             const std::lock_guard lock(listener->_mutex);
             handler = listener->_handler;
         }
         if (handler && !listener->_loop->isStopped()) (*handler)(event);
-    });
+    };
+    _queue->asyncOnCaller(tell, [] { return true; });
 }
 
 } // namespace platform::linux_::qmx

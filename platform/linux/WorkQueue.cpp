@@ -108,11 +108,11 @@ public:
         : _label(std::move(label)), _quality(quality), _pool(std::move(pool)) {}
 
     void async(Item item) override {
-        if (enqueue({std::move(item), nullptr, false})) leaveToPool();
+        if (enqueue({std::move(item), nullptr, nullptr})) leaveToPool();
     }
 
-    void asyncOnCaller(Item item) override {
-        if (!enqueue({std::move(item), nullptr, true})) return;
+    void asyncOnCaller(Item item, std::function<bool()> isBrief) override {
+        if (!enqueue({std::move(item), nullptr, std::move(isBrief)})) return;
         if (lentThread != nullptr) {
             lentThread->_taken.push_back(shared_from_this());
         } else {
@@ -126,10 +126,10 @@ public:
     /// Runs waiting items. The caller has the turn, and has passed it on or given it up on return.
     void runTurn(std::size_t limit = poolBatch, bool isLent = false) {
         for (std::size_t count = 0; count < limit; ++count) {
+            if (isLent && !isNextBrief()) break;
             Item item;
             {
                 const std::lock_guard guard(_lock);
-                if (isLent && !_line.empty() && !_line.front().isBrief) break;
                 if (!takeNext(item)) return;
             }
             runItem(item);
@@ -150,7 +150,7 @@ private:
     struct Entry {
         Item item;
         Waiter* waiter; // instead of an item
-        bool isBrief;
+        std::function<bool()> isBrief;
     };
 
     /// True when the queue was idle and the turn is the caller's now.
@@ -170,7 +170,7 @@ private:
             std::unique_lock lock(_lock);
             if (_isTaken) {
                 Waiter waiter;
-                _line.push_back({nullptr, &waiter, false});
+                _line.push_back({nullptr, &waiter, nullptr});
                 waiter.granted.wait(lock, [&] { return waiter.isGranted; });
             } else {
                 _isTaken = true;
@@ -186,6 +186,17 @@ private:
         } turn{*this};
         _runner.store(thisThread(), std::memory_order_relaxed);
         call.invoke(call.context);
+    }
+
+    /// The caller has the turn, so the front of the line stays where it is while others join at the end.
+    bool isNextBrief() {
+        const Entry* next = nullptr;
+        {
+            const std::lock_guard guard(_lock);
+            if (_line.empty()) return true; // nothing is
+            next = &_line.front();
+        }
+        return next->isBrief && next->isBrief();
     }
 
     void runItem(Item& item) noexcept {

@@ -15,7 +15,7 @@ class Queue;
 
 /// Makes the calling thread one of those that serve queues, for as long as this object lives: what the thread submits
 /// with `asyncOnCaller` to idle queues it runs itself, at its next `serve`. For a thread's outermost loop: nothing that
-/// it calls there holds a lock or is on a queue.
+/// it calls there holds a lock or is on a queue. Goes before the queues do.
 class LentThread {
 public:
     LentThread();
