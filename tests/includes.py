@@ -1,8 +1,5 @@
 #!/usr/bin/env python3
-"""Checks that the #include lines keep the direction of dependencies (docs/architecture.md).
-
-usage: includes.py PROJECT
-"""
+"""Checks that the #include lines of the project named keep the direction of dependencies (docs/architecture.md)."""
 import pathlib
 import re
 import sys
@@ -22,18 +19,15 @@ RULES = {
 
 root = pathlib.Path(sys.argv[1])
 faults, seen = [], 0
-for path in sorted(root.rglob("*")):
+for path in sorted([*root.rglob("*.h"), *root.rglob("*.cpp")]):
     relative = str(path.relative_to(root))
-    rule = next((rule for start, rule in RULES.items() if relative.startswith(start)), None)
-    if path.suffix not in (".h", ".cpp") or not rule:
-        continue
-    seen += 1
-    unconditional, allowed = rule
+    unconditional, allowed = next((rule for start, rule in RULES.items() if relative.startswith(start)), (False, ""))
+    seen += allowed != ""
     for number, line in enumerate(path.read_text(encoding="utf-8").splitlines(), 1):
         include = re.match(r"\s*#\s*include\s*(.*)", line)
+        if include and not re.match(allowed, include[1]):
+            faults.append(f"{relative}:{number}: {line.strip()}")
         if unconditional and re.match(r"\s*#\s*if(n?def)?\b(?!.*__cplusplus)", line):
             faults.append(f"{relative}:{number}: conditional compilation: {line.strip()}")
-        elif include and not re.match(allowed, include[1]):
-            faults.append(f"{relative}:{number}: {line.strip()}")
 print("\n".join(faults) if faults else f"{seen} files keep the direction of dependencies")
 sys.exit(1 if faults or not seen else 0)

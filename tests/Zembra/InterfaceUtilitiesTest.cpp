@@ -7,86 +7,45 @@
 namespace {
 
 using namespace platform;
-using zembra::compoundInterface;
+using namespace std::string_literals;
+using enum InterfaceSide;
 
-struct InterfaceUtilities : testing::Test {
+TEST(CompoundInterface, IsMadeOnceForTheSameNames) {
     support::FakeInterfaces interfaces;
-    const std::shared_ptr<Interface> a = interfaces.add("A"), b = interfaces.add("B");
-    const std::shared_ptr<InterfaceDescription> description = interfaces.describe(a);
-
-    InterfaceUtilities() {
-        for (const char* name : {"ClassA", "ClassB"}) interfaces.addClass(name);
-    }
-    Failure specify(const std::string& operation, std::string_view classes) {
-        return zembra::interfaceClassSpecification(interfaces, *description, operation, classes);
-    }
-    std::set<std::string> classes(const std::string& operation, std::int64_t argument, InterfaceSide side) {
-        return description->classes(operation, argument, side);
-    }
-};
-
-TEST_F(InterfaceUtilities, CompoundIsMadeOnceForTheSameNames) {
+    for (const char* name : {"A", "B"}) interfaces.add(name);
     Failure error;
-    const auto compound = compoundInterface(interfaces, Array{"A", "B"}, &error);
-    ASSERT_TRUE(compound);
+    const auto compound = zembra::compoundInterface(interfaces, Array{"A", "B"}, &error);
     EXPECT_EQ(compound->name(), "__XX_COMPOUND__A__B");
-    EXPECT_EQ(compound->included(), (std::vector{a, b}));
-    EXPECT_EQ(compoundInterface(interfaces, Array{"A", "B"}, &error), compound);
-    EXPECT_NE(compoundInterface(interfaces, Array{"B", "A"}, &error), compound);
-    EXPECT_EQ(compoundInterface(interfaces, Array(), &error)->name(), "__XX_COMPOUND");
-    EXPECT_EQ(compoundInterface(interfaces, "A", &error), a);
-    EXPECT_FALSE(compoundInterface(interfaces, 5, &error) || compoundInterface(interfaces, Value(), &error) || error);
-
-    interfaces.overtaken.insert("__XX_COMPOUND__A"); // another thread makes it at the same time
-    const auto shared = compoundInterface(interfaces, Array{"A"}, nullptr);
-    EXPECT_TRUE(shared && interfaces.find("__XX_COMPOUND__A") == shared);
-    // Without one of its parts or its name there is none.
-    EXPECT_FALSE(compoundInterface(interfaces, Array{"A", "Z"}, &error) || interfaces.find("__XX_COMPOUND__A__Z"));
+    EXPECT_EQ(compound->included(), (std::vector{interfaces.find("A"), interfaces.find("B")}));
+    EXPECT_EQ(zembra::compoundInterface(interfaces, Array{"A", "B"}, &error), compound);
+    EXPECT_FALSE(zembra::compoundInterface(interfaces, Array{"A", "Z"}, &error));
     const char* missing =
         "unable to locate protocol \"Z\" - check that it is defined and not inadvertently optimized away";
     EXPECT_EQ(error, (Error{"Zembra", 12, missing}));
     EXPECT_TRUE(support::logged(LogLevel::standard, missing));
-    EXPECT_FALSE(compoundInterface(interfaces, Array{"A", 5}, nullptr));
-    interfaces.taken.insert("__XX_COMPOUND__B");
-    EXPECT_FALSE(compoundInterface(interfaces, Array{"B"}, &error));
-    EXPECT_EQ(error, (Error{"Zembra", 12, "unable to create compound protocol"}));
 }
 
-TEST_F(InterfaceUtilities, SpecificationDescribesArguments) {
-    EXPECT_FALSE(specify("open", "") || specify("open", "request:0:{ClassA+ClassB},reply:1:B"));
-    EXPECT_EQ(classes("open", 0, InterfaceSide::request), (std::set<std::string>{"ClassA", "ClassB"}));
-    EXPECT_TRUE(classes("open", 0, InterfaceSide::reply).empty());
-    EXPECT_EQ(description->nestedInterface("open", 1, InterfaceSide::reply)->interface(), b);
-    // Of the index counts what reads as a number at its front.
-    const std::pair<std::int64_t, std::vector<std::string>> indices[] = {
-        {7, {"7", "+7", " \t\n\v\f\r+7x"}},
-        {-7, {"-7"}},
-        {0, {"", " ", "x7", "+", "++7", "+-7", "-+7", "+ 7"}},
-        {INT64_MIN, {" -99999999999999999999"}},
-        {INT64_MAX, {"99999999999999999999"}}};
-    for (const auto& [index, texts] : indices)
-        for (const std::string& operation : texts) { // each its own
-            EXPECT_EQ(specify(operation, "reply:" + operation + ":{ClassA}"), std::nullopt);
-            EXPECT_FALSE(classes(operation, index, InterfaceSide::reply).empty()) << operation;
-        }
-}
-
-TEST_F(InterfaceUtilities, SpecificationQuotesWhatIsMalformed) {
-    const auto refuses = [&](const std::string& text, const std::string& quoted) {
-        EXPECT_EQ(specify("open", text), (Error{"Zembra", 6, quoted})) << text;
+TEST(InterfaceClassSpecification, DescribesArgumentsAndQuotesWhatIsMalformed) {
+    support::FakeInterfaces interfaces;
+    const auto description = interfaces.describe(interfaces.add("A"));
+    for (const char* name : {"ClassA", "ClassB"}) interfaces.addClass(name);
+    const auto specify = [&](const std::string& operation, const std::string& classes) {
+        return zembra::interfaceClassSpecification(interfaces, *description, operation, classes);
     };
-    for (const char* whole : {"request:0", "request:0:A:B", ","}) refuses(whole, whole);
-    for (const std::string type : {"", "Z", "{", "{ClassA"}) refuses("request:0:" + type, type);
-    for (const char* text : {"request:0:{}", "request:0:{ClassA+}"}) refuses(text, "");
-    refuses("Request:0:A", "Request");
-    refuses("request:0:{ClassA+ClassZ}", "ClassZ");
-    EXPECT_TRUE(classes("open", 0, InterfaceSide::request).empty());
-
+    // Of the index counts what reads as a number at its front.
+    EXPECT_FALSE(specify("open", "") || specify("open", "request:x:{ClassA+ClassB},reply: +7x:A"));
+    EXPECT_EQ(description->classes("open", 0, request), (std::set<std::string>{"ClassA", "ClassB"}));
+    EXPECT_TRUE(description->nestedInterface("open", 7, reply));
     // Entries before the faulty one have taken effect, those behind it not.
     const std::string mixed = "request:0:{ClassA},reply:0,request:1:{ClassA}";
-    EXPECT_EQ(specify("open", mixed)->description, mixed);
-    EXPECT_FALSE(classes("open", 0, InterfaceSide::request).empty());
-    EXPECT_TRUE(classes("open", 1, InterfaceSide::request).empty());
+    std::vector<std::string> quoted;
+    for (const auto& text : {"request:0:A:B"s, "Request:0:A"s, "request:0:"s, "request:0:Z"s, "request:0:{"s,
+                             "request:0:{}"s, "request:0:{ClassA+ClassZ}"s, mixed})
+        quoted.push_back(specify(text, text)->text());
+    EXPECT_EQ(quoted, (std::vector<std::string>{"request:0:A:B", "Request", "", "Z", "{", "", "ClassZ", mixed}));
+    EXPECT_EQ(specify("open", ","), (Error{"Zembra", 6, ","}));
+    EXPECT_FALSE(description->classes(mixed, 0, request).empty());
+    EXPECT_TRUE(description->classes(mixed, 1, request).empty());
 }
 
 } // namespace

@@ -1,9 +1,6 @@
 #include "Zembra/AtomicField.h"
-#include "Zembra/ZBLog.h"
 #include "Zembra/ZBUtilities.h"
 #include "platform/Hashing.h"
-#include "tests/support/SystemLogFake.h"
-#include "zbd/ZBDPlugInSignature.h"
 
 #include <gtest/gtest.h>
 #include <sstream>
@@ -28,64 +25,19 @@ TEST(CompareVersionString, OrdersByNumberThenByCharacter) {
     EXPECT_TRUE(compareVersionString("01.2", "1.1") > 0) << "what follows the equal numbers still counts";
 }
 
-TEST(Utilities, ChangeACopyAndLeaveOutAbsentResults) {
-    const Dictionary original{{"a", 1}, {"b", 2}};
-    EXPECT_EQ(zembra::dictionaryChanging(original, "b", 3), (Dictionary{{"a", 1}, {"b", 3}}));
-    EXPECT_EQ(zembra::dictionaryChanging(original, "a", Value()), (Dictionary{{"b", 2}}));
-    EXPECT_FALSE(zembra::dictionaryChanging(original, "c", Value())->sharesStorageWith(original));
-    EXPECT_EQ(zembra::dictionaryChanging(std::nullopt, "a", 1), std::nullopt);
-    EXPECT_EQ(original, (Dictionary{{"a", 1}, {"b", 2}}));
-    const auto squareOfOdd = [](int number) { return number % 2 == 1 ? Value(number * number) : Value(); };
-    EXPECT_EQ(zembra::arrayWithValues(std::vector{3, 2, 1}, squareOfOdd), (Array{9, 1}));
-}
-
 TEST(AtomicField, ReaderKeepsAWholeValueWhileAnotherReplacesIt) {
     zembra::AtomicField<std::string> field(std::string(100, 'a'));
-    std::atomic<bool> stop = false;
-    std::thread writer([&] {
-        for (char letter = 'a'; !stop; letter = static_cast<char>(letter ^ 1)) field.set(std::string(100, letter));
+    const std::jthread writer([&](const std::stop_token& stop) {
+        for (int i = 0; !stop.stop_requested(); ++i) field.set(std::string(100, i % 2 == 0 ? 'b' : 'c'));
     });
     for (int i = 0; i < 20'000; ++i) {
         const std::string value = field.get();
         EXPECT_EQ(value, std::string(100, value.front()));
     }
-    stop = true;
-    writer.join();
 }
 
-TEST(PlugInSignature, HashDiffersAndRequirementStays) {
-    Failure error;
-    const auto first = zbd::ZBDPlugInSignature::initWithURL(URL::file("/Some.appex"), &error);
-    EXPECT_EQ(error, std::nullopt);
-    EXPECT_EQ(first->cdhash().size(), 20U);
-    EXPECT_NE(first->cdhash(), zbd::ZBDPlugInSignature::initWithURL(URL::file("/Some.appex"), nullptr)->cdhash());
-    EXPECT_EQ(first->requirement(), "dummy requirement");
-    // The published example of FIPS 180-2, appendix A.1.
+TEST(SHA1, AnswersThePublishedExample) { // of FIPS 180-2, appendix A.1
     EXPECT_EQ(sha1("abc"), "\xA9\x99\x3E\x36\x47\x06\x81\x6A\xBA\x3E\x25\x71\x78\x50\xC2\x6C\x9C\xD0\xD8\x9D");
-}
-
-TEST(Log, ChannelsAreHandlesOfTheirCategory) {
-    for (const auto& [channel, category] : {std::pair(&zembra::log::ops, "ops"),
-                                            {zembra::log::traffic, "traffic"},
-                                            {zembra::log::extension, "extension"},
-                                            {zembra::log::cx, "cx"},
-                                            {zembra::log::sandbox, "sandbox"}}) {
-        EXPECT_EQ(channel().category(), category);
-        EXPECT_EQ(channel().subsystem(), "com.nordane.Zembra");
-    }
-}
-
-TEST(Log, RefusedCategoriesUseTheDefaultLog) {
-    GTEST_FLAG_SET(death_test_style, "threadsafe"); // channels are made once per process, so this takes a fresh one
-    EXPECT_EXIT(
-        {
-            support::processLog.refuse("cx");
-            for (int i = 0; i < 2; ++i) zembra::log::cx().info("line");
-            for (const auto& [category, level, message] : support::processLog.lines())
-                std::fprintf(stderr, "<%s %d %s>", category.c_str(), static_cast<int>(level), message.c_str());
-            std::exit(0);
-        },
-        testing::ExitedWithCode(0), "^< 3 unable to create tracelog for category cx>< 1 line>< 1 line>$");
 }
 
 } // namespace

@@ -11,55 +11,41 @@ import scratch
 from scratch import manifest
 
 ZBIGNITE = scratch.BUILD + "/bin/zbignite"
-USAGE, NO_MANAGER, NOT_REGISTERED, REFUSED, NOT_EXECUTED = 120, 121, 122, 123, 125
+NO_MANAGER, NOT_REGISTERED = 121, 122
 INTERPRETER = os.path.realpath("/usr/bin/python3")  # its library is where plug-ins may read
 LANDLOCK_CREATE_RULESET = 444  # the same on every machine
 
 ATTEMPTS = {  # and the plug-ins that may
     "open(bundle + '/Info.vlist')": ("Free", "Keys"),
     "open(os.environ['HOME'] + '/file', 'w')": ("Free", "Keys"),
-    "open(container + '/file')": ("Keys",),
     "socket.create_connection(('127.0.0.1', port))": ("Free",),
-    "open(home)": (),
-    "open(other + '/Info.vlist')": (),
-    "open(bundle + '/Info.vlist', 'a')": (),
+    "open(home)": (), "open(other + '/Info.vlist')": (), "open(bundle + '/Info.vlist', 'a')": (),
     "os.kill(os.getppid(), signal.SIGTERM)": (),
 }
-# Runs in the plug-in: the error that each attempt gave, or none.
+# Runs in the plug-in: tells the error that each attempt gave, or none.
 TRY = """
 import json, os, signal, socket, sys
-results = {}
-for attempt in json.loads(sys.argv[1]):
+def attempt(code):
     try:
-        eval(attempt, globals(), json.loads(sys.argv[2]))
-        results[attempt] = None
+        eval(code, globals(), json.loads(sys.argv[2]))
     except OSError as error:
-        results[attempt] = type(error).__name__
-print(json.dumps(results))
+        return type(error).__name__
+print(json.dumps({code: attempt(code) for code in json.loads(sys.argv[1])}))
 """
-
-
-def code_manifest(name, service=None, **extension):
-    content = manifest(name, **extension)
-    del content["VKExtension"]["VKExtensionProtocol"]  # not data alone
-    return {**content, "VBBundleExecutable": "Program", "QMXService": service or {}}
 
 
 @unittest.skipUnless(ctypes.CDLL(None).syscall(LANDLOCK_CREATE_RULESET, None, 0, 1) > 0,
                      "this kernel has no Landlock, so no plug-in is started")
 class Launch(scratch.Case):
     def prepare(self):
-        self.lab = self.application("Lab", {
-            "Free.appex": code_manifest("free"),
-            "Keys.appex": code_manifest("keys", VKExtensionPointIdentifier="com.nordane.keyboard-service",
-                                        VKExtensionIdentifier="com.example.own-keys"),
-            "Wrong.appex": code_manifest("wrong", {"EnvironmentVariables": {"OWN": 1}}),
-            "Script.appex": code_manifest("script"),
-        })
-        for plugin in ("Free", "Keys", "Wrong"):
+        self.lab = self.path("Applications/Lab.app")
+        for plugin, point in (("Free", "com.example.point"), ("Keys", "com.nordane.keyboard-service")):
+            content = manifest(plugin.lower(), VKExtensionPointIdentifier=point)
+            del content["VKExtension"]["VKExtensionProtocol"]  # not data alone
+            content.update(VBBundleExecutable="Program", QMXService={})
+            scratch.write(self.bundle(plugin) + "/Info.vlist", content)
             shutil.copy(INTERPRETER, self.bundle(plugin) + "/Program")  # each test brings its own code
-        scratch.write(self.bundle("Script") + "/Program", b"#!/bin/sh\n")
-        os.chmod(self.bundle("Script") + "/Program", 0o755)
+        scratch.write(self.lab + "/Info.vlist", {"VBBundleIdentifier": "com.Lab", "VBBundleExecutable": "host"})
         self.start()
         # A confined process cannot be looked into, so neither can it look for leaks at its end.
         self.environment["ASAN_OPTIONS"] = "detect_leaks=0"
@@ -79,13 +65,9 @@ class Launch(scratch.Case):
     def test_confinement(self):
         scratch.write(self.path("home"), b"secret")
         self.ready("Free", "Keys")
-        where = "import os; open('file', 'w'); print(os.getcwd(), os.environ['HOME'])"
-        container, home = self.launch(0, "Keys", where).stdout.split()
-        self.assertEqual(container, home)
-        self.assertEqual(os.path.basename(container), "com.example.own-keys")
         with socket.create_server(("127.0.0.1", 0)) as listener:
             for plugin, other in (("Free", "Keys"), ("Keys", "Free")):
-                facts = {"home": self.path("home"), "container": container, "port": listener.getsockname()[1],
+                facts = {"home": self.path("home"), "port": listener.getsockname()[1],
                          "bundle": self.bundle(plugin), "other": self.bundle(other)}
                 result = self.launch(0, plugin, TRY, json.dumps(list(ATTEMPTS)), json.dumps(facts))
                 expected = {attempt: None if plugin in allowed else "PermissionError"
@@ -94,10 +76,7 @@ class Launch(scratch.Case):
 
     def test_who_may_launch(self):
         self.assertIn("is not registered for process", self.launch(NOT_REGISTERED, "Free").stderr)
-        self.ready("Free", "Wrong", "Script")
-        self.assertIn('the environment variable "OWN" is no string', self.launch(REFUSED, "Wrong").stderr)
-        self.assertIn("a script", self.launch(NOT_EXECUTED, "Script").stderr)
-        self.assertEqual(self.run_program(ZBIGNITE).returncode, USAGE)
+        self.ready("Free")
         self.kill()
         self.launch(NO_MANAGER, "Free")
         self.start()

@@ -1,12 +1,13 @@
 """A scratch platform for each test: bundles below a temporary root, the real zbd process, clients of it."""
 
+import contextlib
 import json
 import os
 import re
 import shutil
+import socket
 import subprocess
 import tempfile
-import threading
 import time
 import unittest
 import uuid
@@ -17,6 +18,7 @@ BUILD = os.path.abspath(os.environ.get("ZBD_BUILD", __file__ + "/../../../build/
 ZBD, ZBCTL = BUILD + "/bin/zbd", BUILD + "/bin/zbctl"
 SERVICE = "com.nordane.zembra.zbd"
 MANAGER = "com.nordane.private.zembra.manager"
+NOWHERE = uuid.UUID("00000000-0000-4000-8000-000000000000")  # of no plug-in
 DEADLINE = 60  # seconds; only ever reached by a failure, so it may be generous
 
 
@@ -52,12 +54,11 @@ class Case(unittest.TestCase):
     """Each test has its own platform, which `prepare` furnishes; at its end zbd stops and all is removed."""
 
     def setUp(self):
-        self.directory = os.path.realpath(self.enterContext(tempfile.TemporaryDirectory(prefix="zbd-test-")))
+        self.directory = self.enterContext(tempfile.TemporaryDirectory(prefix="zbd-", dir=os.path.realpath("/tmp")))
         self.environment = {name: value for name, value in os.environ.items()
                             if not name.startswith(("NORDANE_", "LISTEN_"))}
         self.environment["NORDANE_ROOT"] = self.path("")
         self.daemon_environment = {**self.environment, "NORDANE_LOG": "debug,private,stderr"}
-        self._logged = threading.Event()
         for below in ("Applications", "var/db", "run/nordane"):
             os.makedirs(self.path(below))
         self.socket_path = self.path("run/nordane/" + SERVICE)
@@ -82,65 +83,45 @@ class Case(unittest.TestCase):
 
     def start(self, *options, service=SERVICE):
         """Starts zbd and returns when the system accepts connections to its socket."""
-        self.process = subprocess.Popen([ZBD, *options], stdin=subprocess.DEVNULL, stderr=subprocess.PIPE,
-                                        env=self.daemon_environment, text=True, errors="replace")
-        self._log = []
-        self._log_reader = threading.Thread(target=self._read_log, args=[self.process.stderr])
-        self._log_reader.start()
+        with open(self.directory + "/log", "wb") as log:
+            self.process = subprocess.Popen([ZBD, *options], stdin=subprocess.DEVNULL, stderr=log,
+                                            env=self.daemon_environment)
         self.addCleanup(self.kill)
-        self.addCleanup(self._stop_if_running)
-        self._until(lambda: self._listens(self.path("run/nordane/" + service)), "zbd listens")
+        self.addCleanup(lambda: self.process.poll() is None and self.stop())
 
-    def _read_log(self, pipe):
-        with pipe:
-            for line in pipe:
-                self._log.append(line)
-                self._logged.set()
+        def listens():
+            with socket.socket(socket.AF_UNIX) as probe:
+                return probe.connect_ex(self.path("run/nordane/" + service)) == 0
 
-    @staticmethod
-    def _listens(path):
-        try:
-            qmx.connect_socket(path).close()
-            return True
-        except (FileNotFoundError, ConnectionRefusedError):
-            return False
+        self.until(listens, "zbd listens")
 
-    def _until(self, ask, what):
-        """What `ask` answers once that is true; fails when zbd has ended or after a long time."""
+    def until(self, ask, what):
+        """Returns once `ask` answers true; fails when zbd has ended or after a long time."""
         end = time.monotonic() + DEADLINE
-        while not (answer := ask()):
-            if not self._log_reader.is_alive() or time.monotonic() > end:
-                self.fail(f"not seen: {what}; zbd's status is {self.process.poll()}:\n{self.log()}")
-            self._logged.wait(0.05)  # listening is no event, so it is looked for as well
-            self._logged.clear()
-        return answer
+        while not ask():
+            # Neither listening nor what is in the log is an event, so both are looked for.
+            with contextlib.suppress(subprocess.TimeoutExpired):
+                self.process.wait(0.02)
+            if self.process.returncode is not None or time.monotonic() > end:
+                self.fail(f"not seen: {what}; zbd's status is {self.process.returncode}:\n{self.log()}")
 
     def log(self):
-        return "".join(self._log)
+        with open(self.directory + "/log", encoding="utf-8", errors="replace") as file:
+            return file.read()
 
     def wait_for_log(self, pattern, count=1):
-        """Returns the matches once the log holds `count` of the regular expression."""
-        def found():
-            matches = re.findall(pattern, self.log())
-            return matches if len(matches) >= count else None
-
-        return self._until(found, f"{pattern!r} {count} times in the log")
+        """Returns once the log holds as many matches of the regular expression."""
+        self.until(lambda: len(re.findall(pattern, self.log())) >= count, f"{pattern!r} {count} times logged")
 
     def stop(self):
         """SIGTERM, exit status 0, and the whole log."""
         self.process.terminate()
         self.assertEqual(self.process.wait(DEADLINE), 0, self.log())
-        self._log_reader.join()
         return self.log()
-
-    def _stop_if_running(self):
-        if self.process.poll() is None:
-            self.stop()
 
     def kill(self):
         self.process.kill()
         self.process.wait()
-        self._log_reader.join()
 
     # Clients.
 

@@ -1,8 +1,7 @@
 #include "platform/linux/Locale.h"
-#include "platform/PropertyList.h"
 #include "platform/linux/Files.h"
 #include "platform/linux/WorkQueue.h"
-#include "tests/support/LocaleFake.h"
+#include "tests/support/BundleTree.h"
 #include "tests/support/Mailbox.h"
 #include "tests/support/ScratchDirectory.h"
 
@@ -10,86 +9,39 @@
 
 namespace {
 
+using platform::linux_::Locale;
 using Languages = std::vector<std::string>;
-using Calls = support::Mailbox<int>;
 
-class LocaleTest : public testing::Test {
-protected:
-    auto observe(platform::Locale& observed, Calls& told) {
-        return observed.observeChanges(queue, [&] { told.put(0); });
-    }
-    /// What holds of every implementation.
-    void expectNoticesOfChanges(platform::Locale& observed, const std::function<void(const Languages&)>& setLanguages) {
-        Calls others;
-        auto observation = observe(observed, calls);
-        setLanguages({"de", "pt-BR"});
-        EXPECT_TRUE(calls.take());
-        EXPECT_EQ(observed.languages(), (Languages{"de", "pt-BR", "en"}));
-        setLanguages({"de", "pt-BR"});
-        setLanguages({"it"});
-        EXPECT_TRUE(calls.take());
-        EXPECT_EQ(observed.languages(), (Languages{"it", "en"}));
-        observation.reset();
-        const auto other = observe(observed, others);
-        setLanguages({"en", "sv", "en"});
-        EXPECT_TRUE(others.take());
-        queue->sync([] {});
-        EXPECT_EQ(calls.size(), 0U) << "the same list again is no change";
-    }
-
-    platform::linux_::WorkQueues queues;
-    std::shared_ptr<platform::WorkQueue> queue = queues.makeSerial("test", platform::QualityOfService::standard);
-    Calls calls;
-    support::ScratchDirectory scratch;
-    platform::linux_::Root root{scratch.path()};
-    platform::linux_::Files files{root};
-    // One object changes the languages and another is asked, as in two processes.
-    platform::linux_::Locale locale{root, files, {"fr"}};
-    platform::linux_::Locale writer{root, files, {"fr"}};
-};
-
-TEST_F(LocaleTest, TellsObserversOfChangesOnly) {
-    expectNoticesOfChanges(locale, [&](const Languages& languages) { EXPECT_FALSE(writer.setLanguages(languages)); });
-    EXPECT_EQ(locale.languages(), (Languages{"en", "sv"})) << "preferred English stays in its place";
-    support::FakeLocale twin;
-    expectNoticesOfChanges(twin, [&](Languages languages) {
-        languages.emplace_back("en");
-        twin.setLanguages(languages);
-    });
-}
-
-TEST_F(LocaleTest, FileMayBeMissingOrBroken) {
+TEST(Locale, TellsObserversOfChangesOnly) {
     const Languages fallback{"fr", "en"};
+    const support::ScratchDirectory scratch;
+    const platform::linux_::Root root(scratch.path());
     const std::string file = root.database() + "/Locale.vlist";
-    const auto fileOf = [](const platform::Value& value) { return *platform::encodeXML(value); };
-    const auto listOf = [&](const platform::Array& list) { return fileOf(platform::Dictionary{{"languages", list}}); };
-    const auto observation = observe(locale, calls);
-    EXPECT_EQ(locale.languages(), fallback);
-    EXPECT_FALSE(writer.setLanguages({"de"}));
-    EXPECT_EQ(writer.languages(), (Languages{"de", "en"})) << "at once";
-    EXPECT_TRUE(calls.take());
-    for (const std::string& bytes :
-         {std::string(), fileOf("de"), fileOf(platform::Dictionary{}), listOf({"it", 7}), listOf({"../../etc"}),
-          listOf({std::string(36, 'a')}), listOf(platform::Array(std::vector<platform::Value>(33, "it")))}) {
-        ASSERT_FALSE(files.writeAtomically(file, bytes));
-        EXPECT_EQ(platform::linux_::Locale(root, files, {"fr"}).languages(), fallback) << bytes;
+    platform::linux_::WorkQueues queues;
+    const auto queue = queues.makeSerial("test", platform::QualityOfService::standard);
+    platform::linux_::Files files(root);
+    support::Mailbox<Languages> told;
+    Locale locale(root, files, {"fr"});
+    const auto observation = locale.observeChanges(queue, [&] { told.put(locale.languages()); });
+    const auto listOf = [](const platform::Array& languages) {
+        return *platform::encodeXML(platform::Dictionary{{"languages", languages}});
+    };
+    for (const auto& [list, expected] : {std::pair<platform::Array, Languages>{{"de", "pt-BR"}, {"de", "pt-BR", "en"}},
+                                         {{"en", "sv", "en"}, {"en", "sv"}}}) {
+        support::writeFile(file, listOf(list));
+        EXPECT_EQ(told.take(), expected);
+        support::writeFile(file, listOf(list)); // no change, so nothing more is told
     }
-    EXPECT_FALSE(writer.setLanguages({"sv"}));
-    EXPECT_TRUE(calls.take());
-    EXPECT_EQ(locale.languages(), (Languages{"sv", "en"})) << "the broken ones change nothing";
+    for (const std::string& bytes :
+         {std::string(), *platform::encodeXML("de"), listOf({"it", 7}), listOf({"../../etc"}),
+          listOf({std::string(36, 'a')}), listOf(platform::Array(std::vector<platform::Value>(33, "it")))}) {
+        support::writeFile(file, bytes);
+        EXPECT_EQ(Locale(root, files, {"fr"}).languages(), fallback) << bytes;
+    }
     std::filesystem::remove(file);
-    while (locale.languages() != fallback) ASSERT_TRUE(calls.take());
-}
-
-TEST(LocaleName, LanguagesOfName) {
-    const std::pair<const char*, Languages> cases[] = {{"de_DE.UTF-8", {"de-DE", "de"}},
-                                                       {"ca_ES@valencia", {"ca-ES", "ca"}},
-                                                       {"sv", {"sv"}},
-                                                       {"C.UTF-8", {}},
-                                                       {"POSIX", {}},
-                                                       {"/etc/passwd", {}}};
-    for (const auto& [text, languages] : cases)
-        EXPECT_EQ(platform::linux_::Locale::languagesOfName(text), languages) << text;
+    EXPECT_EQ(told.take(), fallback);
+    queue->sync([] {});
+    EXPECT_EQ(told.size(), 0U);
 }
 
 } // namespace

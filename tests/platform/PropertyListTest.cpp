@@ -3,13 +3,12 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <sstream>
 
 namespace {
 
 using namespace platform;
 using namespace std::string_literals;
-
-const UUID uuid = *UUID::parse("0F1E2D3C-4B5A-6978-8796-A5B4C3D2E1F0");
 
 std::string compact(const Value& value) { return std::string(*compactData(value).data()); }
 
@@ -31,18 +30,13 @@ Value nested(std::size_t depth) {
     return value;
 }
 
-/// As many keys as take an index, and some text that needs care under each.
-Dictionary manyTexts() {
-    MutableDictionary dictionary;
-    for (int i = 0; i < 40; ++i)
-        for (const char* text : {"", "é…😀", "&<>\"'", "\r", "\n\t", " ", "]]>", "\x7F"})
-            dictionary.set(text + std::to_string(i), text);
-    return dictionary;
+/// A value with every kind in it that a file may hold, and text that needs care as key and value.
+Dictionary sample() {
+    MutableDictionary sample{{"list", Array{true, -5, UINT64_MAX, 0.1, Date{1795381200.25}, Array{}, false,
+                                            Value::data("\0\1\2\xFF"s), Dictionary{}, Dictionary{{"deep", "er"}}}}};
+    for (const char* text : {"", "é…😀", "&<>\"'", "\r", "\n\t", " ", "]]>", "\x7F"}) sample.set(text, text);
+    return sample;
 }
-
-/// A value with every kind in it that a file may hold.
-const Dictionary sample{{"list", Array{true, -5, UINT64_MAX, 0.1, Date{1795381200.25}, "Zembra é…😀 & <more>", Array{},
-                                       false, Value::data("\0\1\2\xFF"s), Dictionary{}, Dictionary{{"deep", "er"}}}}};
 
 // Values and handles.
 
@@ -50,10 +44,6 @@ TEST(Value, AnswersItsOwnKindAndRangeOnly) {
     EXPECT_TRUE(Value(7).uint64() == 7U && Value(7U).int64() == 7 && Value(UINT64_MAX).uint64() == UINT64_MAX);
     EXPECT_FALSE(Value(-7).uint64() || Value(UINT64_MAX).int64() || Value(true).int64() || Value(1).boolean());
     EXPECT_FALSE(Value(1).real() || Value("text").data() || Value::data("text").string() || Value());
-    const Dictionary dictionary{{"s", 1}, {"s", "the last one wins"}, {"u", uuid}, {"a", Array{1}}};
-    EXPECT_TRUE(dictionary.string("s") == "the last one wins" && dictionary.uuid("u") == uuid && dictionary.array("a"));
-    EXPECT_FALSE(dictionary.string("none") || dictionary.uuid("s") || dictionary.array("none") ||
-                 dictionary.uint64("u"));
     // Bytes that are no text become replacement characters.
     EXPECT_EQ(Value("\xC3\xA9\xED\xA0\x80.a\0b\xE9"s).string(), "é\uFFFD\uFFFD\uFFFD.a\uFFFDb\uFFFD");
 }
@@ -70,13 +60,12 @@ TEST(ValueEquality, NumbersCompareByExactValue) {
     // The values of a group equal one another and none of another group.
     const std::vector<Array> groups{
         // Neighbours, as far as a double can tell them apart or not.
-        Array{0, -0.0, false}, Array{1, 1.0, true}, Array{1.5}, Array{2}, Array{-1}, Array{(1LL << 53) + 1},
-        Array{0x1p53}, Array{INT64_MAX}, Array{1ULL << 63U, 0x1p63}, Array{INT64_MIN, -0x1p63}, Array{UINT64_MAX},
-        Array{0x1p64}, Array{UINT64_MAX - 2047, 18446744073709549568.0}, Array{INFINITY},
+        Array{0, -0.0, false}, Array{1, 1.0, true}, Array{1.5}, Array{-1}, Array{(1LL << 53) + 1}, Array{0x1p53},
+        Array{INT64_MAX}, Array{1ULL << 63U, 0x1p63}, Array{INT64_MIN, -0x1p63}, Array{UINT64_MAX}, Array{0x1p64},
         // Kinds that look alike.
-        Array{"1"}, Array{"a"}, Array{Value::data("a")}, Array{Date{1}}, Array{Date{1.5}}, Array{nested(69)},
-        Array{nested(70)}, Array{Array{}}, Array{Array{1, "a"}, Array{true, "a"}}, Array{Array{"a", 1}},
-        Array{Dictionary{}}, Array{Dictionary{{"a", 1}}}, Array{Dictionary{{"a", 2}}}, Array{Dictionary{{"b", 1}}},
+        Array{"1"}, Array{"a"}, Array{Value::data("a")}, Array{Date{1}}, Array{Date{1.5}}, Array{Array{}},
+        Array{Array{1, "a"}, Array{true, "a"}}, Array{Array{"a", 1}}, Array{Dictionary{}}, Array{Dictionary{{"a", 1}}},
+        Array{Dictionary{{"a", 2}}}, Array{Dictionary{{"b", 1}}},
         Array{Dictionary{{"a", 1}, {"b", 1}}, Dictionary{{"b", 1.0}, {"a", true}}}};
     for (const Array& group : groups)
         for (const Value& left : group)
@@ -87,60 +76,45 @@ TEST(ValueEquality, NumbersCompareByExactValue) {
     EXPECT_TRUE(Value() == Value() && nested(200'000) == nested(200'000)) << "neither comparing nor releasing recurses";
 }
 
-TEST(ValueStorage, IsSharedByCopiesAndOutlivesWhatItWasTakenFrom) {
+TEST(ValueStorage, IsSharedAndOutlivesWhatItWasTakenFrom) {
     // Key and value given to a change may live inside what the change lets go.
     MutableDictionary dictionary{{"key", "key"}, {"other", 1}};
     const Value shared = dictionary;
     dictionary.set(*dictionary.string("key"), Array{2});
     EXPECT_EQ(shared, Value(Dictionary{{"key", Array{2}}, {"other", 1}}));
-    dictionary.remove(dictionary.begin()->name());
-    EXPECT_EQ(shared, Value(Dictionary{{"other", 1}}));
-    MutableArray array;
-    const MutableArray before = MutableArray::copyOf(array);
-    Value value = array;
-    array.append(Array{"inside"});
-    array = before;
-    value = (*value.array())[0];
-    EXPECT_TRUE(value == Value(Array{"inside"}) && before.empty());
 }
 
 // Around the number of keys from which on a dictionary is indexed, and far beyond; an extension is like a copy.
 TEST(Dictionary, KeepsOrderAndFindsEveryKeyAtAnySize) {
+    using Entries = std::vector<Dictionary::Entry>;
+    const auto expect = [](const Dictionary& dictionary, const Entries& entries) {
+        const Dictionary expected = *Dictionary::fromUniqueEntries(entries);
+        EXPECT_TRUE(expected == dictionary && dictionary == expected);
+        for (const Dictionary& each : {dictionary, dictionary.keepingEncoding()})
+            EXPECT_EQ(compact(each), compact(expected)); // the order too
+    };
     for (const std::size_t size : {2U, 32U, 33U, 66U, 1000U})
         for (const bool isExtension : {false, true}) {
             SCOPED_TRACE(std::to_string(size) + (isExtension ? " extending" : " copied"));
-            std::vector<Dictionary::Entry> all, kept, removed;
-            MutableDictionary others;
+            Entries all, half, kept, removed;
             for (std::size_t i = 0; i < size; ++i) {
                 const std::string key = std::to_string(i * 7919 % 1000) + (i % 2 == 0 ? "" : "x");
                 all.push_back({key, i});
+                if (i < size / 2) half.push_back({key, i});
                 (i % 3 == 0 ? removed : kept).push_back({key, "new"});
-                others.set(key, "new");
             }
-            const auto expect = [](const Dictionary& dictionary, const std::vector<Dictionary::Entry>& entries) {
-                const Dictionary expected = *Dictionary::fromUniqueEntries(entries);
-                EXPECT_TRUE(expected == dictionary && dictionary == expected);
-                EXPECT_EQ(compact(dictionary), compact(expected)); // the order too
-                EXPECT_EQ(compact(dictionary.keepingEncoding()), compact(expected));
-                EXPECT_EQ(Value(dictionary).description(), Value(expected).description());
-            };
-            const std::vector<Dictionary::Entry> half(all.begin(), all.begin() + static_cast<std::ptrdiff_t>(size / 2));
             const Dictionary base = Dictionary::fromUniqueEntries(half)->keepingEncoding();
             auto dictionary = isExtension ? MutableDictionary::extending(base) : MutableDictionary::copyOf(base);
             for (const auto& entry : all) dictionary.set(entry.key, entry.value);
-            dictionary.remove("missing");
             expect(dictionary, all);
-            auto copy = MutableDictionary::copyOf(dictionary);
             for (const auto& entry : kept) dictionary.set(entry.name(), entry.value);
             for (const auto& entry : removed) dictionary.remove(entry.name());
             expect(dictionary, kept);
             EXPECT_FALSE(dictionary.contains(removed[0].name()));
-            dictionary.merge(others);
-            dictionary.merge(dictionary);
+            for (auto& entry : kept) entry.value = "newer";
             kept.insert(kept.end(), removed.begin(), removed.end());
+            dictionary.merge(*Dictionary::fromUniqueEntries(kept));
             expect(dictionary, kept);
-            copy.merge(others);
-            EXPECT_EQ(copy, others);
             expect(base, half);
             kept.back().key = kept.front().key;
             EXPECT_FALSE(Dictionary::fromUniqueEntries(std::move(kept)));
@@ -149,53 +123,41 @@ TEST(Dictionary, KeepsOrderAndFindsEveryKeyAtAnySize) {
 
 TEST(Description, IsOneShortLineThatCannotBeForged) {
     const std::pair<Value, std::string> cases[] = {
-        {Value(), "(null)"},
         {Dictionary{{"a", Array{1, true, -2.5, UUID{}}}, {"b\n", Dictionary{}}},
          "{a = (1, true, -2.5, 00000000-0000-0000-0000-000000000000); b\\x0a = {}}"},
-        {Array{Value::data("\x01\xFF"), Value::data(std::string(17, 'a'))},
-         "(<2 bytes 01ff>, <17 bytes 61616161616161616161616161616161…>)"},
-        {"a\nb\x1B[0m\x7F é\u0085\u2028", "a\\x0ab\\x1b[0m\\x7f é\\xc2\\x85\\xe2\\x80\\xa8"},
-        {std::string(4093, 'a'), std::string(4093, 'a')},
-        {std::string(4097, 'a'), std::string(4093, 'a') + "…"}};
+        {Value::data(std::string(17, 'a')), "<17 bytes 61616161616161616161616161616161…>"},
+        {"a\nb\x1B[0m\x7F é\u0085\u2028", "a\\x0ab\\x1b[0m\\x7f é\\xc2\\x85\\xe2\\x80\\xa8"}};
     for (const auto& [value, text] : cases) EXPECT_EQ(value.description(), text);
-    // Wherever a byte stands, for plain text is taken in pieces.
-    for (std::size_t place = 0; place <= 17; ++place)
-        for (const auto& [byte, text] : {std::pair("\x1F", "\\x1f"), {" ", " "}, {"~", "~"}, {"\x7F", "\\x7f"}}) {
-            const std::string before(place, 'a');
-            const std::string behind(17 - place, 'b');
+    // Wherever a byte stands, for plain text is taken in pieces; and wherever the limit falls, a character stays whole.
+    for (std::size_t place = 0; place <= 17; ++place) {
+        const std::string before(place, 'a');
+        const std::string behind(17 - place, 'b');
+        for (const auto& [byte, text] : {std::pair("\x1F", "\\x1f"), {" ", " "}, {"~", "~"}, {"\x7F", "\\x7f"}})
             EXPECT_EQ(Value(before + byte + behind).description(), before + text + behind);
-        }
-    // Wherever the limit falls, what is cut ends with a whole character.
-    for (std::size_t i = 0; i < 4; ++i) {
-        const std::string cut = Value(std::string(i, 'a') + repeated("😀", 2000)).description();
-        EXPECT_TRUE(cut.size() <= 4096 && (cut.size() - i - 3) % 4 == 0 && cut.ends_with("😀…")) << cut;
+        const std::string cut = Value(before + repeated("😀", 2000)).description();
+        EXPECT_TRUE(cut.size() <= 4096 && (cut.size() - place - 3) % 4 == 0 && cut.ends_with("😀…")) << cut;
     }
-    EXPECT_LE(Value(Array(std::vector<Value>(100'000, "text"))).description().size(), 4096U);
-    EXPECT_TRUE(nested(1000).description().find("…") != std::string::npos);
 }
 
 // The encodings.
 
 TEST(Encoding, RoundTripsEveryValue) {
-    std::vector<Value> values{
-        INT64_MIN, INT64_MAX, INT64_MAX + 1ULL, "",       sample,    manyTexts(), nested(maximumNesting), -0.0,
-        0.1,       1e300,     5e-324,           INFINITY, -INFINITY, NAN};
-    for (const double moment : {0.0, 0.1, -0.1, -0.25, -1.0, 5e-324, -5e-324, 0x1p-60, 1795381200.123456,
-                                -62135596800.0, -62135596799.5, 253402300799.99997, -86400.0, 951782400.0})
+    std::vector<Value> values{INT64_MIN, sample(), nested(maximumNesting), -0.0, 1e300, 5e-324, -INFINITY, NAN};
+    for (const double moment : {0.1, -0.1, -5e-324, 1795381200.123456, -62135596799.5, 253402300799.99997})
         values.emplace_back(Date{moment});
     for (std::size_t size = 0; size < 7; ++size) values.push_back(Value::data(std::string(size, '\xFE')));
     for (const Value& value : values) {
         std::string file(compactMagic);
         appendCompact(file, value);
-        EXPECT_EQ(file, std::string(compactMagic) + compact(value));
         for (const std::string& each : {file, *encodeXML(value)}) {
             const auto decoded = decodePropertyList(each);
             ASSERT_TRUE(decoded) << problem(decoded) << each;
             EXPECT_EQ(compact(*decoded), compact(value)) << each; // kinds, order and every bit
         }
     }
-    const std::string message = compact(Array{uuid});
-    EXPECT_EQ(*decodeCompact(message, UUIDs::allowed), Value(Array{uuid}));
+    const UUID uuid = UUID::random();
+    const std::string message = compact(uuid);
+    EXPECT_EQ(*decodeCompact(message, UUIDs::allowed), Value(uuid));
     EXPECT_FALSE(decodeCompact(message, UUIDs::refused) || decodePropertyList(std::string(compactMagic) + message));
     EXPECT_EQ(*encodeXML(Dictionary{{"a & b", Array{true, Dictionary{}, "x\r\ny"}}}),
               "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<vlist version=\"1.0\">\n<dict>\n\t<key>a &amp; b</key>\n"
@@ -204,10 +166,8 @@ TEST(Encoding, RoundTripsEveryValue) {
 
 TEST(Encoding, RefusesWhatXMLCannotHold) {
     const std::pair<Value, std::string> cases[] = {
-        {Value(), "an absent value"},
         {Dictionary{{"a\nb", Array{1, UUID{}}}}, "a UUID at /a\\x0ab/1"},
         {Dictionary{{"\x1F", 1}}, "a control character at /\\x1f"},
-        {"\uFFFE", "a noncharacter"},
         {Date{253402300800}, "a date outside the years 1 to 9999"},
         {nested(maximumNesting + 1), "containers nested too deep at " + repeated("/0/k", 32)}};
     for (const auto& [value, what] : cases) EXPECT_EQ(problem(encodeXML(value)), "cannot be written as XML: " + what);
@@ -220,34 +180,31 @@ TEST(CompactDecoding, RefusesMalformedInput) {
         {"bytes after the value at byte 1", "\x01\x01"},
         {"a small integer in unsigned form at byte 0", "\x04\xFF\xFF\xFF\xFF\xFF\xFF\xFF\x7F"},
         {"a date outside the years 1 to 9999 at byte 0", compact(Date{NAN})},
-        {"a date outside the years 1 to 9999 at byte 0", compact(Date{-62135596801})},
         {"NUL in text at byte 6", "\x07\x03\0\0\0a\0b"s},
         {"a container's size is larger than its items at byte 0", "\x0A\x02\0\0\0\x01\0\0\0\x01\x01"s},
         {"a container's count is larger than its size allows at byte 0", "\x0A\x01\0\0\0\xFF\xFF\xFF\xFF\x01"s},
         {"a container's count is larger than its size allows at byte 0", "\x0B\x05\0\0\0\x02\0\0\0\0\0\0\0\x01"s},
+        // Each array alone could hold as many items as it claims, but not all three together.
+        {"a container's count is larger than its size allows at byte 18",
+         "\x0A\x13\0\0\0\x12\0\0\0\x0A\x0A\0\0\0\x0A\0\0\0\x0A\x01\0\0\0\x01\0\0\0\x01"s},
         // The inner array reaches beyond the outer one.
         {"a container's size is larger than what is left at byte 9",
          "\x0A\x09\0\0\0\x01\0\0\0\x0A\x01\0\0\0\x01\0\0\0\x01"s},
-        {"the value is cut short at byte 10", "\x0A\x02\0\0\0\x02\0\0\0\x0A\x01"s},
         {"text is not UTF-8 at byte 13", "\x0B\x06\0\0\0\x01\0\0\0\x01\0\0\0\xFF\x01"s},
-        {"a dictionary with equal keys at byte 0", "\x0B\x0C\0\0\0\x02\0\0\0\x01\0\0\0k\x01\x01\0\0\0k\x02"s},
-        {"containers nest too deep at byte 736", compact(nested(maximumNesting + 1))}};
+        {"a dictionary with equal keys at byte 0", "\x0B\x0C\0\0\0\x02\0\0\0\x01\0\0\0k\x01\x01\0\0\0k\x02"s}};
     for (const auto& [what, bytes] : cases) EXPECT_EQ(problem(decodeCompact(bytes, UUIDs::allowed)), what);
 }
 
 TEST(CompactDecoding, ChecksUTF8AtEveryOffset) {
-    const std::vector<std::string> good{"\x7F",         "\xC2\x80",         "\xDF\xBF",
-                                        "\xE0\xA0\x80", "\xED\x9F\xBF",     "\xEE\x80\x80",
-                                        "\xEF\xBF\xBF", "\xF0\x90\x80\x80", "\xF4\x8F\xBF\xBF"};
-    const std::vector<std::string> bad{
-        "\x80",         "\xC0\x80",     "\xC1\xBF",         "\xC2",     "\xC2\x41",         "\xE0\x9F\xBF",
-        "\xE1\x80\x41", "\xED\xA0\x80", "\xF0\x8F\xBF\xBF", "\xE1\x80", "\xF4\x90\x80\x80", "\xF5\x80\x80\x80",
-        "\xFF",         "\xF1\x80\x80", "\xF1\x80\x80\x41"};
+    std::istringstream good(
+        "\x7F \xC2\x80 \xDF\xBF \xE0\xA0\x80 \xED\x9F\xBF \xEF\xBF\xBF \xF0\x90\x80\x80 \xF4\x8F\xBF\xBF");
+    std::istringstream bad("\x80 \xC0\x80 \xC1\xBF \xC2 \xC2\x41 \xE0\x9F\xBF \xE1\x80\x41 \xED\xA0\x80 \xE1\x80 "
+                           "\xF0\x8F\xBF\xBF \xF4\x90\x80\x80 \xF5\x80\x80\x80 \xFF \xF1\x80\x80 \xF1\x80\x80\x41");
     // Eight bytes are looked at together, so each case stands at each place of such a group.
-    for (const auto* texts : {&good, &bad})
-        for (const std::string& text : *texts)
+    for (auto* texts : {&good, &bad})
+        for (std::string text; *texts >> text;)
             for (std::size_t before = 0; before < 9; ++before)
-                for (const std::size_t after : {0U, 1U, 9U}) {
+                for (const std::size_t after : {0U, 9U}) {
                     const std::string whole = std::string(before, 'a') + text + std::string(after, 'z');
                     const auto size = static_cast<char>(whole.size());
                     const auto decoded = decodeCompact("\x07"s + size + "\0\0\0"s + whole, UUIDs::refused);
@@ -256,7 +213,7 @@ TEST(CompactDecoding, ChecksUTF8AtEveryOffset) {
 }
 
 TEST(Decoding, RefusesEveryTruncation) {
-    for (const auto& file : {std::string(compactMagic) + compact(sample), *encodeXML(sample)})
+    for (const auto& file : {std::string(compactMagic) + compact(sample()), *encodeXML(sample())})
         // Without its last newline XML is whole.
         for (std::size_t length = file.find_last_not_of('\n') + 1; length-- > 0;)
             EXPECT_FALSE(decodePropertyList(file.substr(0, length))) << length;
@@ -278,8 +235,6 @@ TEST(Decoding, BoundsNesting) {
 TEST(XMLDecoding, ReadsEveryForm) {
     const std::pair<std::string, Value> cases[] = {
         {"<integer> 18446744073709551615\n</integer>", UINT64_MAX},
-        {"<real>1e3</real>", 1000.0},
-        {"<date>2026-11-22T21:00:00Z</date>", Date{1795381200}},
         {"<date>1969-12-31T23:59:59.5Z</date>", Date{-0.5}},
         {"<date>2024-02-29T00:00:00.000Z</date>", Date{1709164800}},
         {"<data>\n\tAAEC\n\t/w==\n</data>", Value::data("\0\1\2\xFF"s)},
@@ -304,19 +259,16 @@ TEST(XMLDecoding, RefusesMalformedContent) {
         {"dict", {"<key>k</key><true/>text", "<key>k<true/></key><true/>"}},
         {"integer", {"", "+1", "1 2", "0x10", "1.0", "18446744073709551616", "-9223372036854775809"}},
         {"real", {"", "1e400", "1,5"}},
-        {"date", {"2026-11-22", "2026-11-22T21:00:00", "2026-11-22 21:00:00Z", "2026-13-22T21:00:00Z"}},
-        {"date", {"2026-02-29T21:00:00Z", "2026-11-22T24:00:00Z", "2026-11-22T21:60:00Z", "2026-11-22T21:00:60Z"}},
-        {"date", {"2026-11-22T21:00:00.Z", "2026-11-22T21:00:00.1e2Z", "0000-11-22T21:00:00Z"}},
+        {"date", {"2026-11-22", "2026-11-22 21:00:00Z", "2026-13-22T21:00:00Z", "2026-02-29T21:00:00Z"}},
+        {"date", {"2026-11-22T24:00:00Z", "2026-11-22T21:00:00.Z", "2026-11-22T21:00:00.1e2Z", "0000-11-22T21:00:00Z"}},
         {"data", {"AAE", "AA==AAEC", "A===", "====", "AB==", "AA*="}},
-        {"string", {"a<string/>", "&unknown;", "&#0;", "&#1;", "\x01", "\0"s, "\xFF", "\xC0\x80", "\xED\xA0\x80"}}};
+        {"string", {"a<string/>", "&unknown;", "&#0;", "\x01", "\0"s, "\xFF", "\xC0\x80", "\xED\xA0\x80"}}};
     for (const auto& [element, texts] : contents)
         for (const std::string& text : texts) {
             const std::string whole = "<" + element + ">" + text + "</" + element + ">";
             const std::string what = problem(decodePropertyList(element == "vlist" ? whole : xml(whole)));
             EXPECT_NE(what.find(" in line 1"), std::string::npos) << whole << ": " << what;
         }
-    EXPECT_EQ(problem(decodePropertyList("<vlist>\n<array>\n<thing/></array></vlist>")),
-              "an unknown element in line 3");
     const std::string good = xml("<true/>");
     const std::vector<std::string> files{
         "", "true", "<dict/>", "\xFE\xFF\0<"s, "vlist15\n\x01", "vlist16\n", "vlist16\n\x02\x02",

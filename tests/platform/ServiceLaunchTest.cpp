@@ -12,13 +12,8 @@
 
 #include <gtest/gtest.h>
 
-#include <array>
-#include <climits>
-#include <cstddef>
 #include <future>
-#include <linux/filter.h>
 #include <linux/sched.h>
-#include <linux/seccomp.h>
 #include <poll.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
@@ -73,20 +68,22 @@ protected:
             path,
             Dictionary{{"VBBundleIdentifier", name}, {"VBBundleExecutable", executable}, {"VKExtension", extension}});
     }
-    void makeBundle(const char* name = identifier) const {
+    void makeBundle() const {
         fs::remove_all(bundle());
-        writeManifest(bundle(), name);
+        writeManifest(bundle(), identifier);
         fs::create_directory(bundle() + "/Code");
         fs::copy_file(fs::canonical("/bin/sh"), program());
     }
-    void startManager(const linux_::ServiceLimits& limits = {}) {
+    void startManager(const linux_::ServiceLimits& limits = {},
+                      std::chrono::milliseconds grace = std::chrono::hours(1)) {
         _manager.reset();
-        _manager = std::make_unique<linux_::ServiceManager>(_root, _files, std::chrono::hours(1), limits);
+        _manager = std::make_unique<linux_::ServiceManager>(_root, _files, grace, limits);
         EXPECT_FALSE(_manager->startServing());
     }
     std::string bundle() const { return _scratch / "Bundle"; }
     std::string program() const { return bundle() + "/Code/Program"; }
-    std::string hosts() const { return _root.runtime() + "/ignitd/hosts"; }
+    std::string kept(const std::string& name) const { return _root.runtime() + "/ignitd/" + name; }
+    std::string instances(const std::string& version = "1") const { return kept(identifier + ("@" + version)); }
     int add(const Dictionary& given = overlay(), pid_t host = getpid(), const std::string& path = "") const {
         return _manager->addExternalServiceForHost(tokenOf(host), path.empty() ? program() : path, given);
     }
@@ -94,10 +91,24 @@ protected:
     static auto identityOf(const support::WaitingProgram& process) {
         return *linux_::ProcessIdentity::of(process.pid());
     }
-    int remove() {
-        std::promise<int> answer;
-        _manager->removeExternalService(identifier, "1", _queue, [&](int result) { answer.set_value(result); });
-        return answer.get_future().get();
+    /// The answer, which must come on the queue and once.
+    std::future<int> removal(const std::string& name = identifier, const std::string& version = "1") {
+        auto answer = std::make_shared<std::promise<int>>(); // a second answer throws
+        _manager->removeExternalService(name, version, _queue, [this, answer](int result) {
+            _queue->assertCurrent();
+            answer->set_value(result);
+        });
+        return answer->get_future();
+    }
+    int remove() { return removal().get(); }
+    /// As an earlier daemon left it.
+    void record(const std::string& process, uid_t user = geteuid(), const std::string& version = "1") const {
+        support::writeFile(instances(version) + '/' + process, std::to_string(user));
+    }
+    auto startInstance(const support::Preparation& prepare = support::atOnce, const std::string& version = "1") const {
+        auto instance = std::make_unique<support::WaitingProgram>("/bin/cat", prepare);
+        record(identityOf(*instance).name(), geteuid(), version);
+        return instance;
     }
     support::ChildProgram start(const std::string& path, const std::vector<std::string>& arguments,
                                 const support::Preparation& prepare = support::atOnce) const {
@@ -121,9 +132,13 @@ protected:
     // What the manager keeps its registrations with, for another host.
     support::WaitingProgram _host{"/bin/cat"};
     linux_::ProcessWatch _watch;
-    support::ScratchDirectory _memory{fs::exists("/dev/shm") ? "/dev/shm" : "/tmp"}; // as /run is
-    linux_::ServiceRegistrations _registrations{_memory / "hosts", _watch};
+    linux_::ServiceRegistrations _registrations{_scratch / "hosts", _watch};
 };
+
+using ServiceRemoval = ServiceLaunch;
+
+/// For an instance that does not end when it is asked to.
+bool ignoreTermination() { return signal(SIGTERM, SIG_IGN) != SIG_ERR; }
 
 } // namespace
 
@@ -140,14 +155,10 @@ TEST_F(ServiceLaunch, GivesWhatWasRegisteredAndNothingElse) {
                                "while read -r key value; do case $key in CapEff:|SigBlk:|SigIgn:|NoNewPrivs:|Seccomp:)"
                                "echo $key $value;; esac; done < /proc/self/status; exit 7";
     auto launcher = start(ZBIGNITE, {program(), "-c", script, "name", "argument"}, [] {
-        // By the kernel's own calls, so that the two signals which the C library keeps to itself are among them.
-        const std::array<std::uint64_t, 8> ignored{1}; // SIG_IGN
-        const std::uint64_t all = ~std::uint64_t{0};
-        for (const int number : {SIGTERM, 32, 33}) {
-            syscall(SYS_rt_sigaction, number, ignored.data(), nullptr, sizeof all);
-        }
-        syscall(SYS_rt_sigprocmask, SIG_SETMASK, &all, nullptr, sizeof all);
-        return dup2(STDOUT_FILENO, 77) == 77;
+        sigset_t all;
+        sigfillset(&all);
+        sigprocmask(SIG_SETMASK, &all, nullptr);
+        return ignoreTermination() && dup2(STDOUT_FILENO, 77) == 77;
     });
     const std::string zeros = "0000000000000000";
     EXPECT_EQ(launcher.readTo(), "export HOME='" + container + "'\nexport LANG='C'\nexport MESSAGE='two words'\n" +
@@ -163,10 +174,9 @@ TEST_F(ServiceLaunch, LetsAServiceCountAsBusyAndNoOther) {
     const std::string busy = linux_::busyDirectory(_root) + "/" + std::to_string(geteuid()) + "/";
     EXPECT_EQ(launch("true < " + busy + identifier), 0);
     if (linux_::landlockVersion() == 0) GTEST_SKIP() << "this kernel has no Landlock";
-    std::ofstream(busy + "com.example.other").flush();
-    // The last but one would fill everybody's memory, the last one shows who else ran.
-    for (const auto& script : {"true < " + busy + "com.example.other", "true >> " + busy + "com.example.new",
-                               "true >> " + busy + identifier, "[ \"$(echo " + busy + "*)\" != '" + busy + "*' ]"})
+    // The second would fill everybody's memory, the last one shows who else ran.
+    for (const auto& script : {"true >> " + busy + "com.example.new", "true >> " + busy + identifier,
+                               "[ \"$(echo " + busy + "*)\" != '" + busy + "*' ]"})
         EXPECT_NE(launch(script), 0) << script;
 }
 
@@ -175,9 +185,8 @@ TEST_F(ServiceLaunch, IsForTheHostsOwnChildrenAlone) {
     ASSERT_EQ(add(), 0);
     for (const std::string& name : {std::string(identifier), program(), bundle() + "/../Bundle/Code/Program"})
         EXPECT_EQ(launch("", name), 0) << name;
-    for (const std::string& name : {std::string("com.example.other"), std::string("/bin/sh"), program() + "x"})
+    for (const char* name : {"com.example.other", "/bin/sh"})
         EXPECT_EQ(launch("", name), status(LaunchStatus::notRegistered)) << name;
-    EXPECT_EQ(launch("", std::string(PATH_MAX, 'x')), status(LaunchStatus::usage));
     // Another process gets nothing of what this one was granted, not even a child of it.
     EXPECT_EQ(start("/bin/sh", {"-c", "\"$@\"; exit $?", "sh", ZBIGNITE, identifier}).finish(),
               status(LaunchStatus::notRegistered));
@@ -188,8 +197,6 @@ TEST_F(ServiceLaunch, IsForTheHostsOwnChildrenAlone) {
         return linux_::exchangeRequest(connection->get(), identifier, granted);
     });
     EXPECT_EQ(number, ESRCH);
-    _manager.reset();
-    EXPECT_EQ(launch(), status(LaunchStatus::noManager));
 }
 
 TEST_F(ServiceLaunch, RefusesWhatWasReplacedSince) {
@@ -202,31 +209,23 @@ TEST_F(ServiceLaunch, RefusesWhatWasReplacedSince) {
     for (const auto& [what, change] : changes) {
         makeBundle();
         ASSERT_EQ(add(), 0);
-        EXPECT_EQ(launch(), 0);
         ASSERT_EQ(std::system(("cd " + bundle() + " && " + change).c_str()), 0);
         EXPECT_EQ(launch(), status(LaunchStatus::refused)) << what;
     }
 }
 
 TEST_F(ServiceLaunch, RegistersOnlyBundlesExecutablesForProcesses) {
-    for (const pid_t nobody : {0x7fffffff, 0}) EXPECT_EQ(add(overlay(), nobody), ESRCH);
+    EXPECT_EQ(add(overlay(), 0x7fffffff), ESRCH);
     EXPECT_EQ(add(overlay(Dictionary{{"LONG", std::string(linux_::maximumRegistrationSize, 'x')}})), E2BIG);
-    Value nested = 1;
-    for (std::size_t depth = 0; depth + 3 < maximumNesting; ++depth) nested = Array{nested};
-    for (const Value& unreadable : {Value(UUID::random()), nested})
-        EXPECT_EQ(add(overlay(Dictionary{{"A", unreadable}})), EINVAL);
-    EXPECT_EQ(add(overlay(), getpid(), bundle() + "/Info.vlist"), EINVAL);
+    EXPECT_EQ(add(overlay(Dictionary{{"A", UUID::random()}})), EINVAL) << "what no launch could read";
     // Its program would get the container of whoever the inner bundle says it is.
     const std::string inner = bundle() + "/1/2/3/4/Inner";
     writeManifest(bundle(), identifier, "1/2/3/4/Inner/Program");
     writeManifest(inner, "com.example.victim", "Program");
     fs::copy_file(program(), inner + "/Program");
     EXPECT_EQ(add(overlay(), getpid(), inner + "/Program"), EINVAL);
-    makeBundle("a@b");
-    EXPECT_EQ(add(), EINVAL);
     makeBundle();
     fs::remove(program());
-    EXPECT_EQ(add(), EINVAL);
     fs::create_symlink(fs::canonical("/bin/sh"), program());
     EXPECT_EQ(add(), EINVAL) << "a link out of the bundle";
     makeBundle();
@@ -243,9 +242,8 @@ TEST_F(ServiceLaunch, BoundsWhatAUserMayHaveKept) {
     startManager({8192, 8192, 1, 1});
     const std::string page(4096, 'x');
     const auto large = overlay(Dictionary{{"A", page}});
-    EXPECT_EQ(add(large), 0);
+    for (const char* time : {"first", "in its own place"}) EXPECT_EQ(add(large), 0) << time;
     EXPECT_EQ(add(overlay(Dictionary{{"A", page + page}})), EDQUOT);
-    EXPECT_EQ(add(large), 0) << "in its own place";
     EXPECT_EQ(remove(), serviceHasNoInstances);
     EXPECT_EQ(launch(), status(LaunchStatus::notRegistered)) << "removed";
     EXPECT_EQ(add(large), 0) << "what was removed does not count";
@@ -255,15 +253,6 @@ TEST_F(ServiceLaunch, BoundsWhatAUserMayHaveKept) {
     EXPECT_EQ(launch(), status(LaunchStatus::refused)) << "a second instance";
     EXPECT_EQ(remove(), serviceInstancesTerminated);
     EXPECT_EQ(running.finish(), -SIGTERM);
-    startManager({8192, 4096, 2, 1});
-    EXPECT_EQ(add(), 0);
-    EXPECT_EQ(add(overlay(), _host.pid()), EDQUOT) << "beyond the user's bytes";
-
-    // Who is shorter of room than the one before takes nothing away from hosts that live.
-    startManager({8192, 8192, 0, 1});
-    EXPECT_EQ(launch(), status(LaunchStatus::notRegistered));
-    startManager();
-    EXPECT_EQ(launch(), 0);
 }
 
 TEST_F(ServiceLaunch, ARecycledPidInheritsNothing) {
@@ -286,63 +275,88 @@ TEST_F(ServiceLaunch, ARecycledPidInheritsNothing) {
 TEST_F(ServiceLaunch, RegistrationsOutliveTheManagerButNotTheirHost) {
     ASSERT_EQ(add(), 0);
     const linux_::Descriptor watch(inotify_init1(IN_CLOEXEC));
-    ASSERT_GE(inotify_add_watch(watch.get(), hosts().c_str(), IN_DELETE), 0);
+    ASSERT_GE(inotify_add_watch(watch.get(), kept("hosts").c_str(), IN_DELETE), 0);
     ASSERT_EQ(add(overlay(), _host.pid()), 0);
-    EXPECT_EQ(entriesOf(hosts()), 2U);
     _host.end();
     pollfd deleted{watch.get(), POLLIN, 0};
     EXPECT_EQ(poll(&deleted, 1, 30000), 1) << "the registration outlived its host";
-    EXPECT_EQ(entriesOf(hosts()), 1U);
 
-    // What a process with a recycled pid would find, and what crashes leave: files that are none, and one replaced.
-    const std::string own = fs::directory_iterator(hosts())->path();
-    fs::copy(own, hosts() + "/" + std::to_string(getppid()) + "-1", fs::copy_options::recursive);
-    for (const char* name : {"/0", "/98", "/97", "/x"}) fs::copy_file(own + "/1", own + name);
+    // What a process with a recycled pid would find, and what a crash leaves.
+    const std::string own = fs::directory_iterator(kept("hosts"))->path();
+    fs::copy(own, kept("hosts") + "/" + std::to_string(getppid()) + "-1", fs::copy_options::recursive);
     std::ofstream(own + "/99") << "vlist16\n";
     startManager();
-    EXPECT_EQ(entriesOf(hosts()), 1U);
+    EXPECT_EQ(entriesOf(kept("hosts")), 1U);
     EXPECT_EQ(entriesOf(own), 2U) << "the registration and the user";
     EXPECT_EQ(launch(), 0);
-    ASSERT_EQ(add(), 0);
-    EXPECT_EQ(entriesOf(own), 2U) << "replaced";
 }
 
-TEST_F(ServiceLaunch, ARestartChargesThoseWhoWereCharged) {
-    const uid_t user = geteuid() + 1; // the host shows another user by now
-    const support::WaitingProgram other("/bin/cat");
-    ASSERT_EQ(_registrations.add(identityOf(_host), user, registration()), 0);
-    linux_::ServiceLimits limits;
-    limits.hostsOfUser = limits.instancesOfUser = 1;
-    linux_::ServiceRegistrations restarted(_memory / "hosts", _watch, limits);
-    ASSERT_EQ(restarted.load(), 0);
-    EXPECT_TRUE(restarted.find(identityOf(_host), identifier));
-    EXPECT_EQ(restarted.add(identityOf(other), user, registration()), EDQUOT);
-    EXPECT_EQ(restarted.add(identityOf(other), geteuid(), registration()), 0);
+TEST_F(ServiceRemoval, AnswersAfterTheInstancesOfThatVersionEnded) {
+    const auto first = startInstance();
+    const auto second = startInstance();
+    const auto other = startInstance(support::atOnce, "2");
+    EXPECT_EQ(remove(), serviceInstancesTerminated);
+    for (const auto& instance : {first.get(), second.get()}) {
+        EXPECT_TRUE(instance->hasEnded());
+        EXPECT_EQ(instance->finish(), -SIGTERM);
+    }
+    EXPECT_FALSE(other->hasEnded());
+    EXPECT_FALSE(fs::exists(instances())) << "nothing is left of the service";
+    EXPECT_EQ(remove(), serviceHasNoInstances);
+}
 
-    // What a crash left of an instance that never started counts for nobody.
-    ASSERT_EQ(add(), 0);
-    support::writeFile(_root.runtime() + "/ignitd/" + identifier + "@1/" + identityOf(other).name(), "");
-    startManager(limits);
-    EXPECT_EQ(launch(), 0);
+TEST_F(ServiceRemoval, KillsWhatLivesOnAfterTheGracePeriod) {
+    startManager({}, std::chrono::milliseconds(20));
+    const auto instance = startInstance(ignoreTermination);
+    EXPECT_EQ(remove(), serviceInstancesTerminated);
+    EXPECT_EQ(instance->finish(), -SIGKILL);
+}
+
+TEST_F(ServiceRemoval, NeverSignalsWhatIsNoInstanceAnyMore) {
+    const support::WaitingProgram innocent("/bin/cat");
+    const std::string recycled = std::to_string(innocent.pid()) + "-1";
+    record(recycled);
+    // As one that runs a set-user-id program by now.
+    record(identityOf(innocent).name(), geteuid() + 1);
+    EXPECT_EQ(remove(), serviceHasNoInstances);
+    EXPECT_FALSE(fs::exists(instances() + '/' + recycled)) << "stale";
+    EXPECT_FALSE(innocent.hasEnded());
+}
+
+TEST_F(ServiceRemoval, DoesNotBelieveOpenDirectories) {
+    const auto instance = startInstance();
+    for (const std::string& open : {instances(), kept("")}) {
+        ASSERT_EQ(chmod(open.c_str(), 0777), 0);
+        EXPECT_EQ(remove(), EACCES);
+        ASSERT_EQ(chmod(open.c_str(), 0755), 0);
+    }
+    fs::rename(instances(), instances("2"));
+    fs::create_directory_symlink(instances("2"), instances());
+    EXPECT_EQ(remove(), ENOTDIR);
+    EXPECT_FALSE(instance->hasEnded());
+}
+
+TEST_F(ServiceRemoval, RefusesNamesThatAreNoNames) {
+    for (const std::string name : {"", "..", "a/../b", "a@b"}) EXPECT_EQ(removal(name).get(), EINVAL) << name;
+    EXPECT_EQ(removal(identifier, "../1").get(), EINVAL);
+    EXPECT_EQ(removal(identifier, "1 @ beta").get(), serviceHasNoInstances);
 }
 
 TEST_F(ServiceLaunch, TenThousandRegistrationsEndWithTheirHost) {
     const auto identity = identityOf(_host);
-    const std::string directory = _memory / "hosts/" + identity.name();
+    const std::string directory = _scratch / "hosts/" + identity.name();
     auto numbered = registration();
     for (int number = 0; number < 10000; ++number) {
         numbered.executablePath = program() + std::to_string(number);
         ASSERT_EQ(_registrations.add(identity, 0, numbered), 0);
     }
     EXPECT_EQ(entriesOf(directory), 10001U) << "and one for the user";
-    EXPECT_TRUE(_watch.takeEnded().empty());
     _host.end();
     pollfd ended{_watch.descriptor(), POLLIN, 0};
     ASSERT_EQ(poll(&ended, 1, 30000), 1);
     EXPECT_EQ(_watch.takeEnded(), std::vector{directory}) << "once for all";
     EXPECT_TRUE(_registrations.end(directory));
     EXPECT_FALSE(fs::exists(directory));
-    EXPECT_TRUE(_watch.takeEnded().empty());
 }
 
 TEST_F(ServiceLaunch, ServicesOfAnotherUserLiveInThatUsersContainer) {
@@ -363,14 +377,7 @@ TEST_F(ServiceLaunch, ServicesOfAnotherUserLiveInThatUsersContainer) {
 
 TEST_F(ServiceLaunch, WithoutLandlockStartsOnlyWhenToldTo) {
     ASSERT_EQ(add(), 0);
-    sock_filter code[] = {BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-                          BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_landlock_create_ruleset, 0, 1),
-                          BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | ENOSYS),
-                          BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW)};
-    const sock_fprog filter{std::size(code), code};
-    const auto becomeOld = [&] {
-        return prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 && prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter) == 0;
-    };
+    const auto becomeOld = [] { return support::loseSystemCall(SYS_landlock_create_ruleset); };
     EXPECT_EQ(start(ZBIGNITE, {identifier}, becomeOld).finish(), status(LaunchStatus::notConfined));
     _environment.push_back(std::string(linux_::allowUnconfinedVariable) + "=1");
     EXPECT_EQ(start(ZBIGNITE, {identifier, "-c", "exit 7"}, becomeOld).finish(), 7);
@@ -386,13 +393,7 @@ TEST(ServiceDescription, SaysWhatIsWrongWithAnOverlay) {
         {overlay(Array{"A=1"}), "\"EnvironmentVariables\" is no dictionary"},
         {named("LD_PRELOAD", true), "the environment variable \"LD_PRELOAD\" is no string"},
         {named("A=B", "c"), "no environment variable can be named \"A=B\""},
-        {named("", "c"), "no environment variable can be named \"\""},
     };
-    for (const auto& [given, text] : cases) {
-        const auto read = linux_::readServiceDescription(given);
-        const auto* fault = std::get_if<std::string>(&read);
-        EXPECT_EQ(fault != nullptr ? *fault : "", text);
-    }
-    const auto read = std::get<linux_::ServiceDescription>(linux_::readServiceDescription(named("LD_X", "/evil")));
-    EXPECT_EQ(read.dropped, std::vector<std::string>{"LD_X"});
+    for (const auto& [given, text] : cases)
+        EXPECT_EQ(std::get<std::string>(linux_::readServiceDescription(given)), text);
 }

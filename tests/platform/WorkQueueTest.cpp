@@ -10,8 +10,9 @@
 
 namespace {
 
-using platform::QualityOfService;
 using Queue = std::shared_ptr<platform::WorkQueue>;
+
+bool brief() { return true; }
 
 class Event : public std::counting_semaphore<> {
 public:
@@ -39,30 +40,24 @@ protected:
 TEST_P(WorkQueues, ItemsOfAllKindsRunInTheOrderSubmitted) {
     for (int i = 0; i < 300; i += 3) {
         queue->async(expecting(i));
-        queue->asyncOnCaller(expecting(i + 1));
+        queue->asyncOnCaller(expecting(i + 1), brief);
         i % 5 == 0 ? queue->sync(expecting(i + 2)) : queue->async(expecting(i + 2));
     }
     queue->sync([&] {
         queue->async(expecting(301));
-        queue->asyncOnCaller(expecting(302));
         expecting(300)();
     });
-    queue->sync(expecting(303));
     queue->async([&] {
-        queue->async(expecting(305));
-        expecting(304)();
+        queue->asyncOnCaller(expecting(303), brief);
+        expecting(302)();
     });
     queue->sync([] {}); // that one has run
-    queue->sync(expecting(306));
-}
-
-TEST_P(WorkQueues, ItemsOfADroppedQueueStillRun) {
     Event ran;
-    queue->async([&, self = queue.get()] {
-        self->assertCurrent();
+    queue->async([&] {
+        expecting(304)();
         ran.release();
     });
-    queue.reset();
+    queue.reset(); // its items still run
     if (auto* const fake = dynamic_cast<support::FakeWorkQueues*>(queues.get())) fake->runAll();
     ran.expect();
 }
@@ -84,53 +79,11 @@ INSTANTIATE_TEST_SUITE_P(, WorkQueues, testing::Values("Linux", "FakeManual", "F
 
 class LinuxWorkQueues : public testing::Test {
 protected:
-    /// Occupies `blocked` until `ended`.
-    void block(const Queue& blocked) {
-        blocked->async([this] {
-            started.release();
-            ended.acquire();
-        });
-        started.expect();
-    }
-    Queue make(QualityOfService quality = QualityOfService::standard) { return queues->makeSerial("label", quality); }
-
     Event started;
     Event ended;
-    std::unique_ptr<platform::linux_::WorkQueues> queues = std::make_unique<platform::linux_::WorkQueues>();
-    Queue queue = make();
+    platform::linux_::WorkQueues queues; // goes first, when all has run
+    const Queue queue = queues.makeSerial("label", {});
 };
-
-TEST_F(LinuxWorkQueues, BlockedQueuesDoNotHoldUpOthers) {
-    // Each one starts only if a thread is left for it; more than any machine's processors.
-    const std::ptrdiff_t count = 2 * std::thread::hardware_concurrency() + 20;
-    for (std::ptrdiff_t i = 0; i < count; ++i) block(make());
-    ended.release(count);
-}
-
-TEST_F(LinuxWorkQueues, UserInitiatedQueuesGoFirstAndDestructionWaitsForAll) {
-    queues = std::make_unique<platform::linux_::WorkQueues>(1);
-    std::string order;
-    const auto standard = make();
-    const auto user = make(QualityOfService::userInitiated);
-    block(make());
-    standard->async([&] {
-        order += 's';
-        for (int i = 0; i < 1000; ++i) user->async([&] { order += 'l'; });
-    });
-    user->async([&] { order += 'u'; });
-    ended.release();
-    queues.reset();
-    EXPECT_EQ(order, "us" + std::string(1000, 'l'));
-}
-
-TEST_F(LinuxWorkQueues, IdleQueuesSyncOnTheCallersThreadAndAreIdleAgainAlsoAfterAThrow) {
-    const auto throwing = [&, self = std::this_thread::get_id()] {
-        EXPECT_EQ(std::this_thread::get_id(), self);
-        throw std::runtime_error("item");
-    };
-    for (int i = 0; i < 2; ++i) EXPECT_THROW(queue->sync(throwing), std::runtime_error);
-    EXPECT_FALSE(queue->isCurrent());
-}
 
 TEST_F(LinuxWorkQueues, LentThreadsServeIdleQueuesButAreNotCaptured) {
     std::atomic<bool> isBack = false;
@@ -138,50 +91,58 @@ TEST_F(LinuxWorkQueues, LentThreadsServeIdleQueuesButAreNotCaptured) {
     const auto ending = [&] { ended.release(); };
     {
         platform::linux_::LentThread lent;
-        queue->asyncOnCaller([&, self = std::this_thread::get_id()] {
-            EXPECT_EQ(std::this_thread::get_id(), self);
-            started.release();
-        });
+        const auto self = std::this_thread::get_id();
+        queue->asyncOnCaller(
+            [&] {
+                EXPECT_EQ(std::this_thread::get_id(), self);
+                started.release();
+            },
+            brief);
         EXPECT_FALSE(started.try_acquire()); // not inside the call
         lent.serve();
         EXPECT_TRUE(started.try_acquire());
-        queue->asyncOnCaller(endless);
+        const auto elsewhere = [&] {
+            EXPECT_NE(std::this_thread::get_id(), self);
+            started.release();
+        };
+        queue->asyncOnCaller(elsewhere, [] { return false; });
+        lent.serve();
+        started.acquire();
+        queue->sync([] {});
+        queue->asyncOnCaller(endless, brief);
         lent.serve();
         isBack = true; // never reached by a thread that runs whatever comes
         ended.expect();
         // What it has taken and not begun is left to others before it waits, and when it ends.
-        queue->asyncOnCaller(ending);
+        queue->asyncOnCaller(ending, brief);
         queue->sync([] {});
         ended.expect();
-        queue->asyncOnCaller(ending);
+        queue->asyncOnCaller(ending, brief);
     }
     ended.expect();
 }
 
 TEST_F(LinuxWorkQueues, ManyThreadsNeverOverlapAndEachKeepsItsOrder) {
     constexpr std::size_t rounds = 3000;
-    const auto nested = make(QualityOfService::userInitiated);
-    std::array<std::size_t, 4> runs{}; // no lock: the queue is one
-    std::size_t nestedRuns = 0;
-    std::array<std::jthread, runs.size()> threads;
-    for (std::size_t thread = 0; thread < threads.size(); ++thread) {
-        threads[thread] = std::jthread([&, thread] {
-            for (std::size_t i = 0; i < rounds; ++i) {
-                const auto item = [&, thread, i] {
-                    ASSERT_EQ(runs[thread]++, i);
-                    nested->sync([&] { ++nestedRuns; });
-                };
-                switch ((i + thread) % 3) {
-                case 0: queue->async(item); break;
-                case 1: queue->asyncOnCaller(item); break;
-                default: queue->sync(item); break;
+    std::size_t total = 0; // no lock: the queue is one
+    std::array<std::size_t, 4> runs{};
+    {
+        std::vector<std::jthread> threads;
+        for (std::size_t& run : runs) {
+            threads.emplace_back([&] {
+                for (std::size_t i = 0; i < rounds; ++i) {
+                    const auto item = [&, i] {
+                        ++total;
+                        EXPECT_EQ(run++, i);
+                    };
+                    if (i % 3 == 0) queue->sync(item);
+                    if (i % 3 == 1) queue->async(item);
+                    if (i % 3 == 2) queue->asyncOnCaller(item, brief);
                 }
-            }
-        });
+            });
+        }
     }
-    for (std::jthread& thread : threads) thread.join();
-    queue->sync([] {});
-    nested->sync([&] { EXPECT_EQ(nestedRuns, runs.size() * rounds); });
+    queue->sync([&] { EXPECT_EQ(total, runs.size() * rounds); });
 }
 
 } // namespace

@@ -14,20 +14,33 @@ class FakeBundles final : public platform::Bundles {
     using Mode = platform::BundleMode;
 
 public:
-    struct Content {
+    struct Bundle final : platform::BundleObject {
+        Bundle(std::optional<std::string> at, bool exists)
+            : path(std::move(at)), hasReadableManifest(exists), hasSupportPath(exists) {}
+
+        std::optional<std::string> property(Property property) const override {
+            if (property == Property::executablePath) return executablePath;
+            return property == Property::path || hasSupportPath ? path : std::nullopt;
+        }
+        std::optional<platform::Dictionary> infoDictionary() const override {
+            return hasReadableManifest ? std::optional(manifest) : std::nullopt;
+        }
+        std::string description() const override { return "<bundle " + path.value_or("none") + ">"; }
+
+        const std::optional<std::string> path;
         platform::Dictionary manifest;
         std::optional<std::string> executablePath;
-        bool hasReadableManifest = true;
-        bool hasSupportPath = true;
+        bool hasReadableManifest;
+        bool hasSupportPath;
     };
 
-    /// Adds or replaces. Objects given out before see the new manifest.
-    Content& add(const std::string& path, platform::Dictionary manifest,
-                 std::optional<std::string> executablePath = std::nullopt) {
-        auto& content = _bundles[path];
-        if (!content) content = std::make_shared<Content>();
-        *content = Content{std::move(manifest), std::move(executablePath)};
-        return *content;
+    /// Adds or replaces. Objects given out before show the new one.
+    Bundle& add(const std::string& path, platform::Dictionary manifest,
+                std::optional<std::string> executablePath = {}) {
+        auto& bundle = *_bundles.try_emplace(path, std::make_shared<Bundle>(path, true)).first->second;
+        bundle.manifest = std::move(manifest);
+        bundle.executablePath = std::move(executablePath);
+        return bundle;
     }
 
     /// The running program.
@@ -38,38 +51,14 @@ public:
         return bundle->property(Property::path) ? bundle : fromPath(mainExecutable, Mode::directory);
     }
     BundleRef fromPath(const std::string& path, Mode mode) override {
-        if (mode == Mode::directory) {
-            const std::string trimmed = path.ends_with('/') ? path.substr(0, path.size() - 1) : path;
-            return std::make_shared<Object>(trimmed, _bundles.contains(trimmed) ? _bundles[trimmed] : nullptr);
-        }
-        for (const auto& [directory, content] : _bundles)
-            if (content->executablePath == path) return std::make_shared<Object>(directory, content);
-        return std::make_shared<Object>(std::nullopt, nullptr);
+        const std::string directory = path.ends_with('/') ? path.substr(0, path.size() - 1) : path;
+        for (const auto& [place, bundle] : _bundles)
+            if (mode == Mode::directory ? place == directory : bundle->executablePath == path) return bundle;
+        return std::make_shared<Bundle>(mode == Mode::directory ? std::optional(directory) : std::nullopt, false);
     }
 
 private:
-    class Object final : public platform::BundleObject {
-    public:
-        Object(std::optional<std::string> path, std::shared_ptr<const Content> content)
-            : _path(std::move(path)), _content(std::move(content)) {}
-
-        std::optional<std::string> property(Property property) const override {
-            if (property == Property::path) return _path;
-            if (!_content) return std::nullopt;
-            if (property == Property::executablePath) return _content->executablePath;
-            return _content->hasSupportPath ? _path : std::nullopt;
-        }
-        std::optional<platform::Dictionary> infoDictionary() const override {
-            return _content && _content->hasReadableManifest ? std::optional(_content->manifest) : std::nullopt;
-        }
-        std::string description() const override { return "<bundle " + _path.value_or("none") + ">"; }
-
-    private:
-        const std::optional<std::string> _path;
-        const std::shared_ptr<const Content> _content;
-    };
-
-    std::map<std::string, std::shared_ptr<Content>> _bundles;
+    std::map<std::string, std::shared_ptr<Bundle>> _bundles;
 };
 
 } // namespace support

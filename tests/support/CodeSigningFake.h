@@ -2,7 +2,6 @@
 
 #include "platform/CodeSigning.h"
 
-#include <cerrno>
 #include <map>
 
 namespace support {
@@ -20,9 +19,7 @@ public:
 
     platform::EntitlementValue copyEntitlement(const std::shared_ptr<platform::SecTask>& task,
                                                const std::string& name) override {
-        const auto known = std::dynamic_pointer_cast<Task>(task);
-        if (!known) return {platform::Value(), platform::Error{platform::posixErrorDomain, EINVAL, "no task"}};
-        const auto granted = entitlements.find(known->pid);
+        const auto granted = entitlements.find(std::static_pointer_cast<Task>(task)->pid);
         return {granted == entitlements.end() ? platform::Value() : granted->second[name], failure};
     }
 

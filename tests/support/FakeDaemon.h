@@ -29,8 +29,8 @@ struct FakeDaemon {
     }
 
     /// A host's end of a new connection.
-    std::shared_ptr<platform::Connection> connect(const std::string& service = zembra::serviceName) {
-        auto connection = fake.transport.connect(service, fake.queues.makeSerial("host"));
+    std::shared_ptr<platform::Connection> connect() {
+        auto connection = fake.transport.connect(zembra::serviceName, fake.queues.makeSerial("host"));
         connection->setEventHandler([](const platform::ConnectionEvent&) {});
         connection->resume();
         fake.transport.deliver();
@@ -40,12 +40,12 @@ struct FakeDaemon {
     /// The reply to `message` over `connection`; none when there was none.
     std::optional<platform::Dictionary> ask(const std::shared_ptr<platform::Connection>& connection,
                                             const platform::Dictionary& message) {
-        auto answer = std::make_shared<platform::ReplyOrError>(platform::TransportError{});
-        connection->sendWithReply(message, fake.queues.makeSerial("replies"),
-                                  [answer](const platform::ReplyOrError& reply) { *answer = reply; });
+        auto answer = std::make_shared<std::optional<platform::Dictionary>>();
+        connection->sendWithReply(message, fake.queues.makeSerial("replies"), [answer](const auto& reply) {
+            if (const auto* content = std::get_if<platform::Dictionary>(&reply)) *answer = *content;
+        });
         fake.transport.deliver();
-        const auto* content = std::get_if<platform::Dictionary>(answer.get());
-        return content != nullptr ? std::optional(*content) : std::nullopt;
+        return *answer;
     }
 
     /// The same over a connection of its own, in the current version.

@@ -9,9 +9,6 @@ namespace support {
 /// Preferences in memory. A domain is refused until it is added, and what is stored shows after `synchronize`.
 class FakePreferences final : public platform::Preferences {
 public:
-    /// While true, `synchronize` fails.
-    bool isUnreadable = false;
-
     /// As another process would; an absent value removes.
     void store(const std::string& domain, const std::string& key, platform::Value value) {
         _stored[domain][key] = std::move(value);
@@ -19,7 +16,7 @@ public:
 
     void addDomain(const std::string& domain) override { _read.try_emplace(domain); }
     bool synchronize(const std::string& domain) override {
-        if (!_read.contains(domain) || isUnreadable) return false;
+        if (!_read.contains(domain)) return false;
         _read[domain] = _stored[domain];
         return true;
     }

@@ -14,8 +14,6 @@ public:
     }
     /// An instance that is reported for the identifier but does not name it.
     void addIncomplete(const std::string& identifier) { _busy.emplace(identifier, platform::Dictionary()); }
-    /// Its instances are idle again.
-    void endBusy(const std::string& identifier) { _busy.erase(identifier); }
 
     std::vector<platform::Dictionary> busyExtensionInstances(const std::set<std::string>& identifiers) override {
         std::vector<platform::Dictionary> instances;

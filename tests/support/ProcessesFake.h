@@ -26,7 +26,6 @@ public:
         const auto variable = environment.find(name);
         return variable == environment.end() ? std::nullopt : std::optional(variable->second);
     }
-    std::uint32_t currentUser() override { return 1000; }
 };
 
 } // namespace support

@@ -43,8 +43,10 @@ struct Requests : testing::Test {
     void installThree() { install({described(3), described(1), described(2)}); }
     /// The daemon's record of one that is installed.
     zbd::ZBDPlugInRef record(int number) const { return daemon.server->findPlugIn(uuid(number)); }
-    void hold(int number) {
-        daemon.server->addHold(zbd::ZBDPlugInHold::initWithPlugIns(fake.transport, {record(number)}, nullptr));
+    platform::UUID hold(int number) {
+        const auto made = zbd::ZBDPlugInHold::initWithPlugIns(fake.transport, {record(number)}, nullptr);
+        daemon.server->addHold(made);
+        return made->uuid();
     }
     void grant(const platform::Dictionary& entitlements) { fake.codeSigning.entitlements[77] = entitlements; }
     std::size_t posts() const { return fake.notifications.posts().size(); }

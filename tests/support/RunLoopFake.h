@@ -11,16 +11,9 @@ public:
     /// The main queue is one of `queues`, labelled "main".
     explicit FakeRunLoop(FakeWorkQueues& queues) : _queues(queues), _mainQueue(queues.makeSerial("main")) {}
 
-    /// Runs the items of all queues until none is left.
-    void run() override {
-        ++runs;
-        _queues.runAll();
-    }
+    void run() override { _queues.runAll(); }
     std::shared_ptr<platform::WorkQueue> mainQueue() override { return _mainQueue; }
     std::unique_ptr<platform::SignalSource> makeSignalSource(int, std::function<void()>) override { return nullptr; }
-
-    /// How often `run` was called.
-    int runs = 0;
 
 private:
     FakeWorkQueues& _queues;

@@ -21,53 +21,44 @@ public:
     int issueError = 0;
     int consumeError = 0;
     int releaseError = 0;
-    int consumed = 0; // successes
+    int consumed = 0; // successes; the last one is the latest handle
     int released = 0;
 
     void allowFile(const std::string& path) { files[path] = path; }
 
     platform::Result<std::string> issueFile(const std::string& extensionClass, const std::string& path,
                                             platform::SandboxFlag flag, const std::string& within) override {
-        auto file = files.find(path);
-        if (issueError != 0 || file == files.end()) return refused(issueError != 0 ? issueError : EPERM);
+        const auto file = files.find(path);
+        if (file == files.end()) return issue(false, path);
         const std::string& resolved = file->second;
-        if (!within.empty() && resolved != within && !resolved.starts_with(within + "/")) return refused(EPERM);
-        return issue("file:" + extensionClass + ":" + (flag == platform::SandboxFlag::canonical ? resolved : path));
+        const bool isWithin = within.empty() || resolved == within || resolved.starts_with(within + "/");
+        const std::string& named = flag == platform::SandboxFlag::canonical ? resolved : path;
+        return issue(isWithin, "file:" + extensionClass + ":" + named);
     }
-
     platform::Result<std::string> issueService(const std::string& extensionClass, const std::string& name) override {
-        if (issueError != 0 || !services.contains(name)) return refused(issueError != 0 ? issueError : EPERM);
-        return issue("service:" + extensionClass + ":" + name);
+        return issue(services.contains(name), "service:" + extensionClass + ":" + name);
     }
-
     std::int64_t consume(const std::string& token, int& errorNumber) override {
-        if (consumeError != 0 || !_issued.contains(token)) {
-            errorNumber = consumeError != 0 ? consumeError : token.empty() ? EINVAL : EPERM;
-            return -1;
-        }
-        ++consumed;
-        _handles.insert(++_lastHandle);
-        return _lastHandle;
+        errorNumber = consumeError != 0 ? consumeError : EPERM;
+        if (consumeError != 0 || !_issued.contains(token)) return -1;
+        return ++consumed;
     }
-
     int release(std::int64_t handle, int& errorNumber) override {
-        if (releaseError != 0 || _handles.erase(handle) == 0) {
-            errorNumber = releaseError != 0 ? releaseError : EINVAL;
-            return -1;
-        }
+        errorNumber = releaseError != 0 ? releaseError : EINVAL;
+        if (releaseError != 0 || handle < 1 || handle > consumed) return -1;
         ++released;
         return 0;
     }
-
     bool isSandboxed(std::int32_t pid) override { return !unconfined.contains(pid); }
 
 private:
-    static platform::Error refused(int number) { return {platform::posixErrorDomain, number, "refused"}; }
-    std::string issue(std::string token) { return *_issued.insert(std::move(token)).first; }
+    platform::Result<std::string> issue(bool isAllowed, const std::string& token) {
+        if (issueError != 0) return platform::Error{platform::posixErrorDomain, issueError, "failed"};
+        if (!isAllowed) return platform::Error{platform::posixErrorDomain, EPERM, "refused"};
+        return *_issued.insert(token).first;
+    }
 
     std::set<std::string> _issued;
-    std::set<std::int64_t> _handles;
-    std::int64_t _lastHandle = 0;
 };
 
 } // namespace support

@@ -4,12 +4,10 @@
 
 #include <atomic>
 #include <cerrno>
-#include <deque>
 #include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
-#include <set>
 #include <string>
 #include <utility>
 #include <vector>
@@ -29,19 +27,21 @@ public:
     };
 
     /// From now on services are added, and removals are done: they end the instances of `addInstance`.
-    void allow() { _isAllowed = true; }
+    void allow() {
+        _additionFailure = 0;
+        _usualResult = platform::serviceHasNoInstances;
+    }
     /// Answers additions with `number`, and nothing is added; 0 ends it.
     void failAdditions(int number) { _additionFailure = number; }
     /// From now on answers wait for `answer`.
     void holdAnswers() { _isHolding = true; }
     void addInstance(const std::string& bundleIdentifier, const std::string& version) {
-        const std::lock_guard lock(_mutex);
-        _instances.insert({bundleIdentifier, version});
+        fail(bundleIdentifier, version, platform::serviceInstancesTerminated);
     }
-    /// Answers removals of this service with `result`, and nothing is ended.
+    /// Answers the next removal of this service with `result`.
     void fail(const std::string& bundleIdentifier, const std::string& version, int result) {
         const std::lock_guard lock(_mutex);
-        _failures[{bundleIdentifier, version}] = result;
+        _results[{bundleIdentifier, version}] = result;
     }
     /// Every service that was added, in order.
     std::vector<ExternalService> additions() const {
@@ -57,8 +57,8 @@ public:
     bool answer() {
         const std::lock_guard lock(_mutex);
         if (_held.empty()) return false;
-        const auto oldest = std::move(_held.front());
-        _held.pop_front();
+        const auto oldest = _held.front();
+        _held.erase(_held.begin());
         oldest();
         return true;
     }
@@ -67,7 +67,6 @@ public:
                                   const platform::Dictionary& overlay) override {
         const std::lock_guard lock(_mutex);
         if (_additionFailure != 0) return _additionFailure;
-        if (!_isAllowed) return EPERM;
         _additions.push_back({host.pid, executablePath, overlay});
         return 0;
     }
@@ -77,31 +76,21 @@ public:
         const std::lock_guard lock(_mutex);
         const Service service{bundleIdentifier, version};
         _removals.push_back(service);
-        const auto answer = [queue = std::move(queue), call = std::move(completion), result = resultFor(service)] {
-            queue->async([call, result] { call(result); });
-        };
-        if (_isHolding)
-            _held.push_back(answer);
-        else
-            answer();
+        const auto told = _results.extract(service);
+        const int result = told ? told.mapped() : _usualResult.load();
+        const auto answer = [=] { queue->async([=] { completion(result); }); };
+        _isHolding ? _held.push_back(answer) : answer();
     }
 
 private:
-    int resultFor(const Service& service) {
-        if (const auto failure = _failures.find(service); failure != _failures.end()) return failure->second;
-        if (!_isAllowed) return EPERM;
-        return _instances.erase(service) > 0 ? platform::serviceInstancesTerminated : platform::serviceHasNoInstances;
-    }
-
     mutable std::recursive_mutex _mutex; // a queue may run answers in place, and they may ask again
-    std::atomic<bool> _isAllowed = false;
     std::atomic<bool> _isHolding = false;
-    std::atomic<int> _additionFailure = 0;
+    std::atomic<int> _additionFailure = EPERM;
+    std::atomic<int> _usualResult = EPERM;
     std::vector<ExternalService> _additions;
-    std::set<Service> _instances;
-    std::map<Service, int> _failures;
+    std::map<Service, int> _results; // of the next removal
     std::vector<Service> _removals;
-    std::deque<std::function<void()>> _held;
+    std::vector<std::function<void()>> _held;
 };
 
 } // namespace support

@@ -17,6 +17,7 @@ public:
         std::string category; // empty for the default handle
         platform::LogLevel level;
         std::string message;
+        bool operator==(const Line&) const = default;
     };
 
     FakeSystemLog() : SystemLog("", "debug,private", -1, Destination::descriptor) {}
@@ -41,9 +42,7 @@ public:
     }
     /// True when some line reads so.
     bool contains(platform::LogLevel level, std::string_view category, std::string_view message) const {
-        return std::ranges::any_of(lines(), [&](const Line& line) {
-            return line.level == level && line.category == category && line.message == message;
-        });
+        return std::ranges::count(lines(), Line{std::string(category), level, std::string(message)}) != 0;
     }
     /// From now on lines go to standard error too, where a death test can match them.
     void print() { _isPrinting = true; }

@@ -9,21 +9,12 @@
 #include <utility>
 #include <vector>
 
-namespace support {
-
-namespace fake_transport {
+namespace support::fake_transport {
 
 using namespace platform;
-
 using Step = std::function<void()>;
 
 inline void call(const std::shared_ptr<WorkQueue>& queue, Step step) { queue ? queue->async(std::move(step)) : step(); }
-
-inline Value copied(const Value& value) {
-    std::string bytes;
-    appendCompact(bytes, value);
-    return *decodeCompact(bytes, UUIDs::allowed);
-}
 
 /// What is to happen to a listener or an end of a connection once that is resumed.
 struct Delivery {
@@ -35,34 +26,30 @@ using Line = std::deque<Delivery>;
 
 class Service final : public Listener, public std::enable_shared_from_this<Service> {
 public:
-    Service(std::shared_ptr<Line> line, std::shared_ptr<WorkQueue> queue, std::optional<std::string> refusal)
-        : _line(std::move(line)), _queue(std::move(queue)), _refusal(std::move(refusal)) {}
+    Service(std::shared_ptr<Line> line, std::shared_ptr<WorkQueue> queue, bool isAllowed)
+        : _line(std::move(line)), _queue(std::move(queue)), _isAllowed(isAllowed) {}
 
-    std::optional<std::string> refusal() const override { return _refusal; }
-    void setEventHandler(EventHandler handler) override { _handler = std::move(handler); }
-    void resume() override {
-        _isResumed = true;
-        if (_refusal) arrive(TransportError{TransportErrorKind::other, *_refusal});
+    std::optional<std::string> refusal() const override {
+        return _isAllowed ? std::nullopt : std::optional<std::string>("service not allowed");
     }
+    void setEventHandler(EventHandler handler) override { _handler = std::move(handler); }
+    void resume() override { _isResumed = true; }
     void cancel() override {
-        _isResumed = isCancelled = true;
         _handler = nullptr; // connections that wait for it end
+        _isResumed = true;
     }
     void arrive(Event event) {
         _line->push_back({weak_from_this(), &_isResumed, [this, event = std::move(event)] {
-                              _queue->async([self = shared_from_this(), event] {
-                                  const EventHandler handler = self->_handler; // it may cancel this
+                              _queue->async([handler = _handler, event] { // it may cancel this
                                   if (handler) handler(event);
                               });
                           }});
     }
 
-    bool isCancelled = false;
-
 private:
     const std::shared_ptr<Line> _line;
     const std::shared_ptr<WorkQueue> _queue;
-    const std::optional<std::string> _refusal;
+    const bool _isAllowed;
     EventHandler _handler;
     bool _isResumed = false;
 };
@@ -71,7 +58,6 @@ private:
 struct Request final : ReplyToken {
     std::shared_ptr<WorkQueue> queue;
     Connection::ReplyHandler handler;
-    std::weak_ptr<Connection> receiver; // none once it has replied
 
     void end(ReplyOrError reply) {
         call(queue, [hear = std::move(handler), reply = std::move(reply)] { hear(reply); });
@@ -103,16 +89,11 @@ public:
         _isResumed = true;
         if (onResume) std::exchange(onResume, nullptr)();
     }
-    void cancel() override {
-        if (std::exchange(_isEnding, true)) return;
-        endOther();
-        arrive([this] { close(); });
-    }
+    void cancel() override { close(); }
     void send(const ReplyMessage& reply) override {
         const auto request = std::dynamic_pointer_cast<Request>(reply.token);
-        if (!request || request->receiver.lock().get() != this || _isEnding) return;
-        request->receiver.reset();
-        tellOther([request, content = *copied(reply.content).dictionary()](End& to) {
+        if (!request || _isClosed) return;
+        tellOther([request, content = *Value(reply.content).dictionary()](End& to) {
             if (std::erase(to._pending, request) > 0) request->end(content);
         });
     }
@@ -120,10 +101,9 @@ public:
         const auto request = std::make_shared<Request>();
         request->queue = std::move(queue);
         request->handler = std::move(handler);
-        request->receiver = other;
-        if (_isEnding) return request->end(invalid);
+        if (_isClosed) return request->end(invalid);
         _pending.push_back(request);
-        sendEvent(ReceivedMessage{copied(message), request});
+        sendEvent(ReceivedMessage{message, request});
     }
     /// The other end hears `event` after all that was sent before.
     void sendEvent(const ConnectionEvent& event) {
@@ -145,21 +125,15 @@ private:
         const auto to = other.lock();
         if (!to) return;
         to->arrive([tell, to = to.get()] {
-            if (!to->_isEnding) tell(*to);
+            if (!to->_isClosed) tell(*to);
         });
     }
     void arrive(Step step) { _line->push_back({weak_from_this(), &_isResumed, std::move(step)}); }
-    /// The other end becomes invalid after all that was sent before.
-    void endOther() {
-        tellOther([](End& to) { to.close(); });
-    }
     void close() {
         if (std::exchange(_isClosed, true)) return;
-        _isEnding = true;
-        endOther();
+        tellOther([](End& to) { to.close(); });
         for (const auto& request : std::exchange(_pending, {})) request->end(invalid);
-        const auto handler = std::exchange(_handler, nullptr);
-        call(handler ? _queue : nullptr, [handler, finalize = std::exchange(_finalize, nullptr)] {
+        call(_queue, [handler = std::exchange(_handler, nullptr), finalize = std::exchange(_finalize, nullptr)] {
             if (handler) handler(invalid);
             if (finalize) finalize();
         });
@@ -174,8 +148,7 @@ private:
     Step _finalize;
     std::shared_ptr<Connection> _self; // from when it is resumed until it is invalid
     bool _isResumed = false;
-    bool _isEnding = false; // cancelled or closed: nothing is sent or delivered any more
-    bool _isClosed = false;
+    bool _isClosed = false; // nothing is sent or delivered any more
 };
 
 struct Activity final : KeepAliveActivity {
@@ -183,11 +156,9 @@ struct Activity final : KeepAliveActivity {
     const std::shared_ptr<const void> mark;
 };
 
-} // namespace fake_transport
-
-/// A transport within the process. What is sent is copied as over a wire and waits in one line, in the order sent,
-/// until it is delivered. On the test's thread alone; handlers of accepted connections run in `deliver`.
-class FakeTransport final : public platform::Transport {
+/// A transport within the process. What is sent waits in one line, in the order sent, until it is delivered. On the
+/// test's thread alone; handlers of accepted connections run in `deliver`.
+class FakeTransport final : public Transport {
 public:
     ~FakeTransport() override {
         for (const auto& weak : _ends) {
@@ -202,9 +173,9 @@ public:
     /// Nobody may listen for a service that was not allowed.
     void allowService(const std::string& name) { _allowed.insert(name); }
     /// Whom connections made from now on show to the other end.
-    void setPeer(platform::AuditToken peer) { _peer = std::move(peer); }
+    void setPeer(AuditToken peer) { _peer = std::move(peer); }
     /// As if nobody listened anywhere: connections that are resumed from now on are invalid.
-    void refuseConnections() { _services.clear(); }
+    void refuseConnections() { _isRefusing = true; }
 
     /// Delivers all that waits, and what is sent meanwhile. Answers how much.
     std::size_t deliver() {
@@ -218,70 +189,58 @@ public:
         }
     }
 
-    /// The two ends of a new connection without a listener: the first behaves as one made with `connect` on `queue`,
-    /// the second as an accepted one whose peer is `peer`. Both are suspended.
-    std::pair<std::shared_ptr<platform::Connection>, std::shared_ptr<platform::Connection>>
-    makePair(platform::AuditToken peer, std::shared_ptr<platform::WorkQueue> queue) {
-        const auto client = std::make_shared<End>(_line, std::move(queue), platform::AuditToken());
-        const auto accepted = std::make_shared<End>(_line, nullptr, std::move(peer));
-        client->other = accepted;
-        accepted->other = client;
-        _ends.insert(_ends.end(), {client, accepted});
-        return {client, accepted};
-    }
-
     // What only a test does to an end of a connection, or to a listener. Everything waits in the line as messages do.
 
     /// A message with any content, without reply.
-    void sendValue(const std::shared_ptr<platform::Connection>& from, const platform::Value& content) {
-        dynamic_cast<End&>(*from).sendEvent(platform::ReceivedMessage{fake_transport::copied(content), nullptr});
+    void sendValue(const std::shared_ptr<Connection>& from, const Value& content) {
+        dynamic_cast<End&>(*from).sendEvent(ReceivedMessage{content, nullptr});
     }
     /// The other end hears termination-imminent, and still replies.
-    void shutDownSending(const std::shared_ptr<platform::Connection>& from) {
-        using enum platform::TransportErrorKind;
-        dynamic_cast<End&>(*from).sendEvent(platform::TransportError{terminationImminent, "Peer sends no more"});
+    void shutDownSending(const std::shared_ptr<Connection>& from) {
+        dynamic_cast<End&>(*from).sendEvent(
+            TransportError{TransportErrorKind::terminationImminent, "Peer sends no more"});
     }
     /// `to` hears `event`, whatever that is.
-    void inject(const std::shared_ptr<platform::Listener>& to, platform::Listener::Event event) {
+    void inject(const std::shared_ptr<Listener>& to, Listener::Event event) {
         dynamic_cast<Service&>(*to).arrive(std::move(event));
     }
 
     std::size_t activityCount() const { return static_cast<std::size_t>(_activities.use_count()) - 1; }
 
-    std::shared_ptr<platform::Listener> createListener(const std::string& serviceName,
-                                                       std::shared_ptr<platform::WorkQueue> queue) override {
-        auto& place = _services[serviceName];
-        const auto owner = place.lock();
-        std::optional<std::string> refusal;
-        if (!_allowed.contains(serviceName)) refusal = "service not allowed: " + serviceName;
-        if (owner && !owner->isCancelled) refusal = "service name taken: " + serviceName;
-        const auto listener = std::make_shared<Service>(_line, std::move(queue), refusal);
-        if (!refusal) place = listener;
+    std::shared_ptr<Listener> createListener(const std::string& name, std::shared_ptr<WorkQueue> queue) override {
+        const auto listener = std::make_shared<Service>(_line, std::move(queue), _allowed.contains(name));
+        if (!listener->refusal()) _services[name] = listener;
         return listener;
     }
-    std::shared_ptr<platform::Connection> connect(const std::string& serviceName,
-                                                  std::shared_ptr<platform::WorkQueue> queue) override {
-        const auto [client, accepted] = makePair(_peer, std::move(queue));
+    std::shared_ptr<Connection> connect(const std::string& serviceName, std::shared_ptr<WorkQueue> queue) override {
+        const auto client = std::make_shared<End>(_line, std::move(queue), AuditToken());
+        const auto accepted = std::make_shared<End>(_line, nullptr, _peer);
+        client->other = accepted;
+        accepted->other = client;
+        _ends.insert(_ends.end(), {client, accepted});
         // The other end goes, and this one with it, unless a listener takes it.
-        dynamic_cast<End&>(*client).onResume = [this, serviceName, offered = accepted] {
-            if (const auto service = _services[serviceName].lock()) service->arrive(offered);
+        client->onResume = [this, serviceName, accepted] {
+            const auto service = _services[serviceName].lock();
+            if (service && !_isRefusing) service->arrive(accepted);
         };
         return client;
     }
-    std::unique_ptr<platform::KeepAliveActivity> beginActivity(const std::string&) override {
-        return std::make_unique<fake_transport::Activity>(_activities);
+    std::unique_ptr<KeepAliveActivity> beginActivity(const std::string&) override {
+        return std::make_unique<Activity>(_activities);
     }
 
 private:
-    using End = fake_transport::End;
-    using Service = fake_transport::Service;
-
-    const std::shared_ptr<fake_transport::Line> _line = std::make_shared<fake_transport::Line>();
+    const std::shared_ptr<Line> _line = std::make_shared<Line>();
     std::vector<std::weak_ptr<End>> _ends;
     std::set<std::string> _allowed;
     std::map<std::string, std::weak_ptr<Service>> _services;
-    platform::AuditToken _peer;
+    AuditToken _peer;
+    bool _isRefusing = false;
     const std::shared_ptr<const void> _activities = std::make_shared<int>(); // held by each
 };
 
-} // namespace support
+} // namespace support::fake_transport
+
+namespace support {
+using fake_transport::FakeTransport;
+}

@@ -4,10 +4,7 @@
 
 #include <algorithm>
 #include <set>
-#include <string>
-#include <string_view>
 #include <utility>
-#include <vector>
 
 namespace support {
 
@@ -22,11 +19,9 @@ public:
     }
     std::vector<std::string> supertypes(std::string_view type) override {
         std::vector<std::string> reached{std::string(type)};
-        for (std::size_t next = 0; next < reached.size(); ++next) {
-            for (const auto& [from, to] : _declared) {
+        for (std::size_t next = 0; next < reached.size(); ++next)
+            for (const auto& [from, to] : _declared)
                 if (from == reached[next] && std::ranges::count(reached, to) == 0) reached.push_back(to);
-            }
-        }
         return reached;
     }
 

@@ -12,6 +12,8 @@ namespace support {
 
 /// Queues without threads: items wait, in one line for all queues, until the test runs them on its own thread.
 class FakeWorkQueues final : public platform::WorkQueues {
+    using WorkQueue = platform::WorkQueue;
+
 public:
     enum class Mode {
         manual,  // items run in `runOne`, `runAll`, or before a `sync` of their queue
@@ -23,32 +25,28 @@ public:
 
     struct Made {
         std::string label;
-        platform::QualityOfService quality;
     };
     /// Every queue made so far.
     std::vector<Made> made;
 
-    std::shared_ptr<platform::WorkQueue>
-    makeSerial(std::string label, platform::QualityOfService quality = platform::QualityOfService::standard) override {
-        made.push_back({label, quality});
+    std::shared_ptr<WorkQueue> makeSerial(std::string label, platform::QualityOfService = {}) override {
+        made.push_back({label});
         return std::make_shared<Queue>(std::move(label), _line);
     }
 
     /// Runs the oldest item that may run now. False when there is none.
     bool runOne() { return _line->runFirst(nullptr); }
-    /// Runs items until none is left, those submitted meanwhile too. Answers how many.
-    std::size_t runAll() {
-        std::size_t count = 0;
-        while (runOne()) ++count;
-        return count;
+    /// Runs items until none is left, those submitted meanwhile too.
+    void runAll() {
+        while (runOne()) {
+        }
     }
 
 private:
     class Queue;
     struct Line {
         Mode mode = Mode::manual;
-        std::deque<std::pair<std::shared_ptr<Queue>, platform::WorkQueue::Item>>
-            items; // a queue lives until its own ran
+        std::deque<std::pair<std::shared_ptr<Queue>, WorkQueue::Item>> items; // a queue lives until its own ran
 
         /// Of `queue`, or of any when null.
         bool runFirst(const Queue* queue) {
@@ -63,7 +61,7 @@ private:
         }
     };
 
-    class Queue final : public platform::WorkQueue, public std::enable_shared_from_this<Queue> {
+    class Queue final : public WorkQueue, public std::enable_shared_from_this<Queue> {
     public:
         Queue(std::string label, std::shared_ptr<Line> line) : _label(std::move(label)), _line(std::move(line)) {}
 
@@ -71,7 +69,7 @@ private:
             _line->items.emplace_back(shared_from_this(), std::move(item));
             if (_line->mode == Mode::inPlace) runWaiting();
         }
-        void asyncOnCaller(Item item) override { async(std::move(item)); }
+        void asyncOnCaller(Item item, std::function<bool()> /*isBrief*/) override { async(std::move(item)); }
         bool isCurrent() const override { return _isRunning; }
         std::string_view label() const override { return _label; }
 

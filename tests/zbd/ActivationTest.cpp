@@ -9,6 +9,8 @@ using namespace platform;
 using support::errorReply;
 
 struct Activation : support::Requests {
+    const Dictionary guarded{{"VKExtensionHostEntitlement", "needed"}};
+
     Activation() {
         fake.serviceManager.allow();
         fake.bundles.add(application, {{"VBBundleIdentifier", "com.example.a"}});
@@ -27,9 +29,7 @@ TEST_F(Activation, TheServiceManagerLearnsHostExecutableAndOverlay) {
     const Dictionary ofPlugIn{{"HOME", "own"}, {"ZBTEST_SDK", "own"}};
     const Dictionary whole{{"Kept", 1}, {"_SandboxProfile", "none"}, {"EnvironmentVariables", ofPlugIn}};
     const std::string given = "/containers/any";
-    for (const auto& [declared, home, sdk] : {std::tuple(Value("a text"), given, "daemon"),
-                                              {Dictionary{{"EnvironmentVariables", "x"}}, given, "daemon"},
-                                              {whole, "own", "own"}}) {
+    for (const auto& [declared, home, sdk] : {std::tuple(Value("a text"), given, "daemon"), {whole, "own", "own"}}) {
         auto plugIn = described(1);
         plugIn.info = *zembra::dictionaryChanging(plugIn.info, "QMXService", declared);
         install({plugIn});
@@ -39,18 +39,12 @@ TEST_F(Activation, TheServiceManagerLearnsHostExecutableAndOverlay) {
             {{"HOME", home}, {"VBFIXED_USER_HOME", given}, {"TMPDIR", given + "/tmp"}, {"ZBTEST_SDK", sdk}});
         EXPECT_EQ(service()["EnvironmentVariables"], Value(environment)) << "later sources replace earlier ones";
     }
-    EXPECT_EQ(service()["Kept"], Value(1));
-    EXPECT_EQ(service()["_SandboxProfile"], Value("plugin"));
-    EXPECT_EQ(service()["_OmitSandboxParameters"], Value(true));
+    EXPECT_EQ((Array{service()["Kept"], service()["_SandboxProfile"], service()["_OmitSandboxParameters"]}),
+              (Array{1, "plugin", true}));
     const auto added = fake.serviceManager.additions().back();
     EXPECT_EQ(added.host, 77);
     EXPECT_EQ(added.executablePath, pathOf(1) + "/run");
     EXPECT_EQ(added.overlay, (Dictionary{{"QMXService", service()}, {"VBBundlePackageType", "QMX!"}}));
-    expectLogged(debug, "pid 77 provided 4 environment entries");
-    expectLogged(debug, "raw QMXService=" + Value(whole).description(), "cx");
-    expectLogged(info, "no QMXService for plug-in; database returned a text");
-    expectLogged(info, "assigning plug-in com.example.1(1.0) " + idOf(1) + " to plugin sandbox");
-    expectLogged(debug, "activation overlay=" + Value(added.overlay).description());
     expectLogged(standard, "allowing host 77 /Applications/Host.app/host to use plug-in com.example.1(1.0) uuid=" +
                                idOf(1) + " at " + pathOf(1));
 }
@@ -59,32 +53,30 @@ TEST_F(Activation, ExtensionPointsChooseTheProfile) {
     int number = 0;
     const auto profile = [&](const std::string& point, const Value& openAccess) {
         const Dictionary attributes{{"RequestsOpenAccess", openAccess}};
-        install({described(++number, {{"VKExtensionPointIdentifier", point}, {"VKExtensionAttributes", attributes}})});
+        const auto name = "com.nordane." + point;
+        install({described(++number, {{"VKExtensionPointIdentifier", name}, {"VKExtensionAttributes", attributes}})});
         EXPECT_EQ(ready({uuid(number)}), succeeded);
         return std::string(*service().string("_SandboxProfile"));
     };
-    for (const auto& [point, expected] : {std::pair("netplug.filter-data", "network-filter"),
-                                          {"peekview.extension.preview", "peekviewd"},
-                                          {"app.non-ui-extension.multiple-instances", "sketchpad-devtools"},
-                                          {"Keyboard-service", "plugin"}}) {
-        EXPECT_EQ(profile(std::string("com.nordane.") + point, true), expected);
-    }
-    const std::string keyboard = "com.nordane.keyboard-service";
-    for (const Value& openAccess : {Value(false), Value("true")}) EXPECT_EQ(profile(keyboard, openAccess), "keyboard");
+    for (const auto& [point, openAccess, expected] :
+         {std::tuple("netplug.filter-data", Value(true), "network-filter"),
+          {"app.non-ui-extension.multiple-instances", true, "sketchpad-devtools"},
+          {"Keyboard-service", true, "plugin"},
+          {"keyboard-service", false, "keyboard"},
+          {"keyboard-service", "true", "keyboard"}})
+        EXPECT_EQ(profile(point, openAccess), expected);
     EXPECT_TRUE(fake.privacyConsent.asked.empty()) << "nobody wants it";
     // Consent is asked for afresh, and no failure grants it.
     fake.privacyConsent.decide("com.example.a", "another", true);
     for (const auto& granted : {std::optional<bool>(), std::optional(false), std::optional(true)}) {
         fake.privacyConsent.decide("com.example.a", keyboardNetworkAccess, granted);
-        EXPECT_EQ(profile(keyboard, true), granted == true ? "plugin" : "keyboard");
+        EXPECT_EQ(profile("keyboard-service", true), granted == true ? "plugin" : "keyboard");
     }
     fake.privacyConsent.isUnavailable = true;
-    EXPECT_EQ(profile(keyboard, true), "keyboard");
-    expectLogged(info, "PVCAccessCopyInformationForBundle failed for <bundle /Applications/A.app>");
+    EXPECT_EQ(profile("keyboard-service", true), "keyboard");
 }
 
 TEST_F(Activation, NothingIsEnabledUnlessEverythingIsAllowed) {
-    const Dictionary guarded{{"VKExtensionHostEntitlement", "needed"}};
     const Dictionary data{{"VKExtensionProtocol", "#Data"}, {"VKExtensionHostEntitlement", "needed"}};
     install({described(1), described(2, guarded), described(3), described(4, data)});
     hold(3);
@@ -110,18 +102,14 @@ TEST_F(Activation, AFailureIsToldAndStopsNoOther) {
     EXPECT_EQ(ready({uuid(2), uuid(1)}), missing);
     EXPECT_EQ(ready({uuid(1), uuid(2), uuid(1)}), missing);
     EXPECT_EQ(fake.serviceManager.additions().size(), 2U) << "once for each request";
-    expectLogged(error, "failed to obtain execPath for plug-in " + record(2)->description() + "(" + idOf(2) +
-                            ") bundle=<bundle " + pathOf(2) + ">");
     fake.serviceManager.failAdditions(EIO);
     EXPECT_TRUE(ready({uuid(2), uuid(1)})["error"]) << "two failures, one reply";
     EXPECT_EQ(ready({uuid(1)}), errorReply(4, "unable to enable plug-in com.example.1(" + idOf(1) + ")"));
-    expectLogged(
-        error, "ignitd error 5 trying to allow 77 /Applications/Host.app/host to use plug-in com.example.1(1.0) uuid=" +
-                   idOf(1) + " at " + pathOf(1));
+    EXPECT_TRUE(
+        support::logged(error, "ignitd error 5 trying to allow 77 /Applications/Host.app/host to use plug-in "));
 }
 
 TEST_F(Activation, AccessGivesATokenForEachBundleOrNone) {
-    const Dictionary guarded{{"VKExtensionHostEntitlement", "needed"}};
     install({described(1, guarded), described(2, guarded)});
     hold(2); // neither keeps anybody from reading
     fake.sandbox.allowFile(pathOf(1));
@@ -131,20 +119,16 @@ TEST_F(Activation, AccessGivesATokenForEachBundleOrNone) {
     // The walk ends at the first that is known neither by its UUID nor by a path.
     for (const auto& [uuids, paths] : {std::pair(Array{uuid(1), uuid(9), uuid(2)}, Value(pathOf(2))),
                                        {Array{uuid(9), uuid(9)}, Array{pathOf(2)}},
-                                       {Array{uuid(9)}, Array{7}}}) {
+                                       {Array{uuid(9)}, Array{7}}})
         EXPECT_EQ(access(uuids, paths), errorReply(4, "no such plugin (uuid not found)"));
-    }
     const Array pathsFor2{"/nowhere", pathOf(2)};
     EXPECT_EQ(access({uuid(1), uuid(9)}, pathsFor2),
               errorReply(4, "cannot create file extension to " + pathOf(2) + ": 1"));
     fake.sandbox.allowFile(pathOf(2));
     const std::string prefix = "file:com.nordane.app-sandbox.read:";
-    const Dictionary tokens{{"extensions", Array{prefix + pathOf(1), prefix + pathOf(2)}}};
-    EXPECT_EQ(access({uuid(1), uuid(9)}, pathsFor2), tokens);
-    expectLogged(standard, "Paths present but not an array (ignoring values)", "traffic");
+    EXPECT_EQ(access({uuid(1), uuid(9)}, pathsFor2),
+              (Dictionary{{"extensions", Array{prefix + pathOf(1), prefix + pathOf(2)}}}));
     expectLogged(standard, "Paths present but has different count than UUIDs (ignoring)", "traffic");
-    expectLogged(info, "Failed to find plugin by " + idOf(9), "traffic");
-    expectLogged(info, "Looking for plugin " + idOf(9) + " by path " + pathOf(2), "traffic");
 }
 
 } // namespace

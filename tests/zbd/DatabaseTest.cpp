@@ -1,31 +1,27 @@
-#include "tests/support/FakeDaemon.h"
-
-#include <gtest/gtest.h>
+#include "tests/support/Requests.h"
 
 namespace {
 
 using namespace platform;
 using support::dataPlugIn;
-using support::logged;
 using support::processLog;
+using Names = std::set<std::string>;
 
-const Dictionary autoElect{{"com.nordane.developer.auto-elect-plugin", true}};
-
-struct Database : testing::Test {
-    support::FakeDaemon daemon;
-    support::FakePlatform& fake = daemon.fake;
+struct Database : support::Requests {
     zbd::ZBDatabase& database = *daemon.server;
 
-    void annotate(const PlugInProxyRef& proxy, const Dictionary& annotation) {
+    /// A data plug-in, installed, with that entitlement.
+    PlugInProxyRef entitled(const std::string& name, const char* entitlement, const Value& value) {
+        return fake.install(name, Dictionary{{std::string("com.nordane.developer.") + entitlement, value}});
+    }
+    PlugInProxyRef annotated(const PlugInProxyRef& proxy, const Dictionary& annotation) {
         database.setAnnotation(annotation, *zbd::ZBDPlugIn::initWithCXData(fake.platform, proxy));
+        return proxy;
     }
     /// How many records were built.
-    static long builds() {
-        const auto messages = processLog.messages("ops");
-        return std::count(messages.begin(), messages.end(), "createPlugInForProxy");
-    }
-    std::set<std::string> found(const std::optional<Dictionary>& query) {
-        std::set<std::string> names;
+    static long builds() { return std::ranges::count(processLog.messages("ops"), "createPlugInForProxy"); }
+    Names found(const std::optional<Dictionary>& query) {
+        Names names;
         const auto plugIns = database.findPlugIns(query).value_or(std::vector<zbd::ZBDPlugInRef>());
         for (const auto& plugIn : plugIns) names.emplace(plugIn->identifier().string()->substr(12)); // "com.example."
         return names;
@@ -40,92 +36,73 @@ TEST_F(Database, RecordIsBuiltOnceAndFoundByEveryWay) {
     EXPECT_EQ(database.plugInForProxy(proxy), plugIn);
     EXPECT_EQ(database.findPlugIns(std::nullopt), std::vector{plugIn});
     EXPECT_EQ(builds(), 1);
-    EXPECT_TRUE(logged(LogLevel::standard, "plug-in INSTALLED:com.example.a com.example.a(1) " + proxy->uuid->text() +
-                                               " " + proxy->bundleURL->path()));
-    const auto unknown = UUID::random();
-    EXPECT_FALSE(database.findPlugIn(unknown));
-    EXPECT_TRUE(logged(LogLevel::info, "Catalix cannot find plug-in with UUID:" + unknown.text()));
-    EXPECT_FALSE(database.findPlugInAtPath(URL::file("/nowhere")));
-    EXPECT_TRUE(logged(LogLevel::info, "Catalix cannot find plug-in at path:/nowhere"));
-    // The registry refuses.
-    const URL url = *proxy->bundleURL;
-    EXPECT_EQ(database.addPlugIn(url), (Error{"Zembra", 2, "Catalix failed to register the plug-in"}));
-    EXPECT_EQ(database.removePlugIn(url), (Error{"Zembra", 2, "Catalix failed to deregister the plug-in"}));
-}
-
-TEST_F(Database, CacheIsPurgedWholeWhenItOutgrowsItsLimit) {
-    database.setCacheLimit(2);
-    std::vector<PlugInProxyRef> proxies;
-    for (const char* name : {"a", "b", "c", "d"}) proxies.push_back(fake.install(name));
-    // Three records fit, for the test before the third sees two; the fourth finds three.
-    for (const auto& [index, built] : {std::pair(0U, 1), {1U, 2}, {2U, 3}, {0U, 3}, {3U, 4}, {3U, 4}, {0U, 5}}) {
-        database.findPlugIn(*proxies[index]->uuid);
-        EXPECT_EQ(builds(), built) << index;
-        EXPECT_EQ(fake.registry.calls("clearSchemaCaches"), built > 3 ? 1 : 0);
-    }
-    EXPECT_TRUE(logged(LogLevel::info, "purging cache for 3 > 2"));
     fake.locale.setLanguages({"de", "en"});
-    fake.queues.runAll();
-    EXPECT_EQ(fake.registry.calls("clearSchemaCaches"), 2) << "a change of locale empties it too";
-    EXPECT_TRUE(logged(LogLevel::standard, "locale change detected; purging cache"));
+    EXPECT_NE(database.findPlugIn(*proxy->uuid), plugIn) << "its names may be others now";
+    database.setCacheLimit(0);
+    database.findPlugIn(*fake.install("b")->uuid);
+    expectLogged(info, "purging cache for 1 > 0");
+    expectLogged(standard, "plug-in INSTALLED:com.example.a com.example.a(1) " + proxy->uuid->text() + " " +
+                               proxy->bundleURL->path());
 }
 
-TEST_F(Database, UninstallNoticeRemovesThenTellsTheDelegate) {
-    struct Delegate : zbd::ZBDatabaseDelegate {
-        std::function<void()> told;
-        void removedPlugIns(const std::vector<PlugInProxyRef>&) override { told(); }
-    };
-    const auto delegate = std::make_shared<Delegate>();
-    database.setDelegate(delegate);
-    const auto proxy = fake.install("a");
-    EXPECT_TRUE(database.findPlugIn(*proxy->uuid));
-    fake.registry.uninstall(*proxy->uuid);
-    int removals = 0;
-    delegate->told = [&] { removals += database.findPlugIn(*proxy->uuid) ? 0 : 1; }; // it may use the database
-    fake.registry.fireWillUninstall({proxy});
-    EXPECT_EQ(removals, 1);
-}
-
-TEST_F(Database, ProxyOlderThanItsUninstallGivesNoRecord) {
-    const auto outdated = fake.install("a"); // a discovery may have taken it before
-    fake.registry.uninstall(*outdated->uuid);
-    EXPECT_FALSE(database.plugInForProxy(outdated));
+TEST_F(Database, UninstalledPlugInsHaveTheirInstancesEnded) {
+    fake.serviceManager.allow();
+    fake.serviceManager.holdAnswers();
+    fake.serviceManager.addInstance("com.example.1", "1");
+    fake.serviceManager.fail("com.example.3", "1", 5);
+    std::vector<PlugInProxyRef> proxies;
+    for (const int number : {1, 2, 3}) {
+        auto proxy = support::proxyFor(described(number));
+        if (number == 2) proxy.infoDictionary.reset(); // and with it the version
+        proxies.push_back(fake.registry.install(proxy));
+    }
+    database.findPlugIn(uuid(1));
+    fake.registry.uninstall(uuid(1));
+    fake.registry.fireWillUninstall(proxies);
+    EXPECT_FALSE(database.findPlugIn(uuid(1)));
+    EXPECT_FALSE(database.plugInForProxy(proxies[0])) << "a discovery may have taken it before";
+    const std::pair<LogLevel, const char*> results[] = {
+        {info, "one or more plug-ins have been terminated for uuid="},
+        {debug, "ignitd reported no plug-ins on record for uuid="},
+        {error, "ignitd error attempting to terminate plug-ins: error=5 for uuid="}};
+    for (int i = 0; i < 3; ++i) {
+        const auto& [level, line] = results[i];
+        const std::string name = "com.example." + std::to_string(i + 1);
+        expectLogged(standard, "plug-in UNINSTALLED:" + name + " " + name + "(1) " + idOf(i + 1) + " " + pathOf(i + 1));
+        EXPECT_EQ(fake.serviceManager.removals().at(i), std::pair(name, std::string("1")));
+        EXPECT_TRUE(fake.serviceManager.answer());
+        expectLogged(level, line + idOf(i + 1));
+    }
+    EXPECT_TRUE(processLog.messages("ops").back().starts_with("removal complete for "));
 }
 
 TEST_F(Database, UnusablePlugInsAreSkipped) {
-    const URL url = URL::file("/Applications/A.app");
-    for (const auto& [name, application] : {std::pair("good", ApplicationRecord{url, {}, {}}),
-                                            {"misconfigured", {url, {}, {}}},
-                                            {"placeholder", {URL::file("/P.app"), {}, {}, true, true}},
-                                            {"strange", {URL::file("/S"), {}, {}, false, false}}}) {
-        auto described = dataPlugIn(name);
-        described.containingBundle = std::make_shared<ApplicationRecord>(application);
-        if (name == std::string("misconfigured")) described.info = support::manifestOf("com.example.bad", {});
-        fake.registry.install(described);
+    const URL url = URL::file(application);
+    for (const auto& [name, record] : {std::pair("good", ApplicationRecord{url, {}, {}}),
+                                       {"misconfigured", {url, {}, {}}},
+                                       {"placeholder", {URL::file("/P.app"), {}, {}, true, true}},
+                                       {"strange", {URL::file("/S"), {}, {}, false, false}}}) {
+        auto plugIn = dataPlugIn(name);
+        plugIn.containingBundle = std::make_shared<ApplicationRecord>(record);
+        if (name == std::string("misconfigured")) plugIn.info = support::manifestOf("com.example.bad", {});
+        fake.registry.install(plugIn);
     }
     auto unplaced = *fake.install("unplaced");
     unplaced.bundleURL.reset();
     fake.registry.install(unplaced);
-
-    EXPECT_EQ(found(std::nullopt), (std::set<std::string>{"good"}));
+    EXPECT_EQ(found(std::nullopt), Names{"good"});
     EXPECT_EQ(database.plugInsWithinApplication(url)->size(), 1U);
-    EXPECT_EQ(builds(), 3) << "the misconfigured one is tried each time";
-    const std::string log = testing::PrintToString(processLog.messages("ops"));
-    for (const char* text :
-         {" with nil bundleURL\"", " because its app is a placeholder\"",
-          "CX reported containingBundle is not an application", "CX reported 1 plug-ins (cache 0/1)"})
-        EXPECT_NE(log.find(text), std::string::npos) << text;
 }
 
 TEST_F(Database, ElectionPrefilterKeepsWhatTheRuleAsksFor) {
     fake.install("none");
-    fake.install("automatic", autoElect);
-    fake.install("falsely", Dictionary{{"com.nordane.developer.auto-elect-plugin", "yes"}});
-    annotate(fake.install("elected"), {{"election", 1}});
-    annotate(fake.install("wide"), {{"election", 257}});
-    fake.install("replacing", Dictionary{{"com.nordane.developer.replace-plugin", "com.example.elected"}});
-    const std::set<std::string> all{"automatic", "elected", "wide", "replacing", "none", "falsely"};
-    const std::pair<std::vector<Value>, std::set<std::string>> cases[] = {
+    entitled("automatic", "auto-elect-plugin", true);
+    entitled("falsely", "auto-elect-plugin", "yes");
+    annotated(fake.install("elected"), {{"election", 1}});
+    annotated(fake.install("wide"), {{"election", 257}});
+    entitled("replacing", "replace-plugin", "com.example.elected");
+    const Names all{"automatic", "elected", "wide", "replacing", "none", "falsely"};
+    const std::pair<std::vector<Value>, Names> cases[] = {
         {{"1", "=1", Array{"1", "=2"}}, {"automatic", "elected", "wide", "replacing"}},
         {{"0"}, {"none", "falsely"}},
         {{"7", Array(), "="}, {}},
@@ -136,18 +113,16 @@ TEST_F(Database, ElectionPrefilterKeepsWhatTheRuleAsksFor) {
         for (const Value& pattern : patterns)
             EXPECT_EQ(found(Dictionary{{"VKUserElection", pattern}}), expected) << pattern.description();
     EXPECT_EQ(found(Dictionary{{"other", "1"}}), all);
-    fake.registry.answerNothing();
-    EXPECT_FALSE(database.findPlugIns(autoElect));
 }
 
 TEST_F(Database, AutoElectionHappensWhenTheRecordIsBuilt) {
     for (const auto& [before, after] : {std::pair(0, 1), {2, 2}}) {
-        const auto proxy = fake.install("a" + std::to_string(before), autoElect);
-        annotate(proxy, {{"election", before}, {"extension", Dictionary()}});
+        const auto proxy = annotated(entitled(std::to_string(before), "auto-elect-plugin", true),
+                                     {{"election", before}, {"extension", Dictionary()}});
         EXPECT_EQ(database.annotationForPlugIn(*database.findPlugIn(*proxy->uuid)),
                   (Dictionary{{"election", after}, {"extension", Dictionary()}}));
     }
-    EXPECT_TRUE(fake.notifications.posts().empty());
+    EXPECT_EQ(posts(), 0U);
 }
 
 } // namespace

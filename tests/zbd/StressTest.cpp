@@ -32,28 +32,26 @@ class History {
 public:
     void begin(std::uint64_t value) {
         const std::lock_guard lock(_mutex);
-        _changes.push_back({value, Span()});
+        _changes.emplace_back(value, Span());
     }
     void end(bool cameAbout = true) {
         const std::lock_guard lock(_mutex);
-        _changes.back().during.end = ++now;
+        _changes.back().second.end = ++now;
         if (!cameAbout) _changes.pop_back();
     }
     /// Whether, at some moment of `span`, the value may have been this one; or another, when `isEqual` is false.
     bool was(std::uint64_t value, const Span& span, bool isEqual = true) const {
         const std::lock_guard lock(_mutex);
         for (auto change = _changes.rbegin(); change != _changes.rend(); ++change) {
-            if (change->during.begin < span.end && (change->value == value) == isEqual) return true;
-            if (change->during.end < span.begin) return false; // those before it were over
+            const auto& [each, during] = *change;
+            if (during.begin < span.end && (each == value) == isEqual) return true;
+            if (during.end < span.begin) return false; // those before it were over
         }
         return false;
     }
 
 private:
-    struct Change {
-        std::uint64_t value = 0;
-        Span during;
-    };
+    using Change = std::pair<std::uint64_t, Span>;
     mutable std::mutex _mutex;
     std::vector<Change> _changes{Change()};
 };
@@ -96,13 +94,12 @@ struct Stress : testing::Test {
     void set(std::size_t i, std::uint64_t version) {
         const std::lock_guard lock(notices);
         const auto old = fake.registry.plugInForUUID(uuid(i));
-        if (version == 0) {
-            fake.registry.uninstall(uuid(i));
-        } else {
-            auto plugIn = support::dataPlugIn(std::to_string(i), std::to_string(version));
-            plugIn.uuid = uuid(i);
-            fake.registry.fireDidInstall({fake.registry.install(plugIn)});
-        }
+        const std::string text = std::to_string(version);
+        auto proxy = support::proxyFor(support::dataPlugIn(std::to_string(i), text));
+        proxy.uuid = uuid(i);
+        proxy.localizedName = text;
+        if (version == 0) fake.registry.uninstall(uuid(i));
+        if (version != 0) fake.registry.fireDidInstall({fake.registry.install(proxy)});
         if (old) fake.registry.fireWillUninstall({old});
     }
 
@@ -112,19 +109,26 @@ struct Stress : testing::Test {
             : _zbd(zembra::ZBDaemonClient::initWithServiceName(stress.outside, stress.queues, std::nullopt)) {}
         ~Client() { EXPECT_EQ(_replies->size(), 0U) << "replies that nobody asked for"; }
 
-        Dictionary ask(std::string_view type, const Dictionary& content) {
+        void send(std::string_view type, const Dictionary& content) {
             auto message = _zbd->request(type);
             message.merge(content);
-            during = Span();
             _zbd->send(message, [to = _replies](const ReplyOrError& reply) { to->put(reply); });
+        }
+        Dictionary receive() {
             const auto reply = _replies->take();
-            during.end = ++now;
             const auto* answer = reply ? std::get_if<Dictionary>(&*reply) : nullptr;
             EXPECT_TRUE(answer) << "a request without its reply";
             return answer ? *answer : Dictionary();
         }
+        Dictionary ask(std::string_view type, const Dictionary& content = {}) {
+            during = Span();
+            send(type, content);
+            const auto answer = receive();
+            during.end = ++now;
+            return answer;
+        }
         /// The same; what is in "matches", which is absent when nothing was found.
-        Value find(std::string_view type, const Dictionary& content) {
+        Value find(std::string_view type, const Dictionary& content = {}) {
             return _zbd->convertFromQMX(ask(type, content)["matches"]);
         }
         Span during; // of the last request
@@ -140,8 +144,11 @@ struct Stress : testing::Test {
     }
     void check(std::size_t i, const Dictionary& form, const Span& span) {
         expectKnown(i, true, span);
-        const std::string version(form.string("version").value_or("none"));
-        EXPECT_TRUE(versions[i].was(version == "<none>" ? 0 : std::stoull(version), span)) << Value(form).description();
+        for (const char* fact : {"version", "localizedDisplayName"}) {
+            const std::string version(form.string(fact).value_or("none"));
+            EXPECT_TRUE(versions[i].was(version == "<none>" ? 0 : std::stoull(version), span))
+                << Value(form).description();
+        }
         const auto election = form.dictionary("annotations").value_or(Dictionary())["election"].integerValue();
         EXPECT_TRUE(elections[i].was(static_cast<std::uint64_t>(election.value_or(0)), span));
     }
@@ -178,7 +185,7 @@ struct Stress : testing::Test {
         } else {
             client = std::make_unique<Client>(*this); // the hold ends with its client
             const auto tokenOf = [](const auto& hold) { return Value(hold->uuid()); };
-            while (std::ranges::count(server->holds(), token, tokenOf) > 0) client->ask("bulk", {});
+            while (std::ranges::count(server->holds(), token, tokenOf) > 0) client->ask("bulk");
         }
         holds[worker][i].end();
     }
@@ -208,6 +215,40 @@ struct Stress : testing::Test {
         }
     }
 };
+
+TEST_F(Stress, ManyHoldsEndTogetherWhileOthersAreServed) {
+    constexpr std::size_t many = 10'000;
+    set(0, 1);
+    Client other(*this);
+    for (const bool byDeath : {true, false}) {
+        auto holder = std::make_unique<Client>(*this);
+        const auto before = fake.notifications.posts().size();
+        for (std::size_t i = 0; i < many; ++i) holder->send("lock", {{"paths", Array{path(0)}}, {"flags", 1}});
+        MutableArray tokens;
+        for (std::size_t i = 0; i < many; ++i) tokens.append(holder->receive()["uuids"]);
+        EXPECT_EQ(server->holds().size(), many);
+        byDeath ? holder.reset() : holder->send("lock", {{"uuids", tokens}});
+        do EXPECT_TRUE(other.find("match"));
+        while (!server->holds().empty());
+        EXPECT_TRUE(byDeath || holder->receive().empty());
+        EXPECT_EQ(fake.notifications.posts().size() - before, 2 * many);
+    }
+}
+
+TEST_F(Stress, AServiceManagerThatNeverAnswersBlocksNobodyElse) {
+    fake.serviceManager.holdAnswers();
+    set(0, 1);
+    std::vector<std::unique_ptr<Client>> waiting;
+    for (int i = 0; i < 3; ++i) { // with more holds together than there are threads
+        waiting.push_back(std::make_unique<Client>(*this));
+        for (int n = 0; n < 200; ++n) waiting[i]->send("lock", {{"paths", Array{path(0)}}, {"flags", 5}});
+    }
+    Client other(*this);
+    while (server->holds().size() < 600) EXPECT_TRUE(other.find("find", {{"uuids", uuid(0)}}));
+    EXPECT_TRUE(other.ask("lock", {{"paths", Array{path(0)}}, {"flags", 1}})["uuids"]);
+    waiting.clear(); // those who wait may go, and their holds with them
+    while (server->holds().size() > 1) EXPECT_EQ(other.ask("bulk"), Dictionary());
+}
 
 TEST_F(Stress, EveryAnswerIsOneThatSomeOrderOfTheEventsAllows) {
     std::vector<std::thread> threads;
