@@ -108,7 +108,7 @@ private:
     std::unordered_map<Pollable*, std::shared_ptr<Pollable>> _kept;
     std::vector<std::shared_ptr<Pollable>> _dropped; // still named by events of this round
     std::vector<Pollable*> _again;
-    std::vector<Pollable*> _served; // to be told so
+    std::vector<Pollable*> _served;                          // to be told so
     std::vector<std::pair<Clock::time_point, Task>> _timers; // a handful: retries only
     std::set<std::pair<Clock::time_point, Pollable*>> _deadlines;
     std::vector<char> _scratch;

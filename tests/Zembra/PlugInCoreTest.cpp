@@ -156,17 +156,4 @@ TEST(InitWithForm, ReadsWhatIsThere) {
     EXPECT_FALSE(restored("path", Value()) || restored("identifier", Value()) || restored("bundleInfo", Dictionary()));
 }
 
-TEST(Annotations, ChangeInANewDictionary) {
-    const auto plugIn = ZBPlugInCore::initWithForm(whole);
-    MutableDictionary extension;
-    plugIn->setAnnotation("extension", extension);
-    plugIn->setAnnotation("election", Value());
-    extension.set("later", true);
-    EXPECT_EQ(plugIn->annotations(), (Dictionary{{"extension", Dictionary()}}));
-    EXPECT_EQ(whole.dictionary("annotations"), (Dictionary{{"election", 1}}));
-    plugIn->updateFromForm({{"identifier", "other"}});
-    plugIn->setAnnotation("election", 1);
-    EXPECT_TRUE(!plugIn->annotations() && plugIn->identifier() == Value("org.example.share"));
-}
-
 } // namespace

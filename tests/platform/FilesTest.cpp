@@ -40,18 +40,6 @@ TEST_F(LinuxFiles, ReadWriteAndSetAsideFollowALink) {
     EXPECT_EQ(codeOf(files.read(path + "missing", anySize)), fileReadNoSuchFileCode);
 }
 
-TEST_F(LinuxFiles, RealPathFollowsLinksAndKeepsItsLimit) {
-    fs::create_symlink(path, link);
-    const auto expect = [&](const auto&... peer) {
-        EXPECT_EQ(codeOf(files.realPath(link, anySize, peer...)), fileReadNoSuchFileCode);
-        EXPECT_FALSE(files.writeAtomically(path, "x"));
-        EXPECT_EQ(*files.realPath(link, path.size() + 1, peer...), path);
-        EXPECT_FALSE(files.realPath(path, path.size(), peer...) || !fs::remove(path));
-    };
-    expect();
-    expect(AuditToken{getpid(), getuid(), getgid(), linux_::LinuxPeerProcess::look(getpid())});
-}
-
 TEST_F(LinuxFiles, RealPathReachesWhatThePeersGroupsReach) {
     if (geteuid() != 0) GTEST_SKIP() << "for root's daemon";
     constexpr gid_t friends = 4711;

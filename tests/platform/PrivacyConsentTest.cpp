@@ -36,21 +36,6 @@ struct World {
     platform::linux_::PrivacyConsent consent{platform::linux_::Root(scratch.path())};
 };
 
-TEST(PrivacyConsent, TellsWhatIsStoredNowForThatApplication) {
-    World world;
-    EXPECT_EQ(world.records(), Records()) << "there is no file";
-    const Dictionary services{{"network", true}, {"camera", false}, {"neither", 1}};
-    const std::pair<Dictionary, std::optional<Records>> cases[] = {
-        {{{"com.example.other", services}}, Records()},
-        {{{identifier, services}}, Records{{"network", true}, {"camera", false}, {"neither", std::nullopt}}},
-        {{{identifier, "text"}}, std::nullopt},
-    };
-    for (const auto& [grants, records] : cases) {
-        world.store(grants);
-        EXPECT_EQ(world.records(), records);
-    }
-}
-
 TEST(PrivacyConsent, BelievesNothingThatOthersCouldHaveWritten) {
     std::vector<std::pair<const char*, std::function<void(const std::string&)>>> spoilings{
         {"writable for the group", [](const auto& path) { chmod(path.c_str(), 0775); }},

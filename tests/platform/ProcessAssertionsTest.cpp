@@ -73,18 +73,6 @@ TEST_F(ProcessAssertions, ReportsEachBusyInstanceOfTheAskedWhileItLasts) {
     EXPECT_EQ(busyOf(assertions), Names{"b"});
 }
 
-TEST_F(ProcessAssertions, AProcessIsOneInstanceUntilItsLastAssertionEnds) {
-    // Asked by another process: no process is told of its own locks.
-    const auto count = [&] { return support::resultInChild([&] { return int(busyOf(assertions).size()); }); };
-    auto first = std::make_optional<BusyAssertion>(root, "a");
-    auto second = std::make_optional<BusyAssertion>(root, "a");
-    EXPECT_EQ(count(), 1);
-    first.reset();
-    EXPECT_EQ(count(), 1) << "the second one still stands";
-    second.reset();
-    EXPECT_EQ(count(), 0);
-}
-
 TEST_F(ProcessAssertions, BelievesOnlyPrivateDirectoriesAndRealFiles) {
     const Instance instance(busy("a"));
     for (const auto& [directory, opened, closed] :

@@ -1,6 +1,5 @@
 // The same questions to the services of Linux and to their twins in memory: tests of the daemon are worth what the
 // twins are like. Registry, transport, work queues, run loop, bundles and types have suites of their own.
-#include "platform/linux/ActivationRules.h"
 #include "platform/linux/BusyAssertion.h"
 #include "platform/linux/CodeSigning.h"
 #include "platform/linux/Containers.h"
@@ -16,14 +15,12 @@
 #include "platform/linux/ServiceManager.h"
 #include "platform/linux/UserDirectory.h"
 #include "platform/linux/WorkQueue.h"
-#include "tests/support/ActivationRulesFake.h"
 #include "tests/support/BundleTree.h"
 #include "tests/support/BundlesFake.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/CodeSigningFake.h"
 #include "tests/support/ContainersFake.h"
 #include "tests/support/FilesFake.h"
-#include "tests/support/InterfacesFake.h"
 #include "tests/support/LocaleFake.h"
 #include "tests/support/Mailbox.h"
 #include "tests/support/NotificationsFake.h"
@@ -75,8 +72,6 @@ struct Memory {
     support::FakeCodeSigning codeSigning;
     support::FakeNotifications notifications;
     support::FakeLocale locale;
-    support::FakeInterfaces interfaces;
-    support::FakeActivationRules rules;
     support::FakeSandbox sandbox;
     support::FakeServiceManager manager;
 };
@@ -125,8 +120,6 @@ struct Linux {
     linux_::CodeSigning codeSigning;
     linux_::Notifications notifications{root};
     linux_::Locale locale{root, files, {"en"}};
-    linux_::Interfaces interfaces;
-    linux_::ActivationRules rules;
     linux_::Sandbox sandbox{root, linux_::SandboxRole::issuer};
     linux_::ServiceManager manager{root, files};
 };
@@ -157,6 +150,7 @@ TYPED_TEST(Twins, FilesAreReplacedSetAsideAndResolved) {
     EXPECT_FALSE(files.setAside(path, ".old"));
     EXPECT_EQ(files.setAside(path, ".old")->code, fileReadNoSuchFileCode);
     EXPECT_EQ(*files.read(path + ".old", 3), "new");
+    EXPECT_EQ(*this->world.containers.userContainer(name), *this->world.containers.userContainer(name));
 }
 
 TYPED_TEST(Twins, WhatTheUserDecidedIsToldWhenAskedForAnew) {
@@ -180,7 +174,6 @@ TYPED_TEST(Twins, WhatTheUserDecidedIsToldWhenAskedForAnew) {
     const auto records = *consent.informationForBundle(bundle);
     ASSERT_EQ(records.size(), 1U);
     EXPECT_TRUE(records.front().service == "network" && records.front().granted == true);
-    EXPECT_FALSE(this->world.rules.evaluate("rule", Dictionary{{"item", 1}}));
 }
 
 TYPED_TEST(Twins, ProcessesAreKnownByPidAndToken) {
@@ -220,19 +213,6 @@ TYPED_TEST(Twins, ObserversHearOnTheirQueueUntilTheyEnd) {
     changes.reset();
     this->queue->sync([] {});
     EXPECT_EQ(this->calls.size(), 0U);
-}
-
-TYPED_TEST(Twins, NamesBelongToTheFirstWhoRegisteredThem) {
-    Interfaces& interfaces = this->world.interfaces;
-    EXPECT_FALSE(interfaces.find(name));
-    const auto first = interfaces.create(name);
-    const auto second = interfaces.create(name);
-    EXPECT_EQ(interfaces.registerInterface(first), first);
-    EXPECT_EQ(interfaces.registerInterface(second), first);
-    EXPECT_FALSE(interfaces.create(name));
-    EXPECT_EQ(interfaces.find(name), first);
-
-    EXPECT_EQ(*this->world.containers.userContainer(name), *this->world.containers.userContainer(name));
 }
 
 TYPED_TEST(Twins, TokensAreForWhatExistsInsideAndHandlesAreReleasedOnce) {

@@ -1,12 +1,10 @@
 #include "platform/Url.h"
-#include "platform/Uuid.h"
 
 #include <gtest/gtest.h>
 
 namespace {
 
 using platform::URL;
-using platform::UUID;
 using namespace std::string_literals;
 
 TEST(URLFile, EscapesAllButUnreservedCharactersAndKeepsThePath) {
@@ -44,19 +42,6 @@ TEST(URLParse, TellsFileURLsFromOthers) {
     for (const auto& text : {""s, "file:///a b"s, "file:///\0a"s, "file:///\x7F"s, "file:///%"s, "file:///%4"s,
                              "file:///%4g"s, "file:///%g4"s, "a%00b"s, "file:///a?%zz"s})
         EXPECT_FALSE(URL::parse(text)) << text;
-}
-
-TEST(UUIDParse, ReadsTheTextFormInEitherCaseAndNothingElse) {
-    const std::string text = "0F1E2D3C-4B5A-6978-8796-A5B4C3D2E1F0";
-    const UUID uuid = *UUID::parse("0f1e2d3c-4b5a-6978-8796-a5b4c3d2e1f0");
-    EXPECT_TRUE(uuid.bytes[0] == 0x0F && uuid.text() == text && UUID::parse(text) == uuid);
-    EXPECT_FALSE(UUID::parse("") || UUID::parse(text + "0") || UUID::parse(text.substr(0, 35)));
-    for (std::size_t i = 0; i < text.size(); ++i) {
-        std::string broken = text;
-        broken[i] = broken[i] == '-' ? '0' : '-';
-        EXPECT_FALSE(UUID::parse(broken)) << broken;
-    }
-    EXPECT_NE(UUID::random(), UUID::random());
 }
 
 } // namespace

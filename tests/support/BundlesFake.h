@@ -15,12 +15,11 @@ class FakeBundles final : public platform::Bundles {
 
 public:
     struct Bundle final : platform::BundleObject {
-        Bundle(std::optional<std::string> at, bool exists)
-            : path(std::move(at)), hasReadableManifest(exists), hasSupportPath(exists) {}
+        Bundle(std::optional<std::string> at, bool exists) : path(std::move(at)), hasReadableManifest(exists) {}
 
         std::optional<std::string> property(Property property) const override {
             if (property == Property::executablePath) return executablePath;
-            return property == Property::path || hasSupportPath ? path : std::nullopt;
+            return property == Property::path || hasReadableManifest ? path : std::nullopt;
         }
         std::optional<platform::Dictionary> infoDictionary() const override {
             return hasReadableManifest ? std::optional(manifest) : std::nullopt;
@@ -31,7 +30,6 @@ public:
         platform::Dictionary manifest;
         std::optional<std::string> executablePath;
         bool hasReadableManifest;
-        bool hasSupportPath;
     };
 
     /// Adds or replaces. Objects given out before show the new one.
@@ -43,13 +41,7 @@ public:
         return bundle;
     }
 
-    /// The running program.
-    std::string mainExecutable = "/usr/bin/program";
-
-    BundleRef main() override {
-        auto bundle = fromPath(mainExecutable, Mode::executable);
-        return bundle->property(Property::path) ? bundle : fromPath(mainExecutable, Mode::directory);
-    }
+    BundleRef main() override { return fromPath("/usr/bin/program", Mode::directory); }
     BundleRef fromPath(const std::string& path, Mode mode) override {
         const std::string directory = path.ends_with('/') ? path.substr(0, path.size() - 1) : path;
         for (const auto& [place, bundle] : _bundles)

@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <cstdio>
-#include <set>
 #include <vector>
 
 namespace support {
@@ -21,12 +20,6 @@ public:
     };
 
     FakeSystemLog() : SystemLog("", "debug,private", -1, Destination::descriptor) {}
-
-    platform::LogHandle* createHandle(const std::string& subsystem, const std::string& category) override {
-        return _refused.contains(category) ? nullptr : SystemLog::createHandle(subsystem, category);
-    }
-    /// From now on no handle of this category can be made. Before other threads log.
-    void refuse(const std::string& category) { _refused.insert(category); }
 
     /// All lines since the last `clear`, oldest first.
     std::vector<Line> lines() const {
@@ -58,7 +51,6 @@ private:
         _lines.push_back({std::string(record.category), record.level, std::string(record.message)});
     }
 
-    std::set<std::string> _refused;
     std::atomic<bool> _isPrinting = false;
     mutable std::mutex _linesLock; // guards what follows
     std::vector<Line> _lines;
