@@ -1,6 +1,7 @@
-"""A client of the daemon's socket, written from docs/wire-protocol.md alone; without dates and without zbd's code."""
+"""A client of the daemon's socket, written from docs/wire-protocol.md alone, without zbd's code."""
 
 import contextlib
+import datetime
 import io
 import socket
 import struct
@@ -22,6 +23,7 @@ _ENCODERS = (  # in the order asked: a boolean is an integer too
     (bool, lambda value: b"\x02" if value else b"\x01"),
     (int, lambda value: struct.pack("<Bq", 3, value) if value < 2**63 else struct.pack("<BQ", 4, value)),
     (float, lambda value: struct.pack("<Bd", 5, value)),
+    (datetime.datetime, lambda value: struct.pack("<Bd", 6, value.timestamp())),
     (str, lambda value: b"\x07" + _counted(value.encode())),
     (bytes, lambda value: b"\x08" + _counted(value)),
     (uuid.UUID, lambda value: b"\x09" + value.bytes),
@@ -66,7 +68,9 @@ def _dictionary(stream):
 _DECODERS = {
     1: lambda stream: False, 2: lambda stream: True,
     3: lambda stream: _number(stream, "q"), 4: lambda stream: _number(stream, "Q"),
-    5: lambda stream: _number(stream, "d"), 7: lambda stream: _bytes(stream).decode(), 8: _bytes,
+    5: lambda stream: _number(stream, "d"),
+    6: lambda stream: datetime.datetime.fromtimestamp(_number(stream, "d"), datetime.UTC),
+    7: lambda stream: _bytes(stream).decode(), 8: _bytes,
     9: lambda stream: uuid.UUID(bytes=_take(stream, 16)),
     10: lambda stream: _items(stream, lambda: _value(stream)), 11: _dictionary,
 }

@@ -21,7 +21,6 @@ TEST(Locale, ListsWhatIsWellFormedAndElseTheEnvironments) {
     const std::pair<std::string, Languages> cases[] = {
         {listOf({"de", "pt-BR"}), {"de", "pt-BR", "en"}},
         {listOf({"en", "sv", "en"}), {"en", "sv"}},
-        {"", fallback},
         {*platform::encodeXML("de"), fallback},
         {listOf({"it", 7}), fallback},
         {listOf({"../../etc"}), fallback},
