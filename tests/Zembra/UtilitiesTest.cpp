@@ -1,8 +1,10 @@
+#include "Zembra/AtomicField.h"
 #include "Zembra/ZBUtilities.h"
 #include "platform/Hashing.h"
 
 #include <gtest/gtest.h>
 #include <sstream>
+#include <thread>
 
 namespace {
 
@@ -21,6 +23,17 @@ TEST(CompareVersionString, OrdersByNumberThenByCharacter) {
     for (const auto& [left, right] : {std::pair("01", "1"), {"1.00", "1.0"}, {"000", "0"}, {"2.007b01", "2.7b1"}})
         EXPECT_TRUE(compareVersionString(left, right) == 0) << left << " against " << right;
     EXPECT_TRUE(compareVersionString("01.2", "1.1") > 0) << "what follows the equal numbers still counts";
+}
+
+TEST(AtomicField, ReaderKeepsAWholeValueWhileAnotherReplacesIt) {
+    zembra::AtomicField<std::string> field(std::string(100, 'a'));
+    const std::jthread writer([&](const std::stop_token& stop) {
+        for (int i = 0; !stop.stop_requested(); ++i) field.set(std::string(100, i % 2 == 0 ? 'b' : 'c'));
+    });
+    for (int i = 0; i < 20'000; ++i) {
+        const std::string value = field.get();
+        EXPECT_EQ(value, std::string(100, value.front()));
+    }
 }
 
 TEST(SHA1, AnswersThePublishedExample) { // of FIPS 180-2, appendix A.1

@@ -1,5 +1,6 @@
 // The same questions to the services of Linux and to their twins in memory: tests of the daemon are worth what the
 // twins are like. Registry, transport, work queues, run loop, bundles and types have suites of their own.
+#include "platform/linux/ActivationRules.h"
 #include "platform/linux/BusyAssertion.h"
 #include "platform/linux/CodeSigning.h"
 #include "platform/linux/Containers.h"
@@ -16,21 +17,10 @@
 #include "platform/linux/UserDirectory.h"
 #include "platform/linux/WorkQueue.h"
 #include "tests/support/BundleTree.h"
-#include "tests/support/BundlesFake.h"
 #include "tests/support/ChildProcess.h"
-#include "tests/support/CodeSigningFake.h"
-#include "tests/support/ContainersFake.h"
-#include "tests/support/FilesFake.h"
-#include "tests/support/LocaleFake.h"
+#include "tests/support/FakePlatform.h"
 #include "tests/support/Mailbox.h"
-#include "tests/support/NotificationsFake.h"
-#include "tests/support/PreferencesFake.h"
-#include "tests/support/PrivacyConsentFake.h"
-#include "tests/support/ProcessAssertionsFake.h"
-#include "tests/support/ProcessesFake.h"
-#include "tests/support/SandboxFake.h"
 #include "tests/support/ScratchDirectory.h"
-#include "tests/support/ServiceManagerFake.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -43,37 +33,26 @@ namespace fs = std::filesystem;
 constexpr const char* name = "com.example.name";
 constexpr const char* busyName = "com.example.busy";
 
-struct Memory {
+struct Memory : support::FakePlatform {
     Memory() {
         files.addDirectory(directory);
         files.allowPeers(geteuid());
         containers.allow(name, directory + "/container");
         processes.paths[getpid()] = fs::canonical("/proc/self/exe");
         sandbox.services.insert(name);
-        assertions.addBusy(busyName);
-        manager.allow();
+        processAssertions.addBusy(busyName);
+        serviceManager.allow();
     }
     void makeFile(const std::string& path) {
         files.files[path] = "bytes";
         sandbox.allowFile(path);
     }
     void store(const Value& value) { preferences.store(name, "key", value); }
-    void grant() { consent.decide(name, "network", true); }
+    void grant() { privacyConsent.decide(name, "network", true); }
     void speak(const std::string& language) { locale.setLanguages({language, "en"}); }
 
     std::string directory = "/directory";
     AuditToken self{getpid(), geteuid(), getegid(), nullptr};
-    support::FakeFiles files;
-    support::FakePreferences preferences;
-    support::FakeContainers containers;
-    support::FakePrivacyConsent consent;
-    support::FakeProcessAssertions assertions;
-    support::FakeProcesses processes;
-    support::FakeCodeSigning codeSigning;
-    support::FakeNotifications notifications;
-    support::FakeLocale locale;
-    support::FakeSandbox sandbox;
-    support::FakeServiceManager manager;
 };
 
 struct Linux {
@@ -103,6 +82,7 @@ struct Linux {
         support::writeFile(root.database() + "/Locale.vlist",
                            *encodeXML(Dictionary{{"languages", Array{Value(language)}}}));
     }
+
     support::ScratchDirectory scratch;
     linux_::Root root{scratch.path()};
     const pid_t busy = support::startChild([this] { // before there are threads
@@ -114,14 +94,16 @@ struct Linux {
     linux_::Files files{root};
     linux_::Preferences preferences{root};
     linux_::Containers containers{root};
-    linux_::PrivacyConsent consent{root};
-    linux_::ProcessAssertions assertions{root};
+    linux_::PrivacyConsent privacyConsent{root};
+    linux_::ProcessAssertions processAssertions{root};
     linux_::Processes processes;
     linux_::CodeSigning codeSigning;
     linux_::Notifications notifications{root};
     linux_::Locale locale{root, files, {"en"}};
+    linux_::Interfaces interfaces;
+    linux_::ActivationRules activationRules;
     linux_::Sandbox sandbox{root, linux_::SandboxRole::issuer};
-    linux_::ServiceManager manager{root, files};
+    linux_::ServiceManager serviceManager{root, files};
 };
 
 template <class World> struct Twins : testing::Test {
@@ -167,13 +149,14 @@ TYPED_TEST(Twins, WhatTheUserDecidedIsToldWhenAskedForAnew) {
     support::writeManifest(place.path(), manifest);
     support::FakeBundles bundles;
     const auto& bundle = bundles.add(place.path(), manifest);
-    PrivacyConsent& consent = this->world.consent;
+    PrivacyConsent& consent = this->world.privacyConsent;
     EXPECT_TRUE(consent.informationForBundle(bundle)->empty());
     this->world.grant();
     consent.flushBundleCaches(bundle);
     const auto records = *consent.informationForBundle(bundle);
     ASSERT_EQ(records.size(), 1U);
     EXPECT_TRUE(records.front().service == "network" && records.front().granted == true);
+    EXPECT_FALSE(this->world.activationRules.evaluate("rule", Dictionary{{"item", 1}}));
 }
 
 TYPED_TEST(Twins, ProcessesAreKnownByPidAndToken) {
@@ -188,8 +171,8 @@ TYPED_TEST(Twins, ProcessesAreKnownByPidAndToken) {
     EXPECT_FALSE(entitlement.value);
     EXPECT_FALSE(entitlement.error);
 
-    EXPECT_TRUE(this->world.assertions.busyExtensionInstances({name}).empty());
-    const auto instances = this->world.assertions.busyExtensionInstances({name, busyName});
+    EXPECT_TRUE(this->world.processAssertions.busyExtensionInstances({name}).empty());
+    const auto instances = this->world.processAssertions.busyExtensionInstances({name, busyName});
     ASSERT_EQ(instances.size(), 1U);
     EXPECT_EQ(instances.front().string(instanceBundleIdentifierKey), busyName);
 }
@@ -214,6 +197,15 @@ TYPED_TEST(Twins, ObserversHearOnTheirQueueUntilTheyEnd) {
     EXPECT_EQ(this->calls.size(), 0U);
 }
 
+TYPED_TEST(Twins, NamesBelongToTheFirstWhoRegisteredThem) {
+    Interfaces& interfaces = this->world.interfaces;
+    EXPECT_FALSE(interfaces.find(name));
+    const auto first = interfaces.create(name);
+    const auto second = interfaces.create(name);
+    EXPECT_TRUE(interfaces.registerInterface(first) == first && interfaces.registerInterface(second) == first);
+    EXPECT_TRUE(!interfaces.create(name) && interfaces.find(name) == first);
+}
+
 TYPED_TEST(Twins, TokensAreForWhatExistsInsideAndHandlesAreReleasedOnce) {
     Sandbox& sandbox = this->world.sandbox;
     const std::string& directory = this->world.directory;
@@ -234,7 +226,7 @@ TYPED_TEST(Twins, TokensAreForWhatExistsInsideAndHandlesAreReleasedOnce) {
 
 TYPED_TEST(Twins, RemovalsAreAnsweredOnceOnTheGivenQueue) {
     for (const char* version : {"1", "2"}) {
-        this->world.manager.removeExternalService(name, version, this->queue, [this](int result) {
+        this->world.serviceManager.removeExternalService(name, version, this->queue, [this](int result) {
             this->queue->assertCurrent();
             this->calls.put(result);
         });
