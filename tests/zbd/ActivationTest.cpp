@@ -1,7 +1,6 @@
 #include "Zembra/ZBUtilities.h"
 #include "tests/support/Requests.h"
 
-
 namespace {
 
 using namespace platform;
