@@ -8,6 +8,7 @@
 
 #include <climits>
 #include <fstream>
+#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
