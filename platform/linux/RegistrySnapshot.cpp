@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <functional>
+#include <iterator>
 
 namespace platform::linux_ {
 
@@ -130,18 +131,34 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
         answers.push_back(std::move(answer));
     }
     std::ranges::sort(answers, {}, &Answer::size);
-    Positions positions;
-    for (const auto& run : answers.front().runs) {
-        std::vector<std::vector<Postings>> others; // what is left of each: positions only rise
-        for (const auto& answer : std::span(answers).subspan(1)) others.push_back(answer.runs);
-        for (const auto& [hash, position] : run) {
-            const auto isIn = [&](Postings& rest) { return skipTo(rest, position); };
-            if (std::ranges::all_of(others, [&](auto& runs) { return std::ranges::any_of(runs, isIn); }))
-                positions.push_back(position);
+    Positions positions = positionsOf(answers.front().runs);
+    for (const auto& other : std::span(answers).subspan(1)) {
+        // Few are looked for in each run. Many would be walked for each run again, so one is made of these first.
+        const bool areFew = other.runs.size() == 1 || positions.size() * other.runs.size() <= other.size;
+        Positions both;
+        if (areFew) {
+            std::vector<char> isIn(positions.size());
+            for (Postings rest : other.runs) {
+                for (std::size_t i = 0; i < positions.size(); ++i) isIn[i] |= char{skipTo(rest, positions[i])};
+            }
+            for (std::size_t i = 0; i < positions.size(); ++i) {
+                if (isIn[i] != 0) both.push_back(positions[i]);
+            }
+        } else {
+            std::ranges::set_intersection(positions, positionsOf(other.runs), std::back_inserter(both));
         }
+        positions = std::move(both);
     }
-    // Several values, or several elements of one, may name the same plug-in.
-    std::ranges::sort(positions);
+    return positions;
+}
+
+/// Rising, each once: several values, or several elements of one, may name the same plug-in.
+RegistrySnapshot::Positions RegistrySnapshot::positionsOf(const std::vector<Postings>& runs) {
+    Positions positions;
+    for (const auto& run : runs) {
+        for (const auto& posting : run) positions.push_back(posting.position);
+    }
+    if (!std::ranges::is_sorted(positions)) std::ranges::sort(positions);
     const auto doubles = std::ranges::unique(positions);
     positions.erase(doubles.begin(), doubles.end());
     return positions;

@@ -33,8 +33,9 @@ public:
     std::vector<InstalledPlugInRef> plugInsOf(std::string_view applicationPath) const;
 
     /// The plug-ins that pass every one of the tests, and perhaps a few others, ordered by UUID; all of them when there
-    /// are no tests. Costs the size of the smallest answer to one of the tests, once a key was asked for; and only its
-    /// own size when the same was asked a short while ago, as hosts do.
+    /// are no tests. Costs about the size of the smallest answer to one of the tests, once a key was asked for; never
+    /// more than the sizes of all together; and only its own size when the same was asked a short while ago, as hosts
+    /// do.
     std::vector<InstalledPlugInRef> matching(const std::vector<EqualityTest>& tests) const;
 
 private:
@@ -62,6 +63,7 @@ private:
 
     std::shared_ptr<const Index> indexFor(const std::string& key) const;
     Positions positionsMatching(const std::vector<EqualityTest>& tests) const;
+    static Positions positionsOf(const std::vector<Postings>& runs);
     static bool skipTo(Postings& rest, std::uint32_t position);
 
     const Knowledge _knowledge;
