@@ -139,7 +139,9 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
         if (areFew) {
             std::vector<char> isIn(positions.size());
             for (Postings rest : other.runs) {
-                for (std::size_t i = 0; i < positions.size(); ++i) isIn[i] |= char{skipTo(rest, positions[i])};
+                for (std::size_t i = 0; i < positions.size(); ++i) {
+                    if (skipTo(rest, positions[i])) isIn[i] = 1;
+                }
             }
             for (std::size_t i = 0; i < positions.size(); ++i) {
                 if (isIn[i] != 0) both.push_back(positions[i]);

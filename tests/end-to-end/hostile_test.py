@@ -19,7 +19,7 @@ from scratch import error, manifest
 KINDS = ("add", "remove", "bulk", "find", "match", "ready", "access", "annotate", "bulk-annotate", "lock")
 KEYS = ("paths", "uuids", "flags", "rules", "annotations", "environment")
 WRONG = (0, -1, 2**64 - 1, 1.5, float("nan"), True, "text", b"data", [[]], {}, {"a": {}}, uuid.UUID(int=0))
-VALUES = {f"Values{n}": [f"value{i}.{i}" for i in range(n)] for n in (2_500, 10_000)}
+VALUES = {n: [f"value{i}.{i}" for i in range(n)] for n in (2_500, 10_000)}
 OPERATORS = ("=", "", "<!", "<=!", ">~", ">=~", "?KT-IS:", "?KT-CONFORMS:", "?X:")  # none fits a value
 DIGITS = "1" * 150_000 + "0" * 150_000
 
@@ -108,8 +108,9 @@ class Rules(scratch.Case):
     """Rules that are out of all proportion."""
 
     def prepare(self):
-        attributes = {**VALUES, "Digits": DIGITS, "Type": "org.example.type"}
-        self.application("Paper", {"Many.plugin": manifest("many", "1.0", attributes)})
+        many, more = ({key + str(n): VALUES[n] for n in VALUES} for key in ("Values", "More"))
+        many |= {"Digits": DIGITS, "Type": "org.example.type"}
+        self.application("Paper", {"1.plugin": manifest("1", "1.0", many), "2.plugin": manifest("2", "1.0", more)})
         self.application("Others", {f"{i}.plugin": manifest(f"other{i}") for i in range(3)})
         self.daemon_environment["NORDANE_LOG"] = "error,private,stderr"  # debug lines show whole requests
         self.start()
@@ -126,8 +127,9 @@ class Rules(scratch.Case):
 
     def test_answers_are_right_at_a_cost_that_grows_no_faster_than_the_rules(self):
         for size, expected, make in (
-            (25_000, 4, lambda n: {f"key{i}": False for i in range(n)}),
+            (25_000, 5, lambda n: {f"key{i}": False for i in range(n)}),
             (2_500, 1, lambda n: {f"Values{n}": [f"x{i}" for i in range(n - 1)] + [f"value{n - 1}.{n - 1}"]}),
+            (2_500, 0, lambda n: {key + str(n): VALUES.get(n) for key in ("Values", "More")}),
             (2_500, 0, lambda n: {f"Values{n}": [f"<a{i}" for i in range(n)]}),
             (2_500, 0, lambda n: {f"Values{n}": [OPERATORS[i % 9] + str(i) for i in range(n)]}),
             (2_500, 0, lambda n: {f"Values{n}": [WRONG[i % 12] for i in range(n)]}),
