@@ -122,7 +122,8 @@ TEST_F(PlugIn, FormCarriesTheTokensThatTheSandboxGrants) {
         proxy.bundleURL = URL::file(path);
         const auto form = augmented(proxy);
         Names names;
-        for (const auto& entry : form.dictionary("extensions").value()) names.emplace_back(entry.name());
+        const Dictionary tokens = form.dictionary("extensions").value();
+        for (const auto& entry : tokens) names.emplace_back(entry.name());
         return names;
     };
     EXPECT_EQ(shared(Array{"Fonts", 7, "Sounds", "."}), (Names{"Fonts", "."}));
