@@ -10,20 +10,6 @@ using namespace platform;
 using namespace zembra;
 using support::logged;
 
-TEST(SandboxExtension, IssueAsksForTheRightClass) {
-    support::FakeSandbox sandbox;
-    sandbox.files["/Link.appex"] = "/Real.appex";
-    sandbox.services.insert("a");
-    // The fake's tokens tell what they are for.
-    EXPECT_EQ(*issueFileReadToken(sandbox, URL::file("/Link.appex/")), "file:com.nordane.app-sandbox.read:/Real.appex");
-    EXPECT_EQ(*issueServiceLookupToken(sandbox, "a"), "service:com.nordane.zembra.plugin-service:a");
-    EXPECT_TRUE(logged(LogLevel::debug, "issued file extension for /Link.appex -> <token>", "sandbox"));
-    EXPECT_TRUE(logged(LogLevel::debug, "issued mach extension for a -> <token>", "sandbox"));
-    EXPECT_FALSE(issueFileReadToken(sandbox, URL::file("/Link.appex"), "/Link.appex"));
-    sandbox.issueError = ENOENT;
-    EXPECT_EQ(issueServiceLookupToken(sandbox, "a").error().code, ENOENT);
-}
-
 TEST(SandboxExtension, ConsumesAndExpelsOnce) {
     support::FakeSandbox sandbox;
     sandbox.services.insert("a");

@@ -49,18 +49,4 @@ TEST_F(BundlesOnDisk, EachModeFindsWhatIsThereAsInMemory) {
     }
 }
 
-TEST_F(BundlesOnDisk, ExecutablesLieInsideTheBundle) {
-    support::writeFile(scratch / "outside", "program");
-    std::filesystem::create_directories(app + "/directory");
-    std::filesystem::create_symlink(scratch / "outside", app + "/link");
-    for (const Value& name : {Value("/bin/sh"), Value("../outside"), Value("link"), Value("missing"), Value("."),
-                              Value(""), Value("directory"), Value(7)}) {
-        support::writeManifest(app, Dictionary{{"VBBundleExecutable", name}});
-        const auto bundle = bundles.fromPath(app, BundleMode::directory);
-        EXPECT_TRUE(bundle->infoDictionary());
-        EXPECT_FALSE(bundle->property(executablePath)) << name.description();
-        EXPECT_FALSE(bundles.fromPath(app + "/link", BundleMode::executable)->property(path));
-    }
-}
-
 } // namespace

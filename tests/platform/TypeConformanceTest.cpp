@@ -55,23 +55,4 @@ TEST_F(TypesOnDisk, FollowEverySupertypeUpwardsOnlyAsThoseInMemoryDo) {
     }
 }
 
-TEST_F(TypesOnDisk, FilesAddUpAndDoWithoutTheRefused) {
-    const std::string folder = "etc/nordane/types.d";
-    write(common, {{"png", Array{"image"}}});
-    write(folder + "/1.vlist", {{"png", Array{"texture"}}}, {{"image/png", "png"}});
-    support::writeFile(scratch / folder + "/2.vlist", "<vlist>");
-    write(folder + "/3.vlist", {{"unsafe", Array{"other"}}});
-    write(folder + "/4.vlist", {{"last", Array{"other"}}, {"wrong", 1}});
-    chmod((scratch / folder + "/3.vlist").c_str(), 0666);
-    auto conformance = load();
-    for (const char* type : {"png", "image/png"})
-        for (const char* super : {"png", "image/png", "image", "texture"})
-            EXPECT_TRUE(conformance.conforms(type, super)) << type << " to " << super;
-    EXPECT_TRUE(conformance.conforms("last", "other"));
-    EXPECT_FALSE(conformance.conforms("unsafe", "other"));
-    EXPECT_EQ(processLog.lines().size(), 3U) << "two files, and the type whose supertypes are no array";
-    chmod((scratch / folder).c_str(), 0777);
-    EXPECT_FALSE(load().conforms("last", "other"));
-}
-
 } // namespace

@@ -122,27 +122,4 @@ TEST_F(LinuxWorkQueues, LentThreadsServeIdleQueuesButAreNotCaptured) {
     ended.expect();
 }
 
-TEST_F(LinuxWorkQueues, ManyThreadsNeverOverlapAndEachKeepsItsOrder) {
-    constexpr std::size_t rounds = 3000;
-    std::size_t total = 0; // no lock: the queue is one
-    std::array<std::size_t, 4> runs{};
-    {
-        std::vector<std::jthread> threads;
-        for (std::size_t& run : runs) {
-            threads.emplace_back([&] {
-                for (std::size_t i = 0; i < rounds; ++i) {
-                    const auto item = [&, i] {
-                        ++total;
-                        EXPECT_EQ(run++, i);
-                    };
-                    if (i % 3 == 0) queue->sync(item);
-                    if (i % 3 == 1) queue->async(item);
-                    if (i % 3 == 2) queue->asyncOnCaller(item, brief);
-                }
-            });
-        }
-    }
-    queue->sync([&] { EXPECT_EQ(total, runs.size() * rounds); });
-}
-
 } // namespace
