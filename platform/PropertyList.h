@@ -7,7 +7,6 @@
 #include <concepts>
 #include <cstddef>
 #include <cstdint>
-#include <functional>
 #include <initializer_list>
 #include <iterator>
 #include <memory>
@@ -36,6 +35,7 @@ namespace detail {
 /// Reference-counted storage; what follows the count is known to PropertyList.cpp alone.
 struct Node {
     std::atomic<std::uint32_t> references{1};
+    bool isDeferred = false; // data that is still a value
 
     void addReference() noexcept { references.fetch_add(1, std::memory_order_relaxed); }
     /// True when that was the last one.
@@ -72,8 +72,6 @@ public:
     Value(const Array& value);                                          // NOLINT(google-explicit-constructor)
     Value(const Dictionary& value);                                     // NOLINT(google-explicit-constructor)
     static Value data(std::string_view bytes);
-    /// Data of `size` bytes, all of which `fill` writes.
-    static Value makeData(std::size_t size, const std::function<void(char* bytes)>& fill);
 
     // Inline: forms and replies are copies and ends of values for the most part.
     Value(const Value& other) noexcept
@@ -122,6 +120,8 @@ public:
 
     /// A boolean, an integer or a real: the kinds that compare by number.
     bool isNumber() const noexcept;
+    /// Whether this is a string that `text` begins with, byte for byte. Looks at the storage of few that are not.
+    bool isBeginningOf(std::string_view text) const noexcept;
     /// The number as an integer, as a property list's number object reads: booleans give 0 or 1, reals are truncated
     /// toward zero and clamped, integers beyond the signed range wrap. None when this is no number.
     std::optional<std::int64_t> integerValue() const noexcept;
@@ -240,6 +240,10 @@ public:
 
     /// True when both handles share one storage.
     bool sharesStorageWith(const Dictionary& other) const noexcept;
+    /// The same for a value, which need not be a dictionary. No storage is looked at.
+    bool isStorageOf(const Value& value) const noexcept {
+        return value._kind == Kind::dictionary && value._bits == _storage._bits;
+    }
 
     /// A new dictionary with the same entries that keeps its compact encoding, for one that is encoded again and again.
     /// Neither it nor anything in it may change from now on.
@@ -332,7 +336,8 @@ inline constexpr std::string_view compactMagic = "vlist16\n";
 void appendCompact(std::string& out, const Value& value);
 /// How many bytes that is.
 std::size_t compactSize(const Value& value);
-/// The same encoding as data, which is made without a buffer.
+/// The same encoding as data. It is made when somebody looks at it, and in a message where the message is written: a
+/// long answer is copied once. So nothing in `value` may change from now on.
 Value compactData(const Value& value);
 /// Decodes exactly one value that fills `bytes`. Strict: UTF-8 checked, no NUL in strings and keys, no duplicate
 /// keys, every size checked against what is left before anything is allocated, containers nested in one another at most

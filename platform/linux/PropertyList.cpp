@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <memory>
+#include <mutex>
 #include <new>
 
 namespace platform {
@@ -74,12 +75,9 @@ struct BytesNode : Node {
 
     const std::size_t length;
 
-    static BytesNode* make(std::size_t size) {
-        void* storage = ::operator new(sizeof(BytesNode) + size);
-        return new (storage) BytesNode(size);
-    }
     static BytesNode* make(std::string_view bytes) {
-        BytesNode* node = make(bytes.size());
+        void* storage = ::operator new(sizeof(BytesNode) + bytes.size());
+        auto* node = new (storage) BytesNode(bytes.size());
         if (!bytes.empty()) std::memcpy(node->space(), bytes.data(), bytes.size());
         return node;
     }
@@ -88,6 +86,24 @@ struct BytesNode : Node {
         node->~BytesNode();
         ::operator delete(node);
     }
+    struct Destroy {
+        void operator()(BytesNode* node) const noexcept { destroy(node); }
+    };
+};
+
+/// Data that is the encoding of a value.
+struct DeferredNode : Node {
+    explicit DeferredNode(Value value) noexcept : content(std::move(value)) { isDeferred = true; }
+    std::string_view bytes() {
+        std::call_once(isMade, [this] { appendCompact(encoding, content); });
+        return encoding;
+    }
+
+    const Value content;
+
+private:
+    std::once_flag isMade;
+    std::string encoding; // once somebody looked
 };
 
 struct UUIDNode : Node {
@@ -111,7 +127,8 @@ struct DictionaryNode : ContainerNode {
     DictionaryNode() noexcept : ContainerNode(Kind::dictionary) {}
 
     std::vector<Dictionary::Entry> entries;
-    std::unique_ptr<const std::string> encoding; // of the entries, for a dictionary that does not change any more
+    /// Of the entries, for a dictionary that does not change any more.
+    std::unique_ptr<BytesNode, BytesNode::Destroy> encoding;
     DictionaryNode* base = nullptr;   // shared, and keeps its encoding; its entries come before the node's own
     std::vector<std::uint32_t> index; // positions in `entries` by `before`; empty up to `indexThreshold` keys
 
@@ -181,6 +198,11 @@ struct Contents {
     static bool isSame(const Value& left, const Value& right) noexcept {
         return left._kind == right._kind && left._bits == right._bits && left._unsigned == right._unsigned;
     }
+    static DeferredNode* deferred(const Value& value) noexcept {
+        const bool isDeferred = value._kind == Kind::data && node(value)->isDeferred;
+        return isDeferred ? static_cast<DeferredNode*>(node(value)) : nullptr;
+    }
+    static Value newDeferred(const Value& content) { return {Kind::data, new DeferredNode(content)}; }
     static Value newArray() { return {Kind::array, new ArrayNode}; }
     static Value newDictionary() { return {Kind::dictionary, new DictionaryNode}; }
     static Value valueOf(DictionaryNode* node) noexcept { return {Kind::dictionary, node}; }
@@ -268,6 +290,8 @@ namespace {
 void destroyLeaf(Kind kind, Node* node) noexcept {
     if (kind == Kind::uuid)
         delete static_cast<UUIDNode*>(node);
+    else if (node->isDeferred)
+        delete static_cast<DeferredNode*>(node);
     else
         BytesNode::destroy(static_cast<BytesNode*>(node));
 }
@@ -357,8 +381,8 @@ bool outsidesEqual(const Value& left, const Value& right) noexcept {
     if (left.kind() != right.kind()) return false;
     switch (left.kind()) {
     case Kind::date: return left.date()->seconds == right.date()->seconds;
-    case Kind::string:
-    case Kind::data: return Contents::bytes(left).view() == Contents::bytes(right).view();
+    case Kind::string: return Contents::bytes(left).view() == Contents::bytes(right).view();
+    case Kind::data: return left.data() == right.data();
     case Kind::uuid: return left.uuid() == right.uuid();
     case Kind::array: return Contents::array(left).values.size() == Contents::array(right).values.size();
     case Kind::dictionary: return Contents::dictionary(left).size() == Contents::dictionary(right).size();
@@ -394,13 +418,6 @@ Value::Value(std::string_view value)
 }
 
 Value Value::data(std::string_view bytes) { return Value(Kind::data, detail::BytesNode::make(bytes)); }
-
-Value Value::makeData(std::size_t size, const std::function<void(char* bytes)>& fill) {
-    auto* node = detail::BytesNode::make(size);
-    Value data(Kind::data, node);
-    fill(node->space());
-    return data;
-}
 
 Value::Value(const UUID& value) : Value(Kind::uuid, new detail::UUIDNode(value)) {}
 
@@ -440,6 +457,7 @@ std::optional<std::string_view> Value::string() const noexcept {
 
 std::optional<std::string_view> Value::data() const noexcept {
     if (_kind != Kind::data) return std::nullopt;
+    if (auto* const deferred = Contents::deferred(*this)) return deferred->bytes();
     return Contents::bytes(*this).view();
 }
 
@@ -465,6 +483,16 @@ std::optional<Dictionary> Value::dictionary() && noexcept {
 
 bool Value::isNumber() const noexcept {
     return _kind == Kind::boolean || _kind == Kind::integer || _kind == Kind::real;
+}
+
+bool Value::isBeginningOf(std::string_view text) const noexcept {
+    if (_kind != Kind::string) return false;
+    // The lowest byte of a digest is that of the length.
+    for (std::size_t length = _digest & 0xFFU; length <= text.size(); length += 0x100) {
+        const auto beginning = text.substr(0, length);
+        if (detail::digestOf(beginning) == _digest && Contents::bytes(*this).view() == beginning) return true;
+    }
+    return false;
 }
 
 std::optional<std::int64_t> Value::integerValue() const noexcept {
@@ -770,20 +798,29 @@ Dictionary Dictionary::keepingEncoding() const {
     auto& node = Contents::dictionary(copy._storage);
     node.takeOverBase();
     node.entries.shrink_to_fit();
-    auto encoding = std::make_unique<std::string>();
-    for (const auto& entry : node.entries) linux_::appendEntry(*encoding, entry);
-    encoding->shrink_to_fit();
-    node.encoding = std::move(encoding);
+    std::string encoding;
+    for (const auto& entry : node.entries) linux_::appendEntry(encoding, entry);
+    node.encoding.reset(detail::BytesNode::make(encoding));
     return copy;
+}
+
+Value compactData(const Value& value) {
+    require(static_cast<bool>(value), "an absent value has no encoding");
+    return Contents::newDeferred(value);
 }
 
 namespace linux_ {
 
 EncodingParts encodingParts(const Value& dictionary) noexcept {
     const auto& node = Contents::dictionary(dictionary);
-    if (node.encoding) return {*node.encoding, node.entries.size(), {}};
+    if (node.encoding) return {node.encoding->view(), node.entries.size(), {}};
     if (node.base == nullptr) return {{}, 0, node.entries};
-    return {*node.base->encoding, node.base->entries.size(), node.entries};
+    return {node.base->encoding->view(), node.base->entries.size(), node.entries};
+}
+
+const Value* deferredContent(const Value& data) noexcept {
+    const auto* const deferred = Contents::deferred(data);
+    return deferred != nullptr ? &deferred->content : nullptr;
 }
 
 std::span<const Value> itemsOf(const Value& array) noexcept { return Contents::array(array).values; }

@@ -34,6 +34,8 @@ struct EncodingParts {
 
 // Look into a value of that kind, which must stay as it is meanwhile, without a share in it.
 EncodingParts encodingParts(const Value& dictionary) noexcept;
+/// What the data is the encoding of; null for other data.
+const Value* deferredContent(const Value& data) noexcept;
 std::span<const Value> itemsOf(const Value& array) noexcept;
 
 /// Appends an entry of a dictionary as it stands in the dictionary's compact encoding.

@@ -59,23 +59,6 @@ private:
     std::string& _out;
 };
 
-/// Memory that is as large as the encoding.
-class MemorySink {
-public:
-    explicit MemorySink(char* start) : _start(start), _at(start) {}
-    std::size_t position() const { return static_cast<std::size_t>(_at - _start); }
-    void put(const void* bytes, std::size_t size) {
-        if (size == 0) return;
-        std::memcpy(_at, bytes, size);
-        _at += size;
-    }
-    void patch(std::size_t position, std::uint32_t number) { std::memcpy(_start + position, &number, sizeof number); }
-
-private:
-    char* const _start;
-    char* _at;
-};
-
 class CountingSink {
 public:
     std::size_t position() const { return _size; }
@@ -103,7 +86,20 @@ public:
         case Kind::real: putNumber(realTag, std::bit_cast<std::uint64_t>(*value.real())); break;
         case Kind::date: putNumber(dateTag, std::bit_cast<std::uint64_t>(value.date()->seconds)); break;
         case Kind::string: putBytes(stringTag, *value.string()); break;
-        case Kind::data: putBytes(dataTag, *value.data()); break;
+        case Kind::data: {
+            const Value* const content = linux_::deferredContent(value);
+            if (content == nullptr) {
+                putBytes(dataTag, *value.data());
+                break;
+            }
+            const std::uint32_t size = 0;
+            putTag(dataTag);
+            _sink.put(&size, sizeof size);
+            const std::size_t start = _sink.position();
+            append(*content, depth + 1);
+            _sink.patch(start - sizeof size, sizeField(_sink.position() - start));
+            break;
+        }
         case Kind::uuid: {
             putTag(uuidTag);
             const UUID uuid = *value.uuid();
@@ -380,13 +376,6 @@ std::size_t compactSize(const Value& value) {
     CountingSink sink;
     Writer(sink).append(value);
     return sink.position();
-}
-
-Value compactData(const Value& value) {
-    return Value::makeData(compactSize(value), [&](char* bytes) {
-        MemorySink sink(bytes);
-        Writer(sink).append(value);
-    });
 }
 
 Result<Value> decodeCompact(std::string_view bytes, UUIDs uuids, std::size_t nesting) {
