@@ -157,10 +157,9 @@ Value ZBPlugInCore::containingPath() const {
 }
 
 bool ZBPlugInCore::beginsWithContainingPath(std::string_view path) const {
-    const Location location = _containingUrl.get();
-    if (location.text) return path.starts_with(pathOf(location));
-    const auto containing = location.path.string();
-    return containing && path.starts_with(*containing);
+    return _containingUrl.read([&](const Location& location) {
+        return location.text ? path.starts_with(pathOf(location)) : location.path.isBeginningOf(path);
+    });
 }
 
 std::optional<Dictionary> ZBPlugInCore::attributes() const { return pluginKey(manifest::attributes).dictionary(); }

@@ -130,6 +130,9 @@ public:
     /// Without a trailing separator; empty for a record without `url`.
     std::string path() const;
     platform::Value containingPath() const;
+    bool isContained() const {
+        return _containingUrl.read([](const Location& location) { return static_cast<bool>(location.path); });
+    }
     /// Whether `path` begins with the path of the application around the plug-in, byte for byte. False without one.
     bool beginsWithContainingPath(std::string_view path) const;
     std::optional<platform::Dictionary> attributes() const;

@@ -199,19 +199,22 @@ void measureSelection(const Settings& settings, const std::string& directory) {
 }
 
 void measureReduction(const Settings& settings) {
+    using namespace std::string_literals;
     using Facts = zbd::SameIdentifierReduction::Facts;
     struct Shape {
         const char* name;
         std::uint64_t flags;
-        Facts (*candidate)(std::size_t number);
+        std::pair<std::string, std::string> (*candidate)(std::size_t number); // identifier and version
     };
     const std::array shapes{
-        Shape{"an identifier each", 0, [](std::size_t i) { return Facts{plugInIdentifier(std::to_string(i)), "1.0"}; }},
-        Shape{
-            "two versions of each identifier", 0,
-            [](std::size_t i) { return Facts{plugInIdentifier(std::to_string(i / 2)), "1." + std::to_string(i % 2)}; }},
+        Shape{"an identifier each", 0,
+              [](std::size_t i) { return std::pair(plugInIdentifier(std::to_string(i)), "1.0"s); }},
+        Shape{"two versions of each identifier", 0,
+              [](std::size_t i) {
+                  return std::pair(plugInIdentifier(std::to_string(i / 2)), "1." + std::to_string(i % 2));
+              }},
         Shape{"all versions of one identifier", zembra::ZBDiscoverAllVersions,
-              [](std::size_t i) { return Facts{plugInIdentifier(""), "1." + std::to_string(i)}; }},
+              [](std::size_t i) { return std::pair(plugInIdentifier(""), "1." + std::to_string(i)); }},
     };
     const MutableDictionary form{{zembra::formKey::version, "1.0"}};
     printHeader("Reduction to one for each identifier, for each answer");
@@ -219,11 +222,11 @@ void measureReduction(const Settings& settings) {
         std::vector<Proportion> each(sizes.size());
         for (int round = 0; round < settings.rounds; ++round) {
             for (std::size_t i = 0; i < sizes.size(); ++i) {
-                std::vector<Facts> candidates;
+                std::vector<std::pair<std::string, std::string>> candidates;
                 std::vector<std::string> names;
                 for (std::size_t number = 0; number < sizes[i]; ++number) {
                     candidates.push_back(shape.candidate(number));
-                    names.push_back(candidates.back().identifier + *candidates.back().version);
+                    names.push_back(candidates.back().first + candidates.back().second);
                 }
                 const double nanoseconds = 1e3 / static_cast<double>(sizes[i]);
                 each[i].reference.add(nanoseconds * meanMicroseconds(settings.seconds, [&] {
@@ -232,7 +235,8 @@ void measureReduction(const Settings& settings) {
                                       }));
                 each[i].measured.add(nanoseconds * meanMicroseconds(settings.seconds, [&] {
                                          zbd::SameIdentifierReduction reduction(shape.flags);
-                                         for (const auto& candidate : candidates) {
+                                         for (const auto& [identifier, version] : candidates) {
+                                             const Facts candidate{std::string_view(identifier), version};
                                              if (reduction.admit(candidate)) reduction.add(candidate, form);
                                          }
                                          if (reduction.takeForms().empty()) fail("nothing is left");

@@ -39,6 +39,8 @@ struct PlugInProxy {
     std::string description() const;
 };
 using PlugInProxyRef = std::shared_ptr<const PlugInProxy>;
+/// An answer of the registry, shared with whoever else asked the same meanwhile; null when the registry cannot answer.
+using PlugInProxies = std::shared_ptr<const std::vector<PlugInProxyRef>>;
 
 /// One application as the registry describes it.
 struct ApplicationRecord {
@@ -69,13 +71,12 @@ public:
     /// Held weakly. Notices begin with changes after this call; plug-ins already known are not reported.
     virtual void addObserver(std::weak_ptr<RegistryObserver> observer) = 0;
 
-    /// None when the registry cannot answer. Ordered by UUID.
-    virtual std::optional<std::vector<PlugInProxyRef>> installedPlugIns() = 0;
+    /// Ordered by UUID.
+    virtual PlugInProxies installedPlugIns() = 0;
 
     /// A subset of the installed plug-ins that holds every one that matches `query` in the match-pattern language and
-    /// passes `filter`, which is called before this returns.
-    virtual std::optional<std::vector<PlugInProxyRef>> plugInsMatching(const Dictionary& query,
-                                                                       const Filter& filter) = 0;
+    /// passes `filter`, which is called before this returns; all pass an empty one.
+    virtual PlugInProxies plugInsMatching(const Dictionary& query, const Filter& filter) = 0;
 
     virtual PlugInProxyRef plugInForUUID(const UUID& uuid) = 0;
     /// File URLs only. Locations are compared as they are: whoever asks for somebody else resolves symbolic links

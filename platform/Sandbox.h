@@ -2,6 +2,7 @@
 
 #include "platform/Error.h"
 
+#include <chrono>
 #include <cstdint>
 #include <string>
 
@@ -22,6 +23,9 @@ public:
     /// resolved path, or the service refuses (EPERM). The error carries errno.
     virtual Result<std::string> issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
                                           const std::string& within) = 0;
+
+    /// For how long after a token was issued the same question would get the same answer, or one that is as good.
+    virtual std::chrono::milliseconds repeatInterval() const { return std::chrono::milliseconds(0); }
 
     /// A token for looking up the named service. The error carries errno.
     virtual Result<std::string> issueService(const std::string& extensionClass, const std::string& name) = 0;

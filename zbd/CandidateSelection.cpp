@@ -16,7 +16,8 @@ namespace {
 using Outcome = std::optional<Rejection>;
 
 Outcome mustHaveContainer(const Selection&, const Candidate& candidate) {
-    if (candidate.plugIn->onSystemVolume() || candidate.plugIn->containingPath()) return std::nullopt;
+    if (candidate.kept && candidate.kept->isContained) return std::nullopt;
+    if (candidate.plugIn->onSystemVolume() || candidate.plugIn->isContained()) return std::nullopt;
     return Rejection{"neither on the system volume nor in an application"};
 }
 

@@ -29,7 +29,7 @@ struct Selection {
 /// One plug-in under test, and what it keeps, if anything.
 struct Candidate {
     const ZBDPlugInRef& plugIn;
-    const ZBDPlugIn::KeptFormRef& kept;
+    const KeptFormRef& kept;
 };
 
 /// Why a candidate is dropped.

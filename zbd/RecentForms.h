@@ -9,8 +9,10 @@
 
 namespace zbd {
 
-/// Keeps alive what the forms last asked for again and again are made of; the records themselves hold it weakly. So
-/// memory is spent on the plug-ins in use, not on each that is installed. Any thread.
+class ZBDPlugIn;
+
+/// Bounds how many records keep a form: those whose forms were last asked for again and again. So memory is spent on
+/// the plug-ins in use, not on each that is installed. Any thread.
 class RecentForms {
 public:
     /// What a form is made of takes about four kilobytes: this many take no more than a small daemon does, and no user
@@ -25,21 +27,13 @@ public:
         return {_made, previous != 0 && _made - previous <= capacity};
     }
 
-    /// Lets go of what was kept first when there is no room.
-    void keep(std::shared_ptr<const void> kept) {
-        const std::lock_guard lock(_mutex);
-        if (_kept.size() < capacity) {
-            _kept.push_back(std::move(kept));
-            return;
-        }
-        _kept[_oldest] = std::move(kept);
-        _oldest = (_oldest + 1) % capacity;
-    }
+    /// Has the record that was first forget its form when there is no room for this one.
+    void keep(std::weak_ptr<const ZBDPlugIn> plugIn);
 
 private:
     std::mutex _mutex;
     std::uint64_t _made = 0;
-    std::vector<std::shared_ptr<const void>> _kept; // a ring
+    std::vector<std::weak_ptr<const ZBDPlugIn>> _keeping; // a ring
     std::size_t _oldest = 0;
 };
 

@@ -62,13 +62,13 @@ void SameIdentifierReduction::put(Several& several, std::size_t index) const {
     several.slotsByVersion.emplace(comparableVersion(_slots[index].version), index);
 }
 
-void SameIdentifierReduction::add(Facts facts, platform::MutableDictionary form) {
+void SameIdentifierReduction::add(const Facts& facts, AnswerForm form) {
     const std::size_t index = _slots.size();
-    const std::size_t encodedSize = platform::compactSize(form);
+    const std::size_t encodedSize = platform::compactSize(form.form());
     _encodedSize += encodedSize;
-    std::string version = facts.version ? *std::move(facts.version) : std::string(noVersion);
-    _slots.push_back({std::move(form), std::move(version), facts.onSystemVolume, facts.lastModified, encodedSize});
-    Group& group = _groups[std::move(facts.identifier)];
+    _slots.push_back(
+        {std::move(form), facts.version.value_or(noVersion), facts.onSystemVolume, facts.lastModified, encodedSize});
+    Group& group = _groups[facts.identifier];
     if (!group.several && !group.only) {
         group.only = index;
         return;
@@ -80,8 +80,8 @@ void SameIdentifierReduction::add(Facts facts, platform::MutableDictionary form)
     put(*group.several, index);
 }
 
-std::vector<platform::MutableDictionary> SameIdentifierReduction::takeForms() {
-    std::vector<platform::MutableDictionary> forms;
+std::vector<AnswerForm> SameIdentifierReduction::takeForms() {
+    std::vector<AnswerForm> forms;
     forms.reserve(_slots.size());
     for (Slot& slot : _slots) {
         if (slot.present) forms.push_back(std::move(slot.form));

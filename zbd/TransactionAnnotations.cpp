@@ -34,6 +34,19 @@ void Transaction::addAnnotationForPlugIn(const ZBDPlugIn& plugIn, MutableDiction
     form.set(zembra::formKey::annotations, server()->annotationForPlugIn(plugIn).value_or(Dictionary()));
 }
 
+bool Transaction::isComplete(const ZBDPlugIn& plugIn, const KeptForm& kept,
+                             std::chrono::steady_clock::time_point now) const {
+    return plugIn.isComplete(kept, {server()->annotationsVersion(), now});
+}
+
+void Transaction::completeForm(const ZBDPlugIn& plugIn, MutableDictionary& form, const KeptFormRef& kept,
+                               std::chrono::steady_clock::time_point now) {
+    if (kept && isComplete(plugIn, *kept, now)) return;
+    const FormCompletion completion{server()->annotationsVersion(), now};
+    addAnnotationForPlugIn(plugIn, form);
+    plugIn.augmentForm(form, kept, completion);
+}
+
 void Transaction::annotatePlugIns() {
     const auto requested = _request.dictionary(key::annotations);
     if (!requested) return fail(code::malformed, "invalid request format (bad annotations dictionary)");

@@ -50,39 +50,48 @@ void logCandidates(const Candidates& candidates) {
     }
 }
 
-void logResults(const std::vector<MutableDictionary>& forms) {
+void logResults(const std::vector<AnswerForm>& forms) {
     if (forms.empty()) {
         log::ops().info("Resulting plugin count: 0");
     } else {
-        const auto uuid = [](const MutableDictionary& form) { return form[formKey::uuid]; };
+        const auto uuid = [](const AnswerForm& answer) { return answer.form()[formKey::uuid]; };
         log::ops().info("Resulting plugin count: %u, UUIDs: %{public}@", forms.size(),
                         std::views::transform(forms, uuid));
     }
 }
 
 /// A host that carries a plug-in itself does not see other copies of it.
-void preferBundleRelative(Candidates& candidates, std::string_view hostPath) {
+ZBDPlugIns preferBundleRelative(const ZBDPlugIns& candidates, std::string_view hostPath) {
     std::unordered_map<std::string, ZBDPlugInRef> preferred;
-    for (const auto& candidate : candidates) {
+    for (const auto& candidate : *candidates) {
         if (!candidate->beginsWithContainingPath(hostPath)) continue;
         preferred[std::string(textOf(candidate->identifier()))] = candidate;
     }
-    if (preferred.empty()) return;
-    std::erase_if(candidates, [&](const ZBDPlugInRef& candidate) {
+    if (preferred.empty()) return candidates;
+    Candidates left;
+    for (const auto& candidate : *candidates) {
         const auto found = preferred.find(std::string(textOf(candidate->identifier())));
-        if (found == preferred.end() || found->second == candidate) return false;
+        if (found == preferred.end() || found->second == candidate) {
+            left.push_back(candidate);
+            continue;
+        }
         log::ops().info("Ignoring %{public}@ @ '%{public}@' in favor of bundle-relative '%{public}@'",
                         found->second->uuid(), candidate->path(), found->second->path());
-        return true;
-    });
+    }
+    return std::make_shared<const Candidates>(std::move(left));
 }
 
 /// The version as the form states it.
-std::optional<std::string> versionOf(const ZBDPlugIn& plugIn, const MutableDictionary& form) {
+std::optional<std::string_view> versionOf(const ZBDPlugIn& plugIn, const MutableDictionary& form) {
     const auto stated = form.string(formKey::version);
     // A manifest may say what forms say where it says nothing.
     if (stated == SameIdentifierReduction::noVersion && plugIn.version().string() != stated) return std::nullopt;
-    return stated ? std::optional<std::string>(*stated) : std::nullopt;
+    return stated;
+}
+
+ReductionFacts factsOf(const ZBDPlugIn& plugIn, const MutableDictionary& form) {
+    // A record never changes its identifier.
+    return {textOf(plugIn.identifier()), versionOf(plugIn, form), plugIn.onSystemVolume(), plugIn.lastModified()};
 }
 
 void noteOverrides(const ZBDPlugIn& plugIn, const MutableDictionary& form, Overrides& overrides) {
@@ -98,11 +107,12 @@ void noteOverrides(const ZBDPlugIn& plugIn, const MutableDictionary& form, Overr
     }
 }
 
-void markOverrides(std::vector<MutableDictionary>& forms, Overrides& overrides) {
+void markOverrides(std::vector<AnswerForm>& forms, Overrides& overrides) {
     if (overrides.empty()) return;
-    for (auto& form : forms) {
-        const auto found = overrides.find(std::string(textOf(form[formKey::identifier])));
+    for (auto& replaced : forms) {
+        const auto found = overrides.find(std::string(textOf(replaced.form()[formKey::identifier])));
         if (found == overrides.end()) continue;
+        MutableDictionary& form = replaced.ownForm();
         MutableDictionary& replacing = found->second;
         form.set(formKey::overrider, replacing[formKey::uuid]);
         replacing.set(formKey::overriding, form[formKey::identifier]);
@@ -134,42 +144,43 @@ void Transaction::matchPlugIns() {
         .isRestricted = static_cast<bool>(_client->entitlementValueForKey(zembra::entitlement::allowedPlugIns)),
         .hasHolds = server()->hasHolds(),
     };
-    Candidates candidates = server()->findPlugIns(rules).value_or(Candidates());
-    platform::trace::discoverRaw(static_cast<unsigned>(candidates.size()));
-    logCandidates(candidates);
-    preferBundleRelativeForHost(candidates);
+    ZBDPlugIns candidates = server()->findPlugIns(rules);
+    if (!candidates) candidates = std::make_shared<const Candidates>();
+    platform::trace::discoverRaw(static_cast<unsigned>(candidates->size()));
+    logCandidates(*candidates);
+    candidates = preferBundleRelativeForHost(candidates);
 
     // An older protocol has no forms in its reply, so none are too many.
     const auto fits = [&](std::size_t size) {
         return size <= maximumMatchesSize || _version != static_cast<std::uint64_t>(zembra::currentVersion);
     };
+    const auto now = std::chrono::steady_clock::now();
     SameIdentifierReduction results(flags);
     Overrides overrides;
-    for (const auto& candidate : candidates) {
+    for (const auto& candidate : *candidates) {
         const auto kept = candidate->keptForm();
         if (rejectionOf(selection, {candidate, kept})) continue;
-        platform::Failure error;
-        MutableDictionary form = candidate->currentForm(&error, kept);
-        if (error) {
-            log::ops().error("failed to export matching plug-in %{public}@: %{public}@", candidate->uuid(), *error);
+        if (kept && !kept->replacesOthers && isComplete(*candidate, *kept, now)) {
+            if (!results.admit(kept->facts)) continue;
+            results.add(kept->facts, AnswerForm::shared(kept->form));
+        } else {
+            platform::Failure error;
+            MutableDictionary form = candidate->currentForm(&error, kept);
+            if (error) {
+                log::ops().error("failed to export matching plug-in %{public}@: %{public}@", candidate->uuid(), *error);
+            }
+            const auto facts = factsOf(*candidate, form);
+            if (!results.admit(facts)) continue;
+            completeForm(*candidate, form, kept, now);
+            noteOverrides(*candidate, form, overrides);
+            results.add(facts, std::move(form));
         }
-        SameIdentifierReduction::Facts facts{
-            .identifier = std::string(textOf(candidate->identifier())),
-            .version = versionOf(*candidate, form),
-            .onSystemVolume = candidate->onSystemVolume(),
-            .lastModified = candidate->lastModified(),
-        };
-        if (!results.admit(facts)) continue;
-        addAnnotationForPlugIn(*candidate, form);
-        candidate->augmentForm(form, kept);
-        noteOverrides(*candidate, form, overrides);
-        results.add(std::move(facts), std::move(form));
         if (!fits(results.encodedSize())) return fail(code::malformed, tooLong);
     }
     auto forms = results.takeForms();
     markOverrides(forms, overrides);
     logResults(forms);
-    const Value answer = Array::of(forms);
+    const Value answer = Array::of(std::views::transform(forms, &AnswerForm::form));
     if (!overrides.empty() && !fits(platform::compactSize(answer))) return fail(code::malformed, tooLong);
     if (const auto matches = zembra::ZBDaemonClient::convertToQMX(answer, _version)) {
         reply().set(key::matches, *matches);
@@ -178,15 +189,13 @@ void Transaction::matchPlugIns() {
     done();
 }
 
-void Transaction::preferBundleRelativeForHost(std::vector<ZBDPlugInRef>& candidates) {
+ZBDPlugIns Transaction::preferBundleRelativeForHost(const ZBDPlugIns& candidates) {
     const auto peer = connection();
-    if (!peer) return;
+    if (!peer) return candidates;
     const auto hostPath = server()->platform().processes.executablePath(peer->peerAuditToken(), pathBufferSize);
-    if (!hostPath) {
-        log::ops().error("Failed to determine path for pid %d, %{errno}d", peer->peerPid(), hostPath.error().code);
-        return;
-    }
-    preferBundleRelative(candidates, *hostPath);
+    if (hostPath) return preferBundleRelative(candidates, *hostPath);
+    log::ops().error("Failed to determine path for pid %d, %{errno}d", peer->peerPid(), hostPath.error().code);
+    return candidates;
 }
 
 } // namespace zbd

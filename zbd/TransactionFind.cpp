@@ -34,8 +34,7 @@ void Transaction::findPlugIn() {
     if (error) {
         log::ops().error("failed to export matching plug-in %{public}@: %{public}@", plugIn->uuid(), *error);
     }
-    addAnnotationForPlugIn(*plugIn, form);
-    plugIn->augmentForm(form, kept);
+    completeForm(*plugIn, form, kept, std::chrono::steady_clock::now());
     if (const auto matches = zembra::ZBDaemonClient::convertToQMX(form, _version)) reply().set(key::matches, *matches);
     done();
 }

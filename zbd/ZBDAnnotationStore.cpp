@@ -76,10 +76,12 @@ void ZBDAnnotationStore::setAnnotations(std::span<const AnnotationChange> change
             log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, *failure);
         }
     }
+    ++_version;
     const auto bytes = encodedDatabase(_annotations);
     if (!bytes) {
         // Each was tried alone, so they are too large together; or the file had in it what no file of ours can hold.
         if (bytes.error().code == platform::fileWriteOutOfSpaceCode) _annotations = before;
+        ++_version;
         log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, bytes.error());
         return;
     }
@@ -119,6 +121,7 @@ bool ZBDAnnotationStore::loadDb(const URL& url, Error& error) {
                 platform::format("found database version %d needed version %d", version, databaseVersion));
         }
         _annotations = MutableDictionary::copyOf(database.dictionary(dataKey).value_or(Dictionary()));
+        ++_version;
         return std::nullopt;
     };
     auto failure = load();

@@ -54,6 +54,9 @@ public:
     /// with the suffix ".damaged"; while it cannot be, nothing is saved.
     bool saveDb(platform::Error& error);
 
+    /// Another one after each change. Any thread.
+    std::uint64_t version() const { return _version.load(std::memory_order_relaxed); }
+
     const platform::URL& annotationsURL() const { return _annotationsURL; }
     const platform::MutableDictionary& annotations() const { return _annotations; }
 
@@ -69,7 +72,8 @@ private:
     platform::Platform& _platform;
     platform::URL _annotationsURL;
     platform::MutableDictionary _annotations; // annotation key to annotation
-    bool _isFileDamaged = false;              // as long as the file that could not be loaded is in its place
+    std::atomic<std::uint64_t> _version = 1;
+    bool _isFileDamaged = false; // as long as the file that could not be loaded is in its place
 };
 
 } // namespace zbd

@@ -92,21 +92,21 @@ PlugInProxyRef ZBDPlugIn::getProxy() const {
     return _platform.registry.plugInForURL(*url());
 }
 
-Value ZBDPlugIn::currentInfo() const {
+void ZBDPlugIn::refreshInfo() const {
     const auto knowledge = _platform.registry.knowledgeUUID();
-    if (knowledge && _cxKnowledgeUUID.read([&](const auto& known) { return known == knowledge; })) {
-        return _infoVlist.get();
+    if (knowledge && _cxKnowledgeUUID.read([&](const auto& known) { return known == knowledge; })) return;
+    const std::lock_guard lock(_refreshLock);
+    if (const auto proxy = getProxy()) {
+        _infoVlist.set(valueOrAbsent(proxy->infoDictionary));
+    } else {
+        log::ops().error("could not obtain fresh proxy for %@", uuid());
+        _infoVlist.set(Value());
     }
-    {
-        const std::lock_guard lock(_refreshLock);
-        if (const auto proxy = getProxy()) {
-            _infoVlist.set(valueOrAbsent(proxy->infoDictionary));
-        } else {
-            log::ops().error("could not obtain fresh proxy for %@", uuid());
-            _infoVlist.set(Value());
-        }
-        _cxKnowledgeUUID.set(knowledge);
-    }
+    _cxKnowledgeUUID.set(knowledge);
+}
+
+Value ZBDPlugIn::currentInfo() const {
+    refreshInfo();
     return _infoVlist.get();
 }
 
@@ -137,37 +137,45 @@ MutableDictionary ZBDPlugIn::prunedInfoDictionaryFor(const Dictionary& dictionar
 
 void ZBDPlugIn::setLocalizedName(Value value) {
     ZBPlugInCore::setLocalizedName(std::move(value));
-    _formKeeper.set({}); // it shows the old name
+    forgetForm(); // it shows the old name
 }
 
 void ZBDPlugIn::setLocalizedShortName(Value value) {
     ZBPlugInCore::setLocalizedShortName(std::move(value));
-    _formKeeper.set({});
+    forgetForm();
 }
 
 void ZBDPlugIn::setLocalizedContainingName(Value value) {
     ZBPlugInCore::setLocalizedContainingName(std::move(value));
-    _formKeeper.set({});
+    forgetForm();
 }
 
 void ZBDPlugIn::setLocalizedFilevaneActionNames(Value value) {
     ZBPlugInCore::setLocalizedFilevaneActionNames(std::move(value));
-    _formKeeper.set({});
+    forgetForm();
 }
 
 namespace {
 
-/// Whoever reads the debug lines of the export sees them for every form.
-bool mayKeepForms() { return !log::cx().isEnabled(platform::LogLevel::debug); }
+/// Whoever reads the debug lines of exports and tokens sees them for every form.
+bool mayKeepForms() {
+    return !log::cx().isEnabled(platform::LogLevel::debug) && !log::sandbox().isEnabled(platform::LogLevel::debug);
+}
 
 } // namespace
 
-ZBDPlugIn::KeptFormRef ZBDPlugIn::keptForm() const {
-    const auto keeper = _formKeeper.read([](const auto& field) { return field.lock(); });
-    if (!keeper || !mayKeepForms()) return nullptr;
-    auto kept = keeper->kept.get();
-    const auto manifest = bundleInfoDictionary();
-    return manifest && kept->manifest.sharesStorageWith(*manifest) ? kept : nullptr;
+KeptFormRef ZBDPlugIn::keptForm() const {
+    auto kept = _keptForm.get();
+    if (!kept || !mayKeepForms()) return nullptr;
+    refreshInfo();
+    const bool isCurrent = _infoVlist.read([&](const Value& manifest) { return kept->manifest.isStorageOf(manifest); });
+    return isCurrent ? std::move(kept) : nullptr;
+}
+
+bool ZBDPlugIn::isComplete(const KeptForm& kept, const FormCompletion& now) const {
+    const auto last = kept.lastCompletion.get();
+    return last.annotationsVersion == now.annotationsVersion &&
+           now.time - last.time < _platform.sandbox.repeatInterval();
 }
 
 bool ZBDPlugIn::requiresEntitlement() const { return static_cast<bool>(pluginKey(manifest::hostEntitlement)); }
@@ -188,19 +196,22 @@ MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFor
     const auto [number, isAgain] = _recentForms->countMade(_lastMade);
     _lastMade = number;
     if (!manifest || !isAgain || !mayKeepForms()) return form;
-    // Not in one block with the counters of its owners, which outlives it here.
-    std::shared_ptr<FormKeeper> keeper(new FormKeeper);
-    keeper->kept.set(std::make_shared<const KeptForm>(KeptForm{.manifest = *manifest,
-                                                               .form = form.keepingEncoding(),
-                                                               .tokens = tokenNeeds(),
-                                                               .version = version(),
-                                                               .listing = listing(nullptr),
-                                                               .isDedicated = isDedicated(),
-                                                               .requiresEntitlement = requiresEntitlement()}));
-    _formKeeper.set(keeper);
-    _recentForms->keep(std::move(keeper));
+    const Value version = this->version();
+    keepForm({.manifest = *manifest,
+              .form = form.keepingEncoding(),
+              .tokens = tokenNeeds(),
+              .version = version,
+              .facts = {*identifier().string(), version.string(), onSystemVolume(), lastModified()},
+              .listing = listing(nullptr),
+              .isContained = isContained(),
+              .isDedicated = isDedicated(),
+              .requiresEntitlement = requiresEntitlement(),
+              .replacesOthers = static_cast<bool>(valueForEntitlement(zembra::entitlement::replacePlugIn))});
+    _recentForms->keep(weak_from_this());
     return form;
 }
+
+void ZBDPlugIn::keepForm(KeptForm kept) const { _keptForm.set(std::make_shared<const KeptForm>(std::move(kept))); }
 
 Value ZBDPlugIn::valueForEntitlement(std::string_view key) const {
     const auto entitlements = this->entitlements();

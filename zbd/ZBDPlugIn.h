@@ -4,6 +4,7 @@
 #include "Zembra/ZBPlugInCore.h"
 #include "platform/Platform.h"
 #include "platform/Registry.h"
+#include "zbd/KeptForm.h"
 #include "zbd/MatchRules.h"
 #include "zbd/RecentForms.h"
 
@@ -24,7 +25,7 @@ class ZBDQmxClient;
 
 /// The daemon's record of one plug-in, built from the registry's description of it. Its facts are fixed when it is
 /// made; its manifest follows the registry. May be read from any queue.
-class ZBDPlugIn final : public zembra::ZBPlugInCore {
+class ZBDPlugIn final : public zembra::ZBPlugInCore, public std::enable_shared_from_this<ZBDPlugIn> {
 public:
     /// Null for a proxy without location or identifier, and for a mis-configured plug-in, which is logged.
     /// `recentForms` is shared by all records of a daemon.
@@ -77,31 +78,18 @@ public:
 
     platform::Failure diagnose() const override;
 
-    /// What the tokens of a form are for.
-    struct TokenNeeds {
-        platform::Value resources;                      // to read; absent when nothing is shared
-        std::optional<platform::Value> serviceOfBundle; // identifier of the bundle whose service is looked up
-    };
-    /// What does not change from answer to answer while the manifest stays the same, in one place: answers of a
-    /// thousand plug-ins have no time to look for it.
-    struct KeptForm {
-        platform::Dictionary manifest; // the one it was made from
-        platform::Dictionary form;     // with its encoding, and with the annotations and tokens of the last answer
-        TokenNeeds tokens;
-        platform::Value version;
-        std::string listing; // what lists of candidates in the log show
-        bool isDedicated = false;
-        bool requiresEntitlement = false; // of its hosts
-    };
-    using KeptFormRef = std::shared_ptr<const KeptForm>;
     /// Only for a plug-in that is asked for again and again; else null, also when what was kept is outdated.
     KeptFormRef keptForm() const;
+    /// Gives its memory back.
+    void forgetForm() const { _keptForm.set(nullptr); }
+    /// Whether a form of that kept one has the annotations and tokens that it would get now.
+    bool isComplete(const KeptForm& kept, const FormCompletion& now) const;
     /// Whether hosts need an entitlement that the manifest names.
     bool requiresEntitlement() const;
 
     /// A form of the caller's own, as `exportForm` makes it; one that extends the kept form where there is one, which
-    /// costs little. That one has the annotations and tokens of the last answer, so the caller is to set both: where
-    /// they are the same nothing changes. `kept` is what `keptForm` has just answered.
+    /// costs little. That one has the annotations and tokens of the last answer, so the caller is to set both unless
+    /// it `isComplete`: where they are the same nothing changes. `kept` is what `keptForm` has just answered.
     platform::MutableDictionary currentForm(platform::Failure* error, const KeptFormRef& kept) const;
     platform::MutableDictionary currentForm(platform::Failure* error) const { return currentForm(error, keptForm()); }
 
@@ -111,9 +99,10 @@ public:
     // ZBDPlugInTokens.cpp
 
     /// Issues the sandbox tokens that a host needs and sets them in a form made by `currentForm` or `exportForm`, whose
-    /// annotations are set. What differs from the kept form then takes its place.
-    void augmentForm(platform::MutableDictionary& form, const KeptFormRef& kept) const;
-    void augmentForm(platform::MutableDictionary& form) const { augmentForm(form, keptForm()); }
+    /// annotations are set: those of `completion`. What differs from the kept form then takes its place.
+    void augmentForm(platform::MutableDictionary& form, const KeptFormRef& kept,
+                     const FormCompletion& completion) const;
+    void augmentForm(platform::MutableDictionary& form) const { augmentForm(form, keptForm(), {}); }
     /// A file-read token for each resource inside the bundle that the sandbox service grants, under the resource as
     /// written. `resources` is a string or an array; elements of another kind are skipped.
     platform::MutableDictionary issueResourceExtensions(const platform::Value& resources) const;
@@ -150,6 +139,7 @@ private:
     ZBDPlugIn(platform::Platform& platform, std::shared_ptr<RecentForms> recentForms)
         : _platform(platform), _recentForms(std::move(recentForms)) {}
     bool setupWithProxy(const platform::PlugInProxyRef& proxy);
+    void refreshInfo() const;
     platform::Value currentInfo() const;
     platform::Value valueForRule(std::string_view key) const;
     std::string userElection() const;
@@ -160,24 +150,27 @@ private:
     std::shared_ptr<const platform::URL> _dataContainerURL; // in the proxy, which the registry keeps too
 
     mutable std::recursive_mutex _refreshLock; // one refresh at a time: fetching and storing are one step
+    // Together, for answers of a thousand plug-ins look at all three of each.
     mutable zembra::AtomicField<platform::Value> _infoVlist;
     mutable zembra::AtomicField<std::optional<platform::UUID>> _cxKnowledgeUUID;
+    mutable zembra::AtomicField<KeptFormRef> _keptForm; // `_recentForms` has it forgotten again
 
     TokenNeeds tokenNeeds() const;
     struct IssuedToken {
         platform::Value resource;
         std::string text;
     };
-    std::vector<IssuedToken> issueResourceTokens(const platform::Value& resources) const;
+    struct IssuedTokens {
+        std::vector<IssuedToken> granted;
+        bool areAll = true;
+    };
+    IssuedTokens issueResourceTokens(const platform::Value& resources) const;
     static platform::MutableDictionary dictionaryOf(const std::vector<IssuedToken>& tokens);
     static bool shows(const std::optional<platform::Dictionary>& dictionary, const std::vector<IssuedToken>& tokens);
-    void augmentWithService(platform::MutableDictionary& form, const platform::Value& bundleIdentifier) const;
+    bool augmentWithService(platform::MutableDictionary& form, const platform::Value& bundleIdentifier) const;
+    void keepForm(KeptForm kept) const;
 
     const std::shared_ptr<RecentForms> _recentForms;
-    struct FormKeeper {
-        zembra::AtomicField<KeptFormRef> kept;
-    };
-    mutable zembra::AtomicField<std::weak_ptr<FormKeeper>> _formKeeper; // held by `_recentForms`
     mutable std::atomic<std::uint64_t> _lastMade = 0; // the number of the last form that had to be made
 };
 

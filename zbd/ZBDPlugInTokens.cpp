@@ -26,26 +26,32 @@ std::string errnoText(const platform::Error& error) {
 
 } // namespace
 
-void ZBDPlugIn::augmentForm(MutableDictionary& form, const KeptFormRef& kept) const {
+void ZBDPlugIn::augmentForm(MutableDictionary& form, const KeptFormRef& kept, const FormCompletion& completion) const {
     const TokenNeeds own = kept ? TokenNeeds() : tokenNeeds();
     const TokenNeeds& needs = kept ? kept->tokens : own;
+    bool hasAll = true;
     if (needs.resources) {
         const auto tokens = issueResourceTokens(needs.resources);
         const Value* present = form.find(zembra::formKey::extensions);
-        if (!present || !shows(present->dictionary(), tokens)) {
-            form.set(zembra::formKey::extensions, dictionaryOf(tokens));
+        if (!present || !shows(present->dictionary(), tokens.granted)) {
+            form.set(zembra::formKey::extensions, dictionaryOf(tokens.granted));
         }
+        hasAll = tokens.areAll;
     }
-    if (needs.serviceOfBundle) augmentWithService(form, *needs.serviceOfBundle);
-    if (!kept || form.isUnchangedFrom(kept->form)) return;
-    const auto keeper = _formKeeper.read([](const auto& field) { return field.lock(); });
-    if (!keeper || keeper->kept.get() != kept) return; // something newer is there
+    if (needs.serviceOfBundle) hasAll = augmentWithService(form, *needs.serviceOfBundle) && hasAll;
+    if (!kept) return;
+    // The log tells each time of what was refused.
+    const FormCompletion reached = hasAll ? completion : FormCompletion();
+    if (form.isUnchangedFrom(kept->form)) return kept->lastCompletion.set(reached);
+    if (!_keptForm.read([&](const auto& field) { return field == kept; })) return; // something newer is there
     KeptForm changed = *kept;
     changed.form = form.keepingEncoding();
-    keeper->kept.set(std::make_shared<const KeptForm>(std::move(changed)));
+    changed.lastCompletion.set(reached);
+    keepForm(std::move(changed));
 }
 
-void ZBDPlugIn::augmentWithService(MutableDictionary& form, const Value& bundleIdentifier) const {
+/// False when the service is refused.
+bool ZBDPlugIn::augmentWithService(MutableDictionary& form, const Value& bundleIdentifier) const {
     const auto token =
         zembra::issueServiceLookupToken(_platform.sandbox, std::string(bundleIdentifier.string().value_or("")));
     if (!token) {
@@ -55,9 +61,10 @@ void ZBDPlugIn::augmentWithService(MutableDictionary& form, const Value& bundleI
     } else if (form.string(zembra::formKey::serviceExtension) != *token) {
         form.set(zembra::formKey::serviceExtension, *token);
     }
+    return static_cast<bool>(token);
 }
 
-ZBDPlugIn::TokenNeeds ZBDPlugIn::tokenNeeds() const {
+TokenNeeds ZBDPlugIn::tokenNeeds() const {
     TokenNeeds needs;
     needs.resources = isAppExtension() ? Value(Array{Value(wholeBundle)}) : pluginKey(manifest::shared);
     if (!isData()) needs.serviceOfBundle = infoKey(manifest::bundleIdentifier);
@@ -65,7 +72,7 @@ ZBDPlugIn::TokenNeeds ZBDPlugIn::tokenNeeds() const {
 }
 
 MutableDictionary ZBDPlugIn::issueResourceExtensions(const Value& resources) const {
-    return dictionaryOf(issueResourceTokens(resources));
+    return dictionaryOf(issueResourceTokens(resources).granted);
 }
 
 MutableDictionary ZBDPlugIn::dictionaryOf(const std::vector<IssuedToken>& tokens) {
@@ -82,10 +89,10 @@ bool ZBDPlugIn::shows(const std::optional<platform::Dictionary>& dictionary, con
            });
 }
 
-std::vector<ZBDPlugIn::IssuedToken> ZBDPlugIn::issueResourceTokens(const Value& resources) const {
+ZBDPlugIn::IssuedTokens ZBDPlugIn::issueResourceTokens(const Value& resources) const {
     const Array elements = resources.string() ? Array{resources} : resources.array().value_or(Array());
     const auto bundle = *url();
-    std::vector<IssuedToken> tokens;
+    IssuedTokens tokens;
     for (const Value& element : elements) {
         const auto resource = element.string();
         if (!resource) continue;
@@ -95,8 +102,9 @@ std::vector<ZBDPlugIn::IssuedToken> ZBDPlugIn::issueResourceTokens(const Value& 
         // What a manifest calls its own must lie inside its bundle, also behind symbolic links.
         auto token = zembra::issueFileReadToken(_platform.sandbox, location, bundle.path());
         if (token) {
-            tokens.push_back({element, *std::move(token)});
+            tokens.granted.push_back({element, *std::move(token)});
         } else {
+            tokens.areAll = false;
             log::ops().info("failed to make extension for %@ in plug-in at %@: %{public}s", location.path(),
                             bundle.path(), errnoText(token.error()));
         }

@@ -13,6 +13,7 @@ namespace zbd {
 
 namespace log = zembra::log;
 using platform::Dictionary;
+using platform::PlugInProxies;
 using platform::PlugInProxyRef;
 using platform::URL;
 using platform::UUID;
@@ -51,6 +52,9 @@ std::optional<std::string> electionOfPattern(const Value& pattern) {
     if (beginsAlphanumeric(*text)) return std::string(*text);
     return std::nullopt;
 }
+
+/// Answers whose records are at hand when the registry gives the same one again.
+constexpr std::size_t maximumAnswers = 16;
 
 bool isUsable(const PlugInProxyRef& proxy) {
     if (!proxy->bundleURL) {
@@ -97,7 +101,7 @@ ZBDPlugInRef ZBDatabase::cachedPlugIn(const UUID& uuid) {
     const auto found = _cache.find(uuid);
     if (found == _cache.end()) return nullptr;
     if (found->second->isStillValid()) return found->second;
-    _cache.erase(found);
+    forget(uuid);
     return nullptr;
 }
 
@@ -120,8 +124,14 @@ ZBDPlugInRef ZBDatabase::createPlugInForProxy(const PlugInProxyRef& proxy) {
     if (!plugIn) return nullptr;
     if (plugIn->hasEntitlement(zembra::entitlement::autoElectPlugIn)) autoElect(*plugIn);
     purgeCachesToLimit(_cacheLimit);
-    _cache.insert_or_assign(*plugIn->uuid(), plugIn);
+    forget(*plugIn->uuid());
+    _cache.emplace(*plugIn->uuid(), plugIn);
     return plugIn;
+}
+
+void ZBDatabase::forget(const UUID& uuid) {
+    _sync->assertCurrent();
+    if (_cache.erase(uuid) != 0) _answers.clear();
 }
 
 void ZBDatabase::purgeCachesToLimit(std::uint32_t limit) {
@@ -129,6 +139,7 @@ void ZBDatabase::purgeCachesToLimit(std::uint32_t limit) {
     if (_cache.size() <= limit) return;
     log::ops().info("purging cache for %d > %d", _cache.size(), limit);
     _cache.clear();
+    _answers.clear();
     _workspace.clearSchemaCaches();
 }
 
@@ -197,46 +208,59 @@ bool ZBDatabase::acceptByElection(const ElectionValues& elections, const std::st
     return std::find(elections.begin(), elections.end(), text) != elections.end();
 }
 
-std::optional<std::vector<PlugInProxyRef>> ZBDatabase::proxiesFor(const std::optional<Dictionary>& query) {
+PlugInProxies ZBDatabase::proxiesFor(const std::optional<Dictionary>& query) {
     if (!query || query->empty()) {
         auto proxies = _workspace.installedPlugIns();
         log::cx().debug("%d installedPlugins: %@", proxies ? proxies->size() : 0, proxies);
         return proxies;
     }
     const auto elections = electionPrefilter(*query);
-    auto proxies = _workspace.plugInsMatching(*query, [&](const std::string& identifier,
-                                                          const std::optional<Dictionary>& entitlements) {
-        if (!elections) return true;
+    const auto hasElection = [&](const std::string& identifier, const std::optional<Dictionary>& entitlements) {
         // A replacing plug-in shares the annotation of the one it replaces.
         const auto replaced = entitlements ? entitlements->string(zembra::entitlement::replacePlugIn) : std::nullopt;
         const std::string key(replaced.value_or(identifier));
         const bool accepted = acceptByElection(*elections, key, entitlements);
         log::ops().debug("cx filter %@ -> %d", key, accepted ? 1 : 0);
         return accepted;
-    });
+    };
+    auto proxies = _workspace.plugInsMatching(*query, elections ? platform::Registry::Filter(hasElection) : nullptr);
     log::cx().debug("%d plugin(s) matching %@ = %@", proxies ? proxies->size() : 0, *query, proxies);
     return proxies;
 }
 
-std::optional<std::vector<ZBDPlugInRef>> ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
-    return _sync->sync([&]() -> std::optional<std::vector<ZBDPlugInRef>> {
+ZBDPlugIns ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
+    return _sync->sync([&]() -> ZBDPlugIns {
         const auto proxies = proxiesFor(query);
         const std::size_t countBefore = _cache.size();
-        if (!proxies) return std::nullopt;
-        std::vector<ZBDPlugInRef> plugIns;
-        plugIns.reserve(proxies->size());
-        bool isOrdered = true; // mostly so, and then thousands of records need not be looked at again
-        const UUID* last = nullptr;
-        for (const PlugInProxyRef& proxy : *proxies) {
-            isOrdered = isOrdered && proxy->uuid && (last == nullptr || *last < *proxy->uuid);
-            last = isOrdered ? &*proxy->uuid : nullptr;
-            if (!isUsable(proxy)) continue;
-            if (auto plugIn = recordForProxy(proxy)) plugIns.push_back(std::move(plugIn));
-        }
-        if (!isOrdered) order(plugIns);
-        log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns.size(), countBefore, _cache.size());
+        if (!proxies) return nullptr;
+        auto plugIns = recordsFor(proxies);
+        log::ops().debug("CX reported %u plug-ins (cache %u/%u)", plugIns->size(), countBefore, _cache.size());
         return plugIns;
     });
+}
+
+ZBDPlugIns ZBDatabase::recordsFor(const PlugInProxies& proxies) {
+    const auto known = std::ranges::find(_answers, proxies, &Answer::proxies);
+    if (known != _answers.end()) return known->records;
+    std::vector<ZBDPlugInRef> plugIns;
+    plugIns.reserve(proxies->size());
+    bool isOrdered = true; // mostly so, and then thousands of records need not be looked at again
+    const UUID* last = nullptr;
+    for (const PlugInProxyRef& proxy : *proxies) {
+        isOrdered = isOrdered && proxy->uuid && (last == nullptr || *last < *proxy->uuid);
+        last = isOrdered ? &*proxy->uuid : nullptr;
+        if (!isUsable(proxy)) continue;
+        if (auto plugIn = recordForProxy(proxy)) plugIns.push_back(std::move(plugIn));
+    }
+    if (!isOrdered) order(plugIns);
+    const auto records = std::make_shared<const std::vector<ZBDPlugInRef>>(std::move(plugIns));
+    // What was left out is tried, and told of, each time; so is what has no UUID. Making a record may have emptied the
+    // cache.
+    const bool areAll = records->size() == proxies->size() && records->size() <= _cache.size();
+    if (!areAll || !isOrdered) return records;
+    _answers.push_front({proxies, records});
+    if (_answers.size() > maximumAnswers) _answers.pop_back();
+    return records;
 }
 
 platform::Failure ZBDatabase::addPlugIn(const URL& url) {
@@ -261,7 +285,7 @@ void ZBDatabase::pluginsWillUninstall(const std::vector<PlugInProxyRef>& proxies
         for (const PlugInProxyRef& proxy : proxies) {
             log::ops().notice("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", proxy->bundleIdentifier,
                               proxy->plugInIdentifier, proxy->bundleVersion, proxy->uuid, pathOf(proxy->bundleURL));
-            if (proxy->uuid) _cache.erase(*proxy->uuid);
+            if (proxy->uuid) forget(*proxy->uuid);
         }
     });
     // Outside the queue, so that the delegate may use the database.

@@ -6,6 +6,7 @@
 #include "zbd/ZBDPlugIn.h"
 
 #include <cstdint>
+#include <list>
 #include <memory>
 #include <optional>
 #include <span>
@@ -17,6 +18,8 @@
 namespace zbd {
 
 using ZBDPlugInRef = std::shared_ptr<ZBDPlugIn>;
+/// Shared with others who asked the same; null when the registry does not answer.
+using ZBDPlugIns = std::shared_ptr<const std::vector<ZBDPlugInRef>>;
 using ZBDPlugInSet = std::unordered_set<ZBDPlugInRef, zembra::ZBPlugInHash, zembra::ZBPlugInEqual>;
 
 /// Told of uninstalled plug-ins after the database has let go of them. Called on the registry's thread.
@@ -45,8 +48,8 @@ public:
 
     /// The records of the plug-ins that may match `query`; of all installed ones when it is absent or empty. Each once,
     /// in the order of the registry's UUIDs, so that the same question gets the same answer. The caller judges them by
-    /// its rules. None when the registry does not answer.
-    std::optional<std::vector<ZBDPlugInRef>> findPlugIns(const std::optional<platform::Dictionary>& query);
+    /// its rules.
+    ZBDPlugIns findPlugIns(const std::optional<platform::Dictionary>& query);
     ZBDPlugInRef findPlugIn(const platform::UUID& uuid);
     /// Whether the plug-in's record is cached.
     bool hasRecord(const platform::UUID& uuid) const;
@@ -60,6 +63,8 @@ public:
 
     // ZBDatabaseAnnotations.cpp
     std::optional<platform::Dictionary> annotationForPlugIn(const ZBDPlugIn& plugIn);
+    /// Another one after each change of annotations. Any thread.
+    std::uint64_t annotationsVersion() const { return _annotations->version(); }
     void setAnnotation(const std::optional<platform::Dictionary>& annotation, const ZBDPlugIn& plugIn);
     void setAnnotations(std::span<const AnnotationChange> changes);
     /// Tells every host that annotations or holds changed. Any thread.
@@ -90,7 +95,9 @@ private:
                           const std::optional<platform::Dictionary>& entitlements) const;
     ZBDPlugInRef cachedPlugIn(const platform::UUID& uuid);
     ZBDPlugInRef recordForProxy(const platform::PlugInProxyRef& proxy);
-    std::optional<std::vector<platform::PlugInProxyRef>> proxiesFor(const std::optional<platform::Dictionary>& query);
+    platform::PlugInProxies proxiesFor(const std::optional<platform::Dictionary>& query);
+    ZBDPlugIns recordsFor(const platform::PlugInProxies& proxies);
+    void forget(const platform::UUID& uuid);
 
     platform::Platform& _platform;
     std::uint32_t _cacheLimit = defaultCacheLimit;
@@ -99,7 +106,14 @@ private:
     std::unique_ptr<ZBDAnnotationStore> _annotations; // changed on _sync, and only while a request waits
                                                       // for it: so the service queue may read it too
     std::shared_ptr<platform::WorkQueue> _sync;
-    std::unordered_map<platform::UUID, ZBDPlugInRef> _cache; // on _sync only
+
+    // On _sync only.
+    std::unordered_map<platform::UUID, ZBDPlugInRef> _cache;
+    struct Answer {
+        platform::PlugInProxies proxies;
+        ZBDPlugIns records; // all of them cached
+    };
+    std::list<Answer> _answers; // the last made one first
     const std::shared_ptr<RecentForms> _recentForms = std::make_shared<RecentForms>();
     std::unique_ptr<platform::LocaleObservation> _regionObserver;
 };

@@ -41,6 +41,18 @@ constexpr std::size_t maximumLooks = 500;
 /// the look at the disk. Whoever needs that one ends the delay.
 constexpr int startDelay = 100;
 
+/// Answers kept for those who ask again. Hosts choose the questions.
+constexpr std::size_t maximumAnswers = 16;
+constexpr std::size_t maximumKeptQuestion = 4096; // bytes
+
+bool isWorthKeeping(const std::vector<EqualityTest>& tests) {
+    std::size_t size = 0;
+    for (const auto& test : tests) {
+        for (const auto& value : test.values) size += value.size() + 1;
+    }
+    return size <= maximumKeptQuestion;
+}
+
 constexpr const char* placeholderKey = "VBBundleIsPlaceholder";
 
 /// The path with its symbolic links resolved; none for what does not exist.
@@ -198,11 +210,27 @@ public:
     }
 
     std::vector<PlugInProxyRef> proxies(const std::vector<InstalledPlugInRef>& plugIns) {
-        const auto current = languages();
+        return proxies(plugIns, *languages());
+    }
+    std::vector<PlugInProxyRef> proxies(const std::vector<InstalledPlugInRef>& plugIns, const Languages& languages) {
         std::vector<PlugInProxyRef> answer;
         answer.reserve(plugIns.size());
-        for (const auto& plugIn : plugIns) answer.push_back(proxy(plugIn, *current));
+        for (const auto& plugIn : plugIns) answer.push_back(proxy(plugIn, languages));
         return answer;
+    }
+
+    /// The proxies of all plug-ins that may match; the same list again as long as nothing has changed.
+    PlugInProxies answer(const std::vector<EqualityTest>& tests) {
+        const auto current = languages();
+        if (_stage.load(std::memory_order_acquire) < Stage::verified) {
+            return std::make_shared<const std::vector<PlugInProxyRef>>(proxies(matching(tests), *current));
+        }
+        const auto snapshot = snapshotForAnswer();
+        if (auto known = knownAnswer(tests, snapshot, *current)) return known;
+        const auto plugIns = snapshot->matching(tests);
+        auto made = std::make_shared<const std::vector<PlugInProxyRef>>(proxies(plugIns, *current));
+        keepAnswer(plugIns, {tests, snapshot, current->generation, made});
+        return made;
     }
 
     std::shared_ptr<const ApplicationRecord> record(const InstalledApplicationRef& application,
@@ -311,6 +339,10 @@ private:
     /// From now on answers come from `snapshot`. Answers the observers that hear of it: those who came before.
     Observers show(std::shared_ptr<const RegistrySnapshot> snapshot) {
         _needsVerifying.store(_bundles.needsVerifying(), std::memory_order_relaxed);
+        {
+            const std::lock_guard lock(_madeMutex);
+            _answers.clear(); // they would keep what is gone
+        }
         Observers observers;
         const std::lock_guard lock(_mutex);
         _snapshot.swap(snapshot);
@@ -391,6 +423,37 @@ private:
         for (const auto& observer : observers) observer->pluginsDidInstall(notice);
     }
 
+    /// A list of proxies, and what it was an answer to.
+    struct Answer {
+        std::vector<EqualityTest> tests;
+        std::weak_ptr<const RegistrySnapshot> snapshot;
+        std::uint64_t languages;
+        PlugInProxies proxies;
+    };
+
+    PlugInProxies knownAnswer(const std::vector<EqualityTest>& tests,
+                              const std::shared_ptr<const RegistrySnapshot>& snapshot, const Languages& languages) {
+        const std::lock_guard lock(_madeMutex);
+        const auto known = std::ranges::find_if(_answers, [&](const Answer& answer) {
+            return answer.languages == languages.generation && answer.tests == tests &&
+                   answer.snapshot.lock() == snapshot;
+        });
+        if (known == _answers.end()) return nullptr;
+        _answers.splice(_answers.begin(), _answers, known);
+        return known->proxies;
+    }
+
+    void keepAnswer(const std::vector<InstalledPlugInRef>& plugIns, Answer answer) {
+        if (!isWorthKeeping(answer.tests)) return;
+        const std::lock_guard lock(_madeMutex);
+        // A proxy that was not kept is to be made anew for each answer.
+        for (std::size_t i = 0; i < plugIns.size(); ++i) {
+            if (plugIns[i]->proxy.object != (*answer.proxies)[i]) return;
+        }
+        _answers.push_front(std::move(answer));
+        if (_answers.size() > maximumAnswers) _answers.pop_back();
+    }
+
     /// Nobody needs the container of a plug-in that is only told of, so none is made.
     std::vector<PlugInProxyRef> noticeOf(const PlugIns& plugIns) {
         const auto current = languages();
@@ -457,6 +520,7 @@ private:
 
     mutable std::mutex _madeMutex; // for everything that was made of records; innermost, too
     std::shared_ptr<const Languages> _languages;
+    std::list<Answer> _answers;            // the last used one first
     std::set<std::string> _containersLeft; // identifiers of plug-ins that are gone
 
     std::atomic<bool> _needsVerifying = false;
@@ -475,18 +539,18 @@ void Registry::addObserver(std::weak_ptr<RegistryObserver> observer) {
     _implementation->addObserver(std::move(observer));
 }
 
-std::optional<std::vector<PlugInProxyRef>> Registry::installedPlugIns() {
-    return _implementation->proxies(_implementation->snapshotForAnswer()->plugIns());
-}
+PlugInProxies Registry::installedPlugIns() { return _implementation->answer({}); }
 
-std::optional<std::vector<PlugInProxyRef>> Registry::plugInsMatching(const Dictionary& query, const Filter& filter) {
-    auto plugIns = _implementation->matching(equalityTests(query));
+PlugInProxies Registry::plugInsMatching(const Dictionary& query, const Filter& filter) {
+    const auto tests = equalityTests(query);
+    if (!filter) return _implementation->answer(tests);
+    auto plugIns = _implementation->matching(tests);
     std::erase_if(plugIns, [&](const auto& plugIn) {
         const auto& stored = plugIn->facts->entitlements;
         const auto entitlements = stored ? std::optional(stored->dictionary()) : std::nullopt;
         return !filter(plugIn->identifier.value_or(std::string()), entitlements);
     });
-    return _implementation->proxies(plugIns);
+    return std::make_shared<const std::vector<PlugInProxyRef>>(_implementation->proxies(plugIns));
 }
 
 PlugInProxyRef Registry::plugInForUUID(const UUID& uuid) {

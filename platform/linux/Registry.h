@@ -35,8 +35,8 @@ public:
     Registry& operator=(const Registry&) = delete;
 
     void addObserver(std::weak_ptr<RegistryObserver> observer) override;
-    std::optional<std::vector<PlugInProxyRef>> installedPlugIns() override;
-    std::optional<std::vector<PlugInProxyRef>> plugInsMatching(const Dictionary& query, const Filter& filter) override;
+    PlugInProxies installedPlugIns() override;
+    PlugInProxies plugInsMatching(const Dictionary& query, const Filter& filter) override;
     PlugInProxyRef plugInForUUID(const UUID& uuid) override;
     PlugInProxyRef plugInForURL(const URL& url) override;
     std::shared_ptr<const ApplicationRecord> applicationForURL(const URL& url) override;

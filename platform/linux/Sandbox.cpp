@@ -29,9 +29,12 @@ constexpr std::size_t maximumResolutions = 8192;
 constexpr std::chrono::seconds resolutionLifetime{5};
 
 /// One look at a file serves the answers of that time: among them are those of hosts that ask again and again, and a
-/// look costs more than the rest of a form. Shorter than what the registry takes to hear that a bundle was replaced. A
-/// token handed out in vain meanwhile is like one from just before: it opens nothing.
+/// look costs more than the rest of a form. A token handed out in vain meanwhile is like one from just before: it opens
+/// nothing.
 constexpr std::chrono::milliseconds lookLifetime{20};
+
+/// Who keeps a token with what the registry says of its bundle hears sooner than this that the bundle was replaced.
+constexpr std::chrono::milliseconds repeatLifetime{100};
 
 bool isName(const std::string& text) {
     return !text.empty() && text.size() <= maximumNameLength && text.find('\0') == std::string::npos;
@@ -143,6 +146,8 @@ Result<std::string> Sandbox::issueFile(const std::string& extensionClass, const 
     _resolutions.insert_or_assign(path, std::move(resolution));
     return *std::move(token);
 }
+
+std::chrono::milliseconds Sandbox::repeatInterval() const { return repeatLifetime; }
 
 Result<std::string> Sandbox::issueService(const std::string& extensionClass, const std::string& name) {
     if (!_signer) return systemError(EPERM, name);

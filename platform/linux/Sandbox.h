@@ -45,6 +45,7 @@ public:
     /// replaced, the token yields nothing.
     Result<std::string> issueFile(const std::string& extensionClass, const std::string& path, SandboxFlag flag,
                                   const std::string& within) override;
+    std::chrono::milliseconds repeatInterval() const override;
     Result<std::string> issueService(const std::string& extensionClass, const std::string& name) override;
     /// Asks the broker and waits for it, at most some seconds. errno: EPERM for a token that this daemon did not sign,
     /// ESTALE when what it was for has been replaced, EINVAL for text that cannot be a token, EACCES when file

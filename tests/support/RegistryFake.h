@@ -109,13 +109,14 @@ public:
         const std::lock_guard lock(_mutex);
         _observers.push_back(std::move(observer));
     }
-    std::optional<Proxies> installedPlugIns() override {
-        return called("installedPlugIns") ? std::nullopt : std::optional(get(_plugIns));
+    platform::PlugInProxies installedPlugIns() override {
+        return called("installedPlugIns") ? nullptr : std::make_shared<const Proxies>(get(_plugIns));
     }
     /// Leaves the query to the caller: everything that passes the filter, which is the largest allowed answer.
-    std::optional<Proxies> plugInsMatching(const Dictionary&, const Filter& filter) override {
-        if (called("plugInsMatching")) return std::nullopt;
-        return those([&](const Proxy& one) { return filter(one.plugInIdentifier.value_or(""), one.entitlements); });
+    platform::PlugInProxies plugInsMatching(const Dictionary&, const Filter& filter) override {
+        if (called("plugInsMatching")) return nullptr;
+        return std::make_shared<const Proxies>(those(
+            [&](const Proxy& one) { return !filter || filter(one.plugInIdentifier.value_or(""), one.entitlements); }));
     }
     PlugInProxyRef plugInForUUID(const UUID& uuid) override {
         return called("plugInForUUID") ? nullptr : first([&](const Proxy& one) { return one.uuid == uuid; });

@@ -22,8 +22,9 @@ struct Database : support::Requests {
     static long builds() { return std::ranges::count(processLog.messages("ops"), "createPlugInForProxy"); }
     Names found(const std::optional<Dictionary>& query) {
         Names names;
-        const auto plugIns = database.findPlugIns(query).value_or(std::vector<zbd::ZBDPlugInRef>());
-        for (const auto& plugIn : plugIns) names.emplace(plugIn->identifier().string()->substr(12)); // "com.example."
+        const auto plugIns = database.findPlugIns(query);
+        for (const auto& plugIn : plugIns ? *plugIns : std::vector<zbd::ZBDPlugInRef>())
+            names.emplace(plugIn->identifier().string()->substr(12)); // "com.example."
         return names;
     }
 };
@@ -34,7 +35,7 @@ TEST_F(Database, RecordIsBuiltOnceAndFoundByEveryWay) {
     fake.registry.fireDidInstall({proxy}); // leaves the cache alone
     EXPECT_EQ(database.findPlugInAtPath(*proxy->bundleURL), plugIn);
     EXPECT_EQ(database.plugInForProxy(proxy), plugIn);
-    EXPECT_EQ(database.findPlugIns(std::nullopt), std::vector{plugIn});
+    EXPECT_EQ(*database.findPlugIns(std::nullopt), std::vector{plugIn});
     EXPECT_EQ(builds(), 1);
     fake.locale.setLanguages({"de", "en"});
     EXPECT_NE(database.findPlugIn(*proxy->uuid), plugIn) << "its names may be others now";

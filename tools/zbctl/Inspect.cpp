@@ -41,9 +41,9 @@ public:
     }
 
     void addObserver(std::weak_ptr<platform::RegistryObserver>) override {}
-    std::optional<std::vector<PlugInProxyRef>> installedPlugIns() override { return std::nullopt; }
-    std::optional<std::vector<PlugInProxyRef>> plugInsMatching(const Dictionary&, const Filter&) override {
-        return std::nullopt;
+    platform::PlugInProxies installedPlugIns() override { return nullptr; }
+    platform::PlugInProxies plugInsMatching(const Dictionary&, const Filter&) override {
+        return nullptr;
     }
     PlugInProxyRef plugInForUUID(const UUID&) override { return nullptr; }
     PlugInProxyRef plugInForURL(const URL&) override { return nullptr; }
