@@ -42,6 +42,7 @@ Outcome mustNotBeHeld(const Selection& selection, const Candidate& candidate) {
 }
 
 Outcome mustMatchRules(const Selection& selection, const Candidate& candidate) {
+    if (selection.verdicts && (*selection.verdicts)[candidate.place]) return std::nullopt;
     auto mismatch = candidate.plugIn->mismatch(selection.rules);
     if (!mismatch) return std::nullopt;
     return Rejection{"does not match the host's rules", std::move(mismatch)};

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/PropertyList.h"
+#include "zbd/RecentVerdicts.h"
 #include "zbd/ZBDatabase.h"
 
 #include <cstdint>
@@ -24,12 +25,14 @@ struct Selection {
     std::vector<MatchRules> exclusions; // the user's, as read for this request
     bool isRestricted = true;           // whether the host may be entitled to a part of the plug-ins only
     bool hasHolds = true;               // whether a plug-in may be on hold
+    RecentVerdicts::Verdicts verdicts;  // of the rules, on each candidate in its place; null when they are not known
 };
 
 /// One plug-in under test, and what it keeps, if anything.
 struct Candidate {
     const ZBDPlugInRef& plugIn;
     const KeptFormRef& kept;
+    std::size_t place = 0; // among the candidates
 };
 
 /// Why a candidate is dropped.

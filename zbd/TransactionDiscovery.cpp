@@ -37,7 +37,16 @@ using Overrides = std::unordered_map<std::string, MutableDictionary>;
 
 std::string_view textOf(const Value& value) { return value.string().value_or(""); }
 
-std::string listing(const ZBDPlugInRef& candidate) { return candidate->listing(candidate->keptForm()); }
+/// A candidate as the log shows it.
+struct Listing {
+    explicit Listing(const ZBDPlugInRef& candidate) : kept(candidate->keptForm()) {
+        if (!kept) made = candidate->listing(kept);
+    }
+    operator std::string_view() const { return kept ? kept->listing : made; } // NOLINT(google-explicit-constructor)
+
+    KeptFormRef kept;
+    std::string made;
+};
 
 // Both lists are made as they are printed: the log shows the first few dozen of thousands.
 
@@ -46,7 +55,7 @@ void logCandidates(const Candidates& candidates) {
         log::ops().info("Candidate plugin count: 0");
     } else {
         log::ops().info("Candidate plugin count: %u, info: %{public}@", candidates.size(),
-                        std::views::transform(candidates, listing));
+                        std::views::transform(candidates, [](const auto& candidate) { return Listing(candidate); }));
     }
 }
 
@@ -135,7 +144,7 @@ void Transaction::matchPlugIns() {
     }
 
     platform::TypeConformance& types = server()->platform().typeConformance;
-    const Selection selection{
+    Selection selection{
         .server = *server(),
         .client = *_client,
         .flags = flags,
@@ -143,12 +152,17 @@ void Transaction::matchPlugIns() {
         .exclusions = readExclusions(server()->userPrefs().exclusions(), types),
         .isRestricted = static_cast<bool>(_client->entitlementValueForKey(zembra::entitlement::allowedPlugIns)),
         .hasHolds = server()->hasHolds(),
+        .verdicts = nullptr,
     };
     ZBDPlugIns candidates = server()->findPlugIns(rules);
     if (!candidates) candidates = std::make_shared<const Candidates>();
     platform::trace::discoverRaw(static_cast<unsigned>(candidates->size()));
     logCandidates(*candidates);
     candidates = preferBundleRelativeForHost(candidates);
+    if (rules && !candidates->empty()) {
+        selection.verdicts = server()->recentVerdicts().verdictsOn(candidates, *rules, selection.rules,
+                                                                   server()->platform().registry.knowledgeUUID());
+    }
 
     // An older protocol has no forms in its reply, so none are too many.
     const auto fits = [&](std::size_t size) {
@@ -157,9 +171,10 @@ void Transaction::matchPlugIns() {
     const auto now = std::chrono::steady_clock::now();
     SameIdentifierReduction results(flags);
     Overrides overrides;
-    for (const auto& candidate : *candidates) {
+    for (std::size_t place = 0; place < candidates->size(); ++place) {
+        const ZBDPlugInRef& candidate = (*candidates)[place];
         const auto kept = candidate->keptForm();
-        if (rejectionOf(selection, {candidate, kept})) continue;
+        if (rejectionOf(selection, {candidate, kept, place})) continue;
         if (kept && !kept->replacesOthers && isComplete(*candidate, *kept, now)) {
             if (!results.admit(kept->facts)) continue;
             results.add(kept->facts, AnswerForm::shared(kept->form));

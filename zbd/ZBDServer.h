@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/Platform.h"
+#include "zbd/RecentVerdicts.h"
 #include "zbd/ZBDPlugInHold.h"
 #include "zbd/ZBDUserPrefs.h"
 #include "zbd/ZBDatabase.h"
@@ -66,6 +67,7 @@ public:
     const std::shared_ptr<platform::WorkQueue>& syncQueue() const { return _syncQueue; }
     const std::shared_ptr<platform::Listener>& service() const { return _service; }
     const ZBDUserPrefs& userPrefs() const { return *_userPrefs; }
+    RecentVerdicts& recentVerdicts() { return _recentVerdicts; }
 
 private:
     explicit ZBDServer(platform::Platform& platform);
@@ -80,6 +82,8 @@ private:
     std::shared_ptr<platform::Listener> _service;
     std::unique_ptr<ZBDUserPrefs> _userPrefs;
     std::shared_ptr<platform::WorkQueue> _syncQueue;
+
+    RecentVerdicts _recentVerdicts; // on the service queue only
 
     // On _syncQueue only.
     struct Place {

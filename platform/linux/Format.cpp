@@ -59,6 +59,7 @@ void FormatArgument::appendUUID(std::string& out) const {
 std::string formatArguments(std::string_view text, std::span<const FormatArgument> arguments,
                             PrivateArguments privacy) {
     std::string out;
+    out.reserve(256); // most lines; lists are longer
     auto argument = arguments.begin();
     while (!text.empty()) {
         const detail::Directive directive = detail::nextDirective(text);

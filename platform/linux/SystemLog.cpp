@@ -143,10 +143,18 @@ private:
 
 } // namespace
 
+namespace {
+
+bool isPrintable(std::string_view message, std::size_t limit) {
+    return message.size() <= limit && plainLength(message) == message.size();
+}
+
+} // namespace
+
 std::string printableLine(std::string_view message, std::size_t limit) {
     constexpr std::string_view ellipsis = "...";
     constexpr std::string_view hexadecimal = "0123456789abcdef";
-    if (message.size() <= limit && plainLength(message) == message.size()) return std::string(message);
+    if (isPrintable(message, limit)) return std::string(message);
     std::string out;
     out.reserve(std::min(message.size(), limit));
     std::size_t cut = 0; // where whole pieces end with room for the ellipsis
@@ -287,7 +295,12 @@ void SystemLog::writeToDescriptor(const LogRecord& record) {
         line += ']';
     }
     line += ' ';
-    line += printableLine(record.message, maximumLineLength - line.size() - 1);
+    line.reserve(line.size() + record.message.size() + 1);
+    const std::size_t limit = maximumLineLength - line.size() - 1;
+    if (isPrintable(record.message, limit))
+        line += record.message;
+    else
+        line += printableLine(record.message, limit);
     line += '\n';
 
     const auto write = [&] {

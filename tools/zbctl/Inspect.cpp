@@ -42,9 +42,7 @@ public:
 
     void addObserver(std::weak_ptr<platform::RegistryObserver>) override {}
     platform::PlugInProxies installedPlugIns() override { return nullptr; }
-    platform::PlugInProxies plugInsMatching(const Dictionary&, const Filter&) override {
-        return nullptr;
-    }
+    platform::PlugInProxies plugInsMatching(const Dictionary&, const Filter&) override { return nullptr; }
     PlugInProxyRef plugInForUUID(const UUID&) override { return nullptr; }
     PlugInProxyRef plugInForURL(const URL&) override { return nullptr; }
     std::shared_ptr<const platform::ApplicationRecord> applicationForURL(const URL&) override { return nullptr; }
