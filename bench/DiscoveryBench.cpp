@@ -162,6 +162,7 @@ void measureSelection(const Settings& settings, const std::string& directory) {
         Series selected{};
         Series selectedAgain{};
         Proportion withoutRules{};
+        Proportion allInTurn{};
     };
     std::list<Size> all;
     for (const std::size_t size : sizes) all.emplace_back(settings, directory, size);
@@ -174,11 +175,14 @@ void measureSelection(const Settings& settings, const std::string& directory) {
             const double each = 1e3 / static_cast<double>(size.plugIns);
             size.withoutRules.reference.add(measure(SelectionTask::gather) * each);
             size.withoutRules.measured.add(measure(SelectionTask::everything) * each);
+            size.allInTurn.reference = size.withoutRules.reference;
+            size.allInTurn.measured.add(measure(SelectionTask::allInTurn) * each);
         }
     }
     printHeader("Selection of 20 by point, version and attribute");
     const Size* smaller = nullptr;
     std::vector<Proportion> withoutRules;
+    std::vector<Proportion> allInTurn;
     for (const auto& size : all) {
         const std::string among = "among " + withThousands(size.plugIns) + ": ";
         printReference(among + "every record asked", size.evaluated, "us");
@@ -192,9 +196,11 @@ void measureSelection(const Settings& settings, const std::string& directory) {
         }
         smaller = &size;
         withoutRules.push_back(size.withoutRules);
+        allInTurn.push_back(size.allInTurn);
     }
     printHeader("Without rules, for each plug-in");
-    printProportions("all records answered", "known records put into a set", withoutRules);
+    printProportions("all records walked", "known records put into a set", withoutRules);
+    printProportions("all records walked, new questions", "known records put into a set", allInTurn);
     std::fflush(stdout);
 }
 

@@ -28,6 +28,7 @@ enum class SelectionTask {
     selectAgain,  // one question again and again
     evaluate,     // the same questions in turn, asked of every record
     everything,   // no rules
+    allInTurn,    // questions that all fulfil, one after the other; more of them than the registry keeps answers of
     gather,       // the records that are known put into a set, which is a plain way to the answer without rules
 };
 
@@ -60,6 +61,19 @@ public:
             questions.push_back({{zembra::manifest::pointName, pointName(point)},
                                  {zembra::manifest::version, ">=2"},
                                  {groupKey, groupName(0)}});
+        }
+        return questions;
+    }
+
+    /// Different ones that all plug-ins fulfil.
+    static std::vector<Dictionary> forAll() {
+        std::vector<Value> anyPoint;
+        for (std::size_t point = 0; point < points; ++point) anyPoint.emplace_back(pointName(point));
+        std::vector<Dictionary> questions;
+        for (std::size_t i = 0; i < 20; ++i) {
+            std::vector<Value> patterns = anyPoint;
+            patterns.emplace_back(pointName(points + i));
+            questions.push_back({{zembra::manifest::pointName, platform::Array(std::move(patterns))}});
         }
         return questions;
     }
@@ -99,10 +113,9 @@ private:
         case SelectionTask::selectInTurn: return meanMicroseconds(seconds, [&] { select(nextQuestion()); });
         case SelectionTask::selectAgain: return meanMicroseconds(seconds, [&] { select(_questions.front()); });
         case SelectionTask::evaluate: return meanMicroseconds(seconds, [&] { evaluate(nextQuestion()); });
-        case SelectionTask::everything:
-            return meanMicroseconds(seconds, [&] {
-                if (_server->findPlugIns(std::nullopt)->size() != _records.size()) fail("some plug-ins went");
-            });
+        case SelectionTask::everything: return meanMicroseconds(seconds, [&] { walk(std::nullopt); });
+        case SelectionTask::allInTurn:
+            return meanMicroseconds(seconds, [&] { walk(_questionsForAll[_asked++ % _questionsForAll.size()]); });
         case SelectionTask::gather:
             return meanMicroseconds(seconds, [&] {
                 const zbd::ZBDPlugInSet gathered(_records.begin(), _records.end());
@@ -122,6 +135,16 @@ private:
         if (count != SelectionQuestions::answers) fail("another number of answers");
     }
 
+    /// What the daemon does when there is nothing to compare.
+    void walk(const std::optional<Dictionary>& rules) {
+        std::size_t count = 0;
+        const auto candidates = _server->findPlugIns(rules);
+        for (const auto& candidate : *candidates) {
+            if (!candidate->keptForm() && (candidate->onSystemVolume() || candidate->isContained())) ++count;
+        }
+        if (count != _records.size()) fail("some plug-ins went");
+    }
+
     void evaluate(const Dictionary& rules) {
         std::size_t count = 0;
         for (const auto& record : _records) count += record->match(rules) ? 1 : 0;
@@ -134,6 +157,7 @@ private:
         zbd::ZBDServer::initForService(_services.start(), zembra::serviceName, std::nullopt);
     std::vector<zbd::ZBDPlugInRef> _records;
     const std::vector<Dictionary> _questions = SelectionQuestions::all();
+    const std::vector<Dictionary> _questionsForAll = SelectionQuestions::forAll();
     std::size_t _asked = 0;
 };
 

@@ -121,6 +121,16 @@ TEST(Dictionary, KeepsOrderAndFindsEveryKeyAtAnySize) {
         }
 }
 
+TEST(Value, KnowsWhetherATextBeginsWithIt) {
+    for (const std::size_t length : {0U, 1U, 2U, 255U, 256U, 257U, 600U}) {
+        const std::string text = std::string(length, 'a') + "b";
+        EXPECT_TRUE(Value(text).isBeginningOf(text) && Value(text.substr(0, length)).isBeginningOf(text)) << length;
+        EXPECT_FALSE(Value(text + "b").isBeginningOf(text) || Value(text.substr(0, length) + "c").isBeginningOf(text));
+        EXPECT_FALSE(length > 2 && Value("ac" + text.substr(2)).isBeginningOf(text)) << length;
+    }
+    EXPECT_FALSE(Value().isBeginningOf("") || Value(1).isBeginningOf("1"));
+}
+
 TEST(Description, IsOneShortLineThatCannotBeForged) {
     const std::pair<Value, std::string> cases[] = {
         {Dictionary{{"a", Array{1, true, -2.5, UUID{}}}, {"b\n", Dictionary{}}},
@@ -146,6 +156,8 @@ TEST(Encoding, RoundTripsEveryValue) {
     for (const double moment : {0.1, -0.1, -5e-324, 1795381200.123456, -62135596799.5, 253402300799.99997})
         values.emplace_back(Date{moment});
     for (std::size_t size = 0; size < 7; ++size) values.push_back(Value::data(std::string(size, '\xFE')));
+    values.emplace_back(Array{compactData(sample()), 1});
+    EXPECT_EQ(compactData(sample()), Value::data(compact(sample())));
     for (const Value& value : values) {
         std::string file(compactMagic);
         appendCompact(file, value);

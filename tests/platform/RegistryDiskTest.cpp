@@ -116,7 +116,7 @@ struct Disk {
     }
     PlugInProxyRef at(const std::string& path) { return registry->plugInForURL(URL::file(path)); }
     Proxies matching(const char* identifier) {
-        return *registry->plugInsMatching({{"VKExtensionIdentifier", identifier}}, [](auto&, auto&) { return true; });
+        return *registry->plugInsMatching({{"VKExtensionIdentifier", identifier}}, nullptr);
     }
     UUID uuidAt(const std::string& path) { return at(path) ? *at(path)->uuid : UUID{}; }
     /// What stays when a plug-in's content changes.

@@ -27,6 +27,7 @@ void expectConformance(Registry& registry, const std::string& root) {
     const std::string path = app.path() + "/PlugIns/a";
     const auto installed = *registry.installedPlugIns();
     EXPECT_EQ(installed.size(), 3U);
+    EXPECT_EQ(registry.installedPlugIns(), registry.installedPlugIns()) << "one list for all who ask";
     EXPECT_TRUE(std::ranges::is_sorted(installed, {}, [](const auto& proxy) { return proxy->uuid; }));
     for (const auto& proxy : installed)
         EXPECT_EQ(identifiers({registry.plugInForUUID(*proxy->uuid)}), identifiers({proxy}));

@@ -110,7 +110,10 @@ public:
         _observers.push_back(std::move(observer));
     }
     platform::PlugInProxies installedPlugIns() override {
-        return called("installedPlugIns") ? nullptr : std::make_shared<const Proxies>(get(_plugIns));
+        if (called("installedPlugIns")) return nullptr;
+        const std::lock_guard lock(_mutex);
+        if (!_listed) _listed = std::make_shared<const Proxies>(_plugIns);
+        return _listed;
     }
     /// Leaves the query to the caller: everything that passes the filter, which is the largest allowed answer.
     platform::PlugInProxies plugInsMatching(const Dictionary&, const Filter& filter) override {
@@ -199,10 +202,12 @@ private:
     void changed() {
         if (_knowledge) _knowledge = UUID::random();
         ++_sequence;
+        _listed.reset();
     }
 
     mutable std::mutex _mutex;
     Proxies _plugIns;                                    // ordered by UUID, those without one first
+    platform::PlugInProxies _listed;                     // what the last who asked for all was given
     std::map<std::string, ApplicationRef> _applications; // by path
     std::map<std::pair<std::string, std::string>, Strings> _tables;
     std::map<std::string, std::optional<Dictionary>> _sdks;

@@ -21,6 +21,8 @@ public:
     int issueError = 0;
     int consumeError = 0;
     int releaseError = 0;
+    std::chrono::milliseconds interval{0};
+    int issues = 0;   // how often a token was asked for
     int consumed = 0; // successes; the last one is the latest handle
     int released = 0;
 
@@ -38,6 +40,7 @@ public:
     platform::Result<std::string> issueService(const std::string& extensionClass, const std::string& name) override {
         return issue(services.contains(name), "service:" + extensionClass + ":" + name);
     }
+    std::chrono::milliseconds repeatInterval() const override { return interval; }
     std::int64_t consume(const std::string& token, int& errorNumber) override {
         errorNumber = consumeError != 0 ? consumeError : EPERM;
         if (consumeError != 0 || !_issued.contains(token)) return -1;
@@ -53,6 +56,7 @@ public:
 
 private:
     platform::Result<std::string> issue(bool isAllowed, const std::string& token) {
+        ++issues;
         if (issueError != 0) return platform::Error{platform::posixErrorDomain, issueError, "failed"};
         if (!isAllowed) return platform::Error{platform::posixErrorDomain, EPERM, "refused"};
         return *_issued.insert(token).first;

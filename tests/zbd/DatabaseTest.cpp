@@ -46,6 +46,28 @@ TEST_F(Database, RecordIsBuiltOnceAndFoundByEveryWay) {
                                proxy->bundleURL->path());
 }
 
+TEST_F(Database, RecordsAreListedAnewWhenOneIsGone) {
+    const auto list = [this] { return database.findPlugIns(std::nullopt); };
+    std::vector<PlugInProxyRef> proxies{fake.install("a"), fake.install("b")};
+    const auto first = list();
+    EXPECT_EQ(list(), first);
+    database.pluginsWillUninstall({proxies[0]}); // and comes again
+    EXPECT_EQ(builds(), 2);
+    EXPECT_NE(list(), first);
+    EXPECT_EQ(builds(), 3);
+    fake.locale.setLanguages({"de", "en"});
+    list();
+    EXPECT_EQ(builds(), 5);
+    // What is left out is tried, and told of, each time.
+    auto bad = dataPlugIn("bad");
+    bad.info = support::manifestOf("com.example.bad", {});
+    fake.registry.install(bad);
+    for (const int expected : {6, 7}) {
+        EXPECT_EQ(found(std::nullopt), (Names{"a", "b"}));
+        EXPECT_EQ(builds(), expected);
+    }
+}
+
 TEST_F(Database, UninstalledPlugInsHaveTheirInstancesEnded) {
     fake.serviceManager.allow();
     fake.serviceManager.holdAnswers();

@@ -115,6 +115,50 @@ TEST_F(Discovery, AnAnswerThatNoMessageHoldsIsAnError) {
     EXPECT_EQ(daemon.ask("match"), errorReply(4, "the matching plug-ins are too many for one reply"));
 }
 
+TEST_F(Discovery, WhatIsAskedAgainFollowsEveryChange) {
+    for (const char* category : {"cx", "sandbox"}) support::processLog.setLevel(category, info);
+    const auto version = [this](int number, const char* text) {
+        return described(number, {{"VKExtensionAttributes", Dictionary{{"VKExtensionVersion", text}}}});
+    };
+    const auto expect = [this](const Dictionary& rules, const char* expected) {
+        for (int time = 0; time < 3; ++time) EXPECT_EQ(answer(0, rules), expected) << time;
+    };
+    const Dictionary newer{{"VKExtensionVersion", Array{">1.9", "=0.1"}}};
+    fake.sandbox.interval = std::chrono::hours(1);
+    install({version(1, "1.10"), version(2, "1.2"), version(3, "2")});
+    for (int number = 1; number <= 3; ++number) {
+        fake.sandbox.allowFile(pathOf(number));
+        fake.sandbox.services.insert("com.example." + std::to_string(number));
+    }
+    expect(newer, "13");
+    install({version(2, "0.01")});
+    expect(newer, "123");
+    hold(3);
+    expect(newer, "12");
+    // Tokens serve for a while, and others are asked for where one was refused. Annotations serve until they change.
+    const auto issues = fake.sandbox.issues;
+    expect({}, "12");
+    EXPECT_EQ(fake.sandbox.issues, issues);
+    const Dictionary elected{{"VKUserElection", "1"}};
+    expect(elected, "");
+    for (const auto& uuids : {Array{uuid(1)}, Array{uuid(2)}}) {
+        fake.sandbox.services.erase("com.example.2");
+        daemon.ask("annotate", {{"uuids", uuids}, {"annotations", Dictionary{{"election", 1}}}});
+    }
+    expect(elected, "12");
+    EXPECT_EQ(forms()[0].dictionary()->dictionary("annotations"), (Dictionary{{"election", 1}}));
+    EXPECT_FALSE(forms()[1].dictionary()->contains("service-extension"));
+    fake.sandbox.services.insert("com.example.2");
+    EXPECT_TRUE(forms()[1].dictionary()->contains("service-extension"));
+    // The log tells of what nobody understands each time, for each plug-in.
+    const auto lines = [] {
+        return std::ranges::count(support::processLog.messages("ops"), "unrecognized match operator:?X");
+    };
+    expect({{"VKExtensionVersion", "?X"}}, "");
+    EXPECT_EQ(lines(), 6);
+    for (const char* category : {"cx", "sandbox"}) support::processLog.setLevel(category, debug);
+}
+
 TEST_F(Discovery, FormsCarryWhatAnnotationRequestsChange) {
     install({described(1)});
     const Dictionary bad = errorReply(4, "invalid request format (annotation extension)");
