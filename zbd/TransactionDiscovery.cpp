@@ -40,7 +40,7 @@ std::string_view textOf(const Value& value) { return value.string().value_or("")
 /// A candidate as the log shows it.
 struct Listing {
     explicit Listing(const ZBDPlugInRef& candidate) : kept(candidate->keptForm()) {
-        if (!kept) made = candidate->listing(kept);
+        if (!kept) made = candidate->listing();
     }
     operator std::string_view() const { return kept ? kept->listing : made; } // NOLINT(google-explicit-constructor)
 

@@ -180,9 +180,7 @@ bool ZBDPlugIn::isComplete(const KeptForm& kept, const FormCompletion& now) cons
 
 bool ZBDPlugIn::requiresEntitlement() const { return static_cast<bool>(pluginKey(manifest::hostEntitlement)); }
 
-std::string ZBDPlugIn::listing(const KeptFormRef& kept) const {
-    return kept ? kept->listing : platform::format("%@(%@) %@", identifier(), version(), uuidText());
-}
+std::string ZBDPlugIn::listing() const { return platform::format("%@(%@) %@", identifier(), version(), uuidText()); }
 
 MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFormRef& known) const {
     if (known) return MutableDictionary::extending(known->form);
@@ -202,7 +200,7 @@ MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFor
               .tokens = tokenNeeds(),
               .version = version,
               .facts = {*identifier().string(), version.string(), onSystemVolume(), lastModified()},
-              .listing = listing(nullptr),
+              .listing = listing(),
               .isContained = isContained(),
               .isDedicated = isDedicated(),
               .requiresEntitlement = requiresEntitlement(),

@@ -93,8 +93,8 @@ public:
     platform::MutableDictionary currentForm(platform::Failure* error, const KeptFormRef& kept) const;
     platform::MutableDictionary currentForm(platform::Failure* error) const { return currentForm(error, keptForm()); }
 
-    /// Identifier, version and UUID, as lists in the log show them. `kept` is what `keptForm` has just answered.
-    std::string listing(const KeptFormRef& kept) const;
+    /// Identifier, version and UUID, as lists in the log show them.
+    std::string listing() const;
 
     // ZBDPlugInTokens.cpp
 
