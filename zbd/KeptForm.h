@@ -51,8 +51,7 @@ struct KeptForm {
     platform::Dictionary manifest; // the one it was made from
     platform::Dictionary form;     // with its encoding, and with the annotations and tokens of the last answer
     TokenNeeds tokens;
-    platform::Value version;
-    ReductionFacts facts; // its texts are those of the record and of `version`
+    ReductionFacts facts; // its texts are those of the record and of the form
     std::string listing;  // what lists of candidates in the log show
     bool isContained = false;
     bool isDedicated = false;

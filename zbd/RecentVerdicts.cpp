@@ -15,9 +15,10 @@ namespace {
 constexpr std::size_t maximumEntries = 16;
 constexpr std::size_t maximumRules = 4096; // bytes; hosts choose them
 
+/// One that compares: types conform as another service says, and of unknown operators the log tells for each plug-in.
 bool isPlainPattern(const Value& pattern) {
     const auto text = pattern.string();
-    return text && matchComparison(*text).test != MatchTest::unrecognized; // which the log tells of for each plug-in
+    return text && !text->starts_with('?');
 }
 
 /// Whether the same manifest always gives the same verdict, and nothing is logged on the way.
@@ -32,7 +33,8 @@ bool isJudgedByManifest(const MatchRule& rule) {
 
 RecentVerdicts::Verdicts RecentVerdicts::verdictsOn(const ZBDPlugIns& candidates, const Dictionary& rules,
                                                     const MatchRules& prepared, const std::optional<UUID>& knowledge) {
-    if (!knowledge) return nullptr;
+    // A list that nobody else has is made for this request alone.
+    if (!knowledge || candidates.use_count() == 1) return nullptr;
     const auto known = std::ranges::find_if(_entries, [&](const Entry& entry) {
         return entry.knowledge == *knowledge && entry.candidates.lock() == candidates && entry.rules == rules;
     });

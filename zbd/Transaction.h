@@ -4,6 +4,7 @@
 #include "platform/Transport.h"
 #include "zbd/ZBDatabase.h"
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>

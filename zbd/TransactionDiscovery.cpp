@@ -150,8 +150,8 @@ void Transaction::matchPlugIns() {
         .flags = flags,
         .rules = MatchRules(rules, types),
         .exclusions = readExclusions(server()->userPrefs().exclusions(), types),
-        .isRestricted = static_cast<bool>(_client->entitlementValueForKey(zembra::entitlement::allowedPlugIns)),
-        .hasHolds = server()->hasHolds(),
+        .isRestricted = false,
+        .hasHolds = false,
         .verdicts = nullptr,
     };
     ZBDPlugIns candidates = server()->findPlugIns(rules);
@@ -159,7 +159,12 @@ void Transaction::matchPlugIns() {
     platform::trace::discoverRaw(static_cast<unsigned>(candidates->size()));
     logCandidates(*candidates);
     candidates = preferBundleRelativeForHost(candidates);
-    if (rules && !candidates->empty()) {
+    if ((flags & zembra::ZBDiscoverAll) == 0 && !candidates->empty()) {
+        selection.isRestricted =
+            static_cast<bool>(_client->entitlementValueForKey(zembra::entitlement::allowedPlugIns));
+        selection.hasHolds = server()->hasHolds();
+    }
+    if (rules) {
         selection.verdicts = server()->recentVerdicts().verdictsOn(candidates, *rules, selection.rules,
                                                                    server()->platform().registry.knowledgeUUID());
     }

@@ -4,7 +4,9 @@
 #include "platform/PropertyList.h"
 #include "platform/Url.h"
 
+#include <atomic>
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <span>

@@ -194,12 +194,12 @@ MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFor
     const auto [number, isAgain] = _recentForms->countMade(_lastMade);
     _lastMade = number;
     if (!manifest || !isAgain || !mayKeepForms()) return form;
-    const Value version = this->version();
+    const Dictionary kept = form.keepingEncoding();
+    const auto version = this->version() ? kept.string(zembra::formKey::version) : std::nullopt;
     keepForm({.manifest = *manifest,
-              .form = form.keepingEncoding(),
+              .form = kept,
               .tokens = tokenNeeds(),
-              .version = version,
-              .facts = {*identifier().string(), version.string(), onSystemVolume(), lastModified()},
+              .facts = {*identifier().string(), version, onSystemVolume(), lastModified()},
               .listing = listing(),
               .isContained = isContained(),
               .isDedicated = isDedicated(),

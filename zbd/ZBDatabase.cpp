@@ -241,7 +241,10 @@ ZBDPlugIns ZBDatabase::findPlugIns(const std::optional<Dictionary>& query) {
 
 ZBDPlugIns ZBDatabase::recordsFor(const PlugInProxies& proxies) {
     const auto known = std::ranges::find(_answers, proxies, &Answer::proxies);
-    if (known != _answers.end()) return known->records;
+    if (known != _answers.end()) {
+        _answers.splice(_answers.begin(), _answers, known);
+        return known->records;
+    }
     std::vector<ZBDPlugInRef> plugIns;
     plugIns.reserve(proxies->size());
     bool isOrdered = true; // mostly so, and then thousands of records need not be looked at again
@@ -257,7 +260,8 @@ ZBDPlugIns ZBDatabase::recordsFor(const PlugInProxies& proxies) {
     // What was left out is tried, and told of, each time; so is what has no UUID. Making a record may have emptied the
     // cache.
     const bool areAll = records->size() == proxies->size() && records->size() <= _cache.size();
-    if (!areAll || !isOrdered) return records;
+    const bool willComeAgain = proxies.use_count() > 1; // the registry has it too
+    if (!areAll || !isOrdered || !willComeAgain) return records;
     _answers.push_front({proxies, records});
     if (_answers.size() > maximumAnswers) _answers.pop_back();
     return records;

@@ -113,7 +113,7 @@ private:
         platform::PlugInProxies proxies;
         ZBDPlugIns records; // all of them cached
     };
-    std::list<Answer> _answers; // the last made one first
+    std::list<Answer> _answers; // the last used one first
     const std::shared_ptr<RecentForms> _recentForms = std::make_shared<RecentForms>();
     std::unique_ptr<platform::LocaleObservation> _regionObserver;
 };

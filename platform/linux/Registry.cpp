@@ -178,8 +178,10 @@ public:
 
     std::shared_ptr<const Languages> languages() {
         auto preferred = _locale.languages();
+        std::list<Answer> outdated; // goes after the lock
         const std::lock_guard lock(_madeMutex);
         if (!_languages || _languages->preferred != preferred) {
+            outdated.swap(_answers);
             auto order = searchOrder(preferred);
             _languages = std::make_shared<const Languages>(
                 Languages{std::move(preferred), std::move(order), _languages ? _languages->generation + 1 : 1});
@@ -188,7 +190,9 @@ public:
     }
 
     void clearSchemaCaches() {
+        std::list<Answer> outdated;
         const std::lock_guard lock(_madeMutex);
+        outdated.swap(_answers);
         if (!_languages) return;
         auto renewed = std::make_shared<Languages>(*_languages);
         ++renewed->generation;
@@ -339,13 +343,15 @@ private:
     /// From now on answers come from `snapshot`. Answers the observers that hear of it: those who came before.
     Observers show(std::shared_ptr<const RegistrySnapshot> snapshot) {
         _needsVerifying.store(_bundles.needsVerifying(), std::memory_order_relaxed);
+        Observers observers;
+        std::list<Answer> outdated; // they would keep what is gone
         {
             const std::lock_guard lock(_madeMutex);
-            _answers.clear(); // they would keep what is gone
+            const std::lock_guard inner(_mutex);
+            _snapshot.swap(snapshot);
+            outdated.swap(_answers);
         }
-        Observers observers;
         const std::lock_guard lock(_mutex);
-        _snapshot.swap(snapshot);
         releaseAnswers();
         for (const auto& weak : _observers) {
             if (auto observer = weak.lock()) observers.push_back(std::move(observer));
@@ -446,6 +452,8 @@ private:
     void keepAnswer(const std::vector<InstalledPlugInRef>& plugIns, Answer answer) {
         if (!isWorthKeeping(answer.tests)) return;
         const std::lock_guard lock(_madeMutex);
+        // Those who ask now do not ask what is gone.
+        if (answer.languages != _languages->generation || answer.snapshot.lock() != snapshot()) return;
         // A proxy that was not kept is to be made anew for each answer.
         for (std::size_t i = 0; i < plugIns.size(); ++i) {
             if (plugIns[i]->proxy.object != (*answer.proxies)[i]) return;
@@ -518,7 +526,7 @@ private:
     std::atomic<Stage> _stage = Stage::stored; // how far the snapshot tells what is on disk
     std::condition_variable _stageReached;
 
-    mutable std::mutex _madeMutex; // for everything that was made of records; innermost, too
+    mutable std::mutex _madeMutex; // for everything that was made of records; only `_mutex` is locked inside it
     std::shared_ptr<const Languages> _languages;
     std::list<Answer> _answers;            // the last used one first
     std::set<std::string> _containersLeft; // identifiers of plug-ins that are gone

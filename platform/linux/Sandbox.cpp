@@ -33,7 +33,7 @@ constexpr std::chrono::seconds resolutionLifetime{5};
 /// nothing.
 constexpr std::chrono::milliseconds lookLifetime{20};
 
-/// Who keeps a token with what the registry says of its bundle hears sooner than this that the bundle was replaced.
+/// Who keeps a token longer looks more seldom; what the registry watches it hears sooner that it was replaced.
 constexpr std::chrono::milliseconds repeatLifetime{100};
 
 bool isName(const std::string& text) {

@@ -109,17 +109,13 @@ public:
         const std::lock_guard lock(_mutex);
         _observers.push_back(std::move(observer));
     }
-    platform::PlugInProxies installedPlugIns() override {
-        if (called("installedPlugIns")) return nullptr;
-        const std::lock_guard lock(_mutex);
-        if (!_listed) _listed = std::make_shared<const Proxies>(_plugIns);
-        return _listed;
-    }
+    platform::PlugInProxies installedPlugIns() override { return called("installedPlugIns") ? nullptr : listed(); }
     /// Leaves the query to the caller: everything that passes the filter, which is the largest allowed answer.
     platform::PlugInProxies plugInsMatching(const Dictionary&, const Filter& filter) override {
         if (called("plugInsMatching")) return nullptr;
-        return std::make_shared<const Proxies>(those(
-            [&](const Proxy& one) { return !filter || filter(one.plugInIdentifier.value_or(""), one.entitlements); }));
+        if (!filter) return listed();
+        return std::make_shared<const Proxies>(
+            those([&](const Proxy& one) { return filter(one.plugInIdentifier.value_or(""), one.entitlements); }));
     }
     PlugInProxyRef plugInForUUID(const UUID& uuid) override {
         return called("plugInForUUID") ? nullptr : first([&](const Proxy& one) { return one.uuid == uuid; });
@@ -159,6 +155,11 @@ public:
     }
 
 private:
+    platform::PlugInProxies listed() {
+        const std::lock_guard lock(_mutex);
+        if (!_listed) _listed = std::make_shared<const Proxies>(_plugIns);
+        return _listed;
+    }
     template <class T> T get(const T& member) const {
         const std::lock_guard lock(_mutex);
         return member;
