@@ -72,6 +72,15 @@ std::string StoredDictionary::encoded() const {
     return bytes;
 }
 
+std::optional<std::string_view> StoredDictionary::findIn(const Value& encoded,
+                                                         std::initializer_list<std::string_view> names) {
+    auto found = encoded.data();
+    for (const auto name : names) {
+        if (found) found = findEncoded(*found, name);
+    }
+    return found;
+}
+
 Value StoredDictionary::find(std::initializer_list<std::string_view> names) const {
     Value value = content();
     if (!value.data()) {
@@ -81,13 +90,27 @@ Value StoredDictionary::find(std::initializer_list<std::string_view> names) cons
         }
         return value;
     }
-    auto encoded = value.data();
-    for (const auto name : names) {
-        encoded = findEncoded(*encoded, name);
-        if (!encoded) return {};
-    }
+    const auto encoded = findIn(value, names);
+    if (!encoded) return {};
     auto decoded = decodeCompact(*encoded, UUIDs::refused, maximumManifestNesting);
     return decoded ? *std::move(decoded) : Value();
+}
+
+bool StoredDictionary::visitTexts(std::initializer_list<std::string_view> names, const Visit& visit) const {
+    const Value content = this->content();
+    const auto encoded = findIn(content, names);
+    const auto encodedText = encoded ? encodedString(*encoded) : std::nullopt;
+    if (encodedText) {
+        visit(*encodedText);
+        return true;
+    }
+    if (content.data() && !encoded) return false;
+    const Value value = find(names);
+    if (const auto text = value.string()) visit(*text);
+    for (const Value& element : value.array().value_or(Array())) {
+        if (const auto text = element.string()) visit(*text);
+    }
+    return static_cast<bool>(value);
 }
 
 } // namespace platform::linux_

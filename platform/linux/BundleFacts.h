@@ -6,9 +6,11 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <initializer_list>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -51,9 +53,14 @@ public:
     /// The value under `names[0]`, in that the one under `names[1]` and so on; absent when there is none. Decodes
     /// nothing else, and keeps nothing.
     Value find(std::initializer_list<std::string_view> names) const;
+    using Visit = std::function<void(std::string_view text)>;
+    /// Calls `visit` with that value if it is a string, and with each string in it if it is an array. False when it is
+    /// absent. Makes no value of a string, for this is asked of every manifest.
+    bool visitTexts(std::initializer_list<std::string_view> names, const Visit& visit) const;
 
 private:
     Value content() const;
+    static std::optional<std::string_view> findIn(const Value& encoded, std::initializer_list<std::string_view> names);
 
     SharedStrings& _strings;
     const Keeps _keeps;

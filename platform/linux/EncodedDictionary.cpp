@@ -41,9 +41,9 @@ public:
     }
     std::uint32_t takeSize() {
         const auto piece = take(sizeof(std::uint32_t));
-        std::uint32_t size = 0;
-        for (std::size_t i = piece.size(); i > 0; --i) size = (size << 8U) | static_cast<std::uint8_t>(piece[i - 1]);
-        return size;
+        if (piece.empty()) return 0;
+        const auto byte = [&](std::size_t i) { return std::uint32_t{static_cast<std::uint8_t>(piece[i])}; };
+        return byte(0) | (byte(1) << 8U) | (byte(2) << 16U) | (byte(3) << 24U); // one load instead of a loop
     }
     std::string_view takeValue() {
         const auto start = _left;
@@ -73,6 +73,12 @@ std::optional<std::string_view> findEncoded(std::string_view dictionary, std::st
         if (name == key) return value;
     }
     return std::nullopt;
+}
+
+std::optional<std::string_view> encodedString(std::string_view value) {
+    Pieces pieces(value);
+    if (pieces.takeTag() != stringTag) return std::nullopt;
+    return pieces.take(pieces.takeSize());
 }
 
 } // namespace platform::linux_

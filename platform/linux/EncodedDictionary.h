@@ -10,4 +10,7 @@ namespace platform::linux_ {
 /// bytes an answer may be damaged too; it lies within them.
 std::optional<std::string_view> findEncoded(std::string_view dictionary, std::string_view key);
 
+/// The text of the encoding of a string; none for one of another kind.
+std::optional<std::string_view> encodedString(std::string_view value);
+
 } // namespace platform::linux_

@@ -1,6 +1,7 @@
 #include "platform/linux/RegistryQuery.h"
 
 #include <algorithm>
+#include <functional>
 #include <optional>
 
 namespace platform::linux_ {
@@ -70,23 +71,18 @@ std::vector<EqualityTest> equalityTests(const Dictionary& query) {
     return tests;
 }
 
-std::vector<std::string> valuesForEquality(const InstalledPlugIn& plugIn, const std::string& key) {
-    if (key == identifierKey && plugIn.identifier) return {normalizedForEquality(*plugIn.identifier)};
-    if (key == uuidKey) return {normalizedForEquality(plugIn.uuid.text())};
+std::uint32_t hashForEquality(std::string_view text) {
+    const std::hash<std::string_view> hash;
+    // Few texts have zeros that could be dropped.
+    const bool isNormal = text.find('0') == std::string_view::npos;
+    return static_cast<std::uint32_t>(isNormal ? hash(text) : hash(normalizedForEquality(text)));
+}
 
+void visitForEquality(const InstalledPlugIn& plugIn, const std::string& key, const StoredDictionary::Visit& visit) {
+    if (key == identifierKey && plugIn.identifier) return visit(*plugIn.identifier);
+    if (key == uuidKey) return visit(plugIn.uuid.text());
     const StoredDictionary& info = *plugIn.facts->info;
-    Value value = info.find({"VKExtension", "VKExtensionAttributes", key});
-    if (!value) value = info.find({key});
-
-    std::vector<std::string> values;
-    if (const auto text = value.string()) values.push_back(normalizedForEquality(*text));
-    for (const Value& element : value.array().value_or(Array())) {
-        if (const auto text = element.string()) values.push_back(normalizedForEquality(*text));
-    }
-    std::ranges::sort(values);
-    const auto doubles = std::ranges::unique(values);
-    values.erase(doubles.begin(), doubles.end());
-    return values;
+    if (!info.visitTexts({"VKExtension", "VKExtensionAttributes", key}, visit)) info.visitTexts({key}, visit);
 }
 
 } // namespace platform::linux_

@@ -3,6 +3,7 @@
 #include "platform/PropertyList.h"
 #include "platform/linux/RegistryRecord.h"
 
+#include <cstdint>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -25,7 +26,11 @@ struct EqualityTest {
 /// The entries of a query that are plain equality.
 std::vector<EqualityTest> equalityTests(const Dictionary& query);
 
-/// The normalized texts of a plug-in with which a test of `key` compares. Nothing of its manifest is kept decoded.
-std::vector<std::string> valuesForEquality(const InstalledPlugIn& plugIn, const std::string& key);
+/// The same for two texts whose normalized forms are.
+std::uint32_t hashForEquality(std::string_view text);
+
+/// Calls `visit` with the texts of a plug-in with which a test of `key` compares. Nothing of its manifest is kept
+/// decoded.
+void visitForEquality(const InstalledPlugIn& plugIn, const std::string& key, const StoredDictionary::Visit& visit);
 
 } // namespace platform::linux_

@@ -3,7 +3,6 @@
 #include "platform/linux/DirectoryFiles.h"
 
 #include <algorithm>
-#include <functional>
 #include <iterator>
 
 namespace platform::linux_ {
@@ -23,8 +22,6 @@ bool isWorthKeeping(const std::vector<EqualityTest>& tests) {
     }
     return size <= maximumKeptQuestion;
 }
-
-std::uint32_t hashOf(const std::string& value) { return static_cast<std::uint32_t>(std::hash<std::string>()(value)); }
 
 } // namespace
 
@@ -102,11 +99,14 @@ std::shared_ptr<const RegistrySnapshot::Index> RegistrySnapshot::indexFor(const 
     if (auto known = _indexes.find(key)) return known;
     auto index = std::make_shared<Index>();
     index->reserve(_plugIns.size());
-    for (std::uint32_t position = 0; position < _plugIns.size(); ++position) {
-        for (const auto& value : valuesForEquality(*_plugIns[position], key))
-            index->push_back({hashOf(value), position});
+    // By their paths, for so they lie in memory after a start.
+    for (const std::uint32_t position : _byPath) {
+        visitForEquality(*_plugIns[position], key,
+                         [&](std::string_view text) { index->push_back({hashForEquality(text), position}); });
     }
     std::ranges::sort(*index);
+    const auto doubles = std::ranges::unique(*index);
+    index->erase(doubles.begin(), doubles.end());
     index->shrink_to_fit();
     _indexes.keep(key, index);
     return index;
@@ -123,7 +123,7 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
     for (const auto& test : tests) {
         Answer answer{indexFor(test.key), {}, 0};
         for (const auto& value : test.values) {
-            const auto run = std::ranges::equal_range(*answer.index, hashOf(value), {}, &Posting::hash);
+            const auto run = std::ranges::equal_range(*answer.index, hashForEquality(value), {}, &Posting::hash);
             answer.size += run.size();
             if (!run.empty()) answer.runs.emplace_back(run.begin(), run.end());
         }
