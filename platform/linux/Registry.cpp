@@ -37,8 +37,8 @@ using Stage = InstalledBundles::Stage;
 /// Candidates of one query that are looked at for it alone. Of more the registry's thread soon knows, too.
 constexpr std::size_t maximumLooks = 500;
 
-/// Milliseconds in which the first hosts ask for plug-ins that are known already, and need not share the processor with
-/// the look at the disk. Whoever needs that one ends the delay.
+/// Milliseconds before each look at the disk in which hosts are answered from what is known already, and need not share
+/// the processor with the look. Whoever needs that one ends the delay.
 constexpr int startDelay = 100;
 
 /// Answers kept for those who ask again. Hosts choose the questions.
@@ -164,7 +164,7 @@ public:
     /// the bundles is not, theirs are looked at here.
     std::vector<InstalledPlugInRef> matching(const std::vector<EqualityTest>& tests) {
         if (!tests.empty() && _stage.load(std::memory_order_acquire) < Stage::verified) {
-            wake();
+            want(Stage::glanced);
             auto plugIns = snapshot()->matching(tests); // meanwhile the other thread looks
             awaitStage(Stage::glanced);
             const auto isUnchanged = [&](const auto& plugIn) { return _bundles.isUnchanged(*plugIn); };
@@ -272,7 +272,7 @@ public:
                 done.set_value();
             });
         }
-        wake();
+        want(Stage::watched);
         done.get_future().wait();
     }
 
@@ -297,9 +297,17 @@ private:
         return answer;
     }
 
+    /// The thread is to go on to `stage` without delay.
+    void want(Stage stage) {
+        Stage wanted = _wanted.load();
+        while (wanted < stage && !_wanted.compare_exchange_weak(wanted, stage)) {
+        }
+        wake();
+    }
+
     void awaitStage(Stage stage) {
         if (_stage.load(std::memory_order_acquire) >= stage) return;
-        wake();
+        want(stage);
         std::unique_lock lock(_mutex);
         _stageReached.wait(lock, [&] { return _stage.load(std::memory_order_relaxed) >= stage; });
     }
@@ -315,15 +323,22 @@ private:
         (void)!write(_wake.get(), &one, sizeof one);
     }
 
+    /// Returns after `timeout` milliseconds, or when something happened on disk. Negative for no time-out.
+    void awaitWake(int timeout) {
+        pollfd waiting[] = {{_wake.get(), POLLIN, 0}, {_bundles.descriptor(), POLLIN, 0}};
+        (void)poll(waiting, 2, timeout);
+        std::uint64_t count = 0;
+        (void)!read(_wake.get(), &count, sizeof count);
+    }
+
     void run() {
-        pollfd wanted{_wake.get(), POLLIN, 0};
-        (void)poll(&wanted, 1, startDelay);
-        while (_bundles.stage() < Stage::watched && !isStopping()) publish(_bundles.catchUp());
+        while (_bundles.stage() < Stage::watched && !isStopping()) {
+            if (_wanted.load() <= _bundles.stage()) awaitWake(startDelay);
+            if (!isStopping()) publish(_bundles.catchUp());
+        }
+        wake(); // for actions that ended a delay
         while (true) {
-            pollfd waiting[] = {{_bundles.descriptor(), POLLIN, 0}, {_wake.get(), POLLIN, 0}};
-            (void)poll(waiting, 2, -1);
-            std::uint64_t count = 0;
-            (void)!read(_wake.get(), &count, sizeof count);
+            awaitWake(-1);
             std::vector<std::function<void()>> actions;
             bool isStopping = false;
             {
@@ -525,6 +540,7 @@ private:
     bool _isStopping = false;
     std::atomic<Stage> _stage = Stage::stored; // how far the snapshot tells what is on disk
     std::condition_variable _stageReached;
+    std::atomic<Stage> _wanted = Stage::stored; // how far somebody waits for
 
     mutable std::mutex _madeMutex; // for everything that was made of records; only `_mutex` is locked inside it
     std::shared_ptr<const Languages> _languages;
