@@ -1,6 +1,7 @@
 #include "platform/linux/RegistryStore.h"
 
 #include "platform/linux/Descriptor.h"
+#include "platform/linux/HeapGrowth.h"
 
 #include <cstring>
 #include <fcntl.h>
@@ -86,10 +87,13 @@ public:
     /// None for NULL. Good until the next row is read.
     std::optional<std::string_view> bytes() {
         const int column = _column++;
-        if (sqlite3_column_type(_statement, column) == SQLITE_NULL) return std::nullopt;
         const void* bytes = sqlite3_column_blob(_statement, column);
-        const auto size = static_cast<std::size_t>(sqlite3_column_bytes(_statement, column));
-        return bytes == nullptr ? std::string_view() : std::string_view(static_cast<const char*>(bytes), size);
+        if (bytes != nullptr) {
+            const auto size = static_cast<std::size_t>(sqlite3_column_bytes(_statement, column));
+            return std::string_view(static_cast<const char*>(bytes), size);
+        }
+        if (sqlite3_column_type(_statement, column) == SQLITE_NULL) return std::nullopt;
+        return std::string_view();
     }
     std::string text() { return std::string(bytes().value_or(std::string_view())); }
     std::optional<std::string> optionalText() {
@@ -180,6 +184,9 @@ Failure RegistryStore::read(Contents& contents) {
         while ((code = sqlite3_step(statement.get())) == SQLITE_ROW) take(Row(statement.get()));
         return code == SQLITE_DONE;
     };
+    std::error_code ignored; // then there is little to read, or nothing
+    const auto size = std::filesystem::file_size(_path, ignored);
+    const HeapGrowth growth(ignored ? 0 : size + size / 2); // about what the records take up
     // In the order of the rows, which is nearly that of the paths, so that most go to the end of their map: the order
     // of the paths would take a look-up of each row by its index.
     const bool isRead =
@@ -199,7 +206,7 @@ Failure RegistryStore::read(Contents& contents) {
              }) &&
         rows("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements, "
              "uuid, identifier, originalIdentifier, registered, application FROM plugIn",
-             [&](Row row) {
+             [&, application = contents.applications.cbegin()](Row row) mutable {
                  auto plugIn = std::make_shared<InstalledPlugIn>();
                  plugIn->path = row.text();
                  plugIn->facts = row.facts(_strings, StoredDictionary::Keeps::whatWasAskedFor);
@@ -207,11 +214,14 @@ Failure RegistryStore::read(Contents& contents) {
                  plugIn->identifier = row.optionalText();
                  plugIn->originalIdentifier = row.optionalText();
                  plugIn->registered = Date{row.real()};
-                 if (const auto path = row.optionalText()) {
-                     const auto found = contents.applications.find(*path);
+                 if (const auto path = row.bytes()) {
+                     // Mostly that of the row before, or the next one.
+                     if (application != contents.applications.end() && application->first != *path) ++application;
+                     if (application == contents.applications.end() || application->first != *path)
+                         application = contents.applications.find(std::string(*path));
                      // Without its application the row tells nothing; the scan reads the bundle again.
-                     if (found == contents.applications.end()) return;
-                     plugIn->application = found->second;
+                     if (application == contents.applications.end()) return;
+                     plugIn->application = application->second;
                  }
                  if (!uuid) return;
                  plugIn->uuid = *uuid;
