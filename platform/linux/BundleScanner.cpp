@@ -21,10 +21,6 @@ constexpr std::int64_t nanoseconds = 1'000'000'000;
 
 std::int64_t inNanoseconds(const statx_timestamp& time) { return time.tv_sec * nanoseconds + time.tv_nsec; }
 
-template <class T> void append(std::string& bytes, const T& value) {
-    bytes.append(reinterpret_cast<const char*>(&value), sizeof value);
-}
-
 std::uint64_t digest(std::string_view bytes) {
     const std::string hash = sha1(bytes);
     std::uint64_t value = 0;
@@ -59,21 +55,24 @@ class BundleScanner::FileStates {
 public:
     /// Of the file at `path` below `directory`, or of `directory` itself when that is empty.
     DirectoryIdentity add(Look look, int directory, const std::string& path) {
-        std::string& states = look == Look::cursory ? _cursory : _others;
+        std::uint64_t& states = look == Look::cursory ? _cursory : _others;
         constexpr int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_EMPTY_PATH;
         struct statx status{};
         if (statx(directory, path.c_str(), flags, STATX_BASIC_STATS | STATX_BTIME, &status) != 0) {
-            states += "absent";
+            mix(states, "absent");
             return {};
         }
         const DirectoryIdentity identity{(std::uint64_t{status.stx_dev_major} << 32U) | status.stx_dev_minor,
                                          status.stx_ino,
                                          (status.stx_mask & STATX_BTIME) != 0 ? inNanoseconds(status.stx_btime) : 0};
         const std::int64_t changed = inNanoseconds(status.stx_ctime);
-        append(states,
-               std::array{identity.device, identity.inode, static_cast<std::uint64_t>(identity.birth),
-                          std::uint64_t{status.stx_size}, static_cast<std::uint64_t>(inNanoseconds(status.stx_mtime)),
-                          static_cast<std::uint64_t>(changed)});
+        const std::array state{identity.device,
+                               identity.inode,
+                               static_cast<std::uint64_t>(identity.birth),
+                               std::uint64_t{status.stx_size},
+                               static_cast<std::uint64_t>(inNanoseconds(status.stx_mtime)),
+                               static_cast<std::uint64_t>(changed)};
+        mix(states, {reinterpret_cast<const char*>(state.data()), sizeof state});
         // A file that changes twice within one tick of its clock shows one time for both. Whole seconds are the ticks
         // of old file systems.
         const std::int64_t tick = changed % nanoseconds == 0 ? 2 * nanoseconds : nanoseconds / 10;
@@ -84,7 +83,7 @@ public:
     /// Of a string table in `directory`, whose own state, which would tell of another name, is not looked at.
     void addTable(int directory, const std::string& name) {
         add(Look::thorough, directory, name);
-        _others += name;
+        mix(_others, name);
     }
 
     /// Of what every bundle of that kind has. Answers the identity of the bundle's directory.
@@ -100,23 +99,25 @@ public:
     /// As `BundleFacts::evidence`.
     std::uint64_t evidence() const {
         if (_isRecent) return 0;
-        return std::max<std::uint64_t>((hash(_cursory) << 32U) | (hash(_others) & 0xffff'ffffU), 1);
+        return std::max<std::uint64_t>((_cursory << 32U) | (_others & 0xffff'ffffU), 1);
     }
 
     bool agreesWith(std::uint64_t evidence, Look look) const {
         if (_isRecent) return false;
         return look == Look::thorough ? evidence == this->evidence()
-                                      : evidence >> 32U == (hash(_cursory) & 0xffff'ffffU);
+                                      : evidence >> 32U == (_cursory & 0xffff'ffffU);
     }
 
 private:
     // Not `digest`: tens of thousands are made at a start. One that another release hashed otherwise is no harm, for
     // then the bundle is read again.
-    static std::uint64_t hash(const std::string& bytes) { return std::hash<std::string>()(bytes); }
+    static void mix(std::uint64_t& states, std::string_view state) {
+        states = states * 0x9e37'79b9'7f4a'7c15 + std::hash<std::string_view>()(state);
+    }
 
     const std::int64_t _start = fileClock();
-    std::string _cursory;
-    std::string _others;
+    std::uint64_t _cursory = 0; // digests
+    std::uint64_t _others = 0;
     bool _isRecent = false;
 };
 

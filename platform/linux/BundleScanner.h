@@ -77,7 +77,13 @@ private:
         int directory;
         const std::string& name; // empty for the open directory itself
         const std::string& path;
-        std::string below(const std::string& file) const { return name.empty() ? file : name + "/" + file; }
+        std::string below(std::string_view file) const {
+            std::string below;
+            below.reserve(name.size() + 1 + file.size());
+            if (!name.empty()) below.append(name).append(1, '/');
+            below.append(file);
+            return below;
+        }
     };
     static bool isUnchanged(const Place& place, BundleKind kind, const BundleFacts& known, Look look,
                             const Watch& watch);
