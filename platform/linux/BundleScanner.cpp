@@ -104,8 +104,7 @@ public:
 
     bool agreesWith(std::uint64_t evidence, Look look) const {
         if (_isRecent) return false;
-        return look == Look::thorough ? evidence == this->evidence()
-                                      : evidence >> 32U == (_cursory & 0xffff'ffffU);
+        return look == Look::thorough ? evidence == this->evidence() : evidence >> 32U == (_cursory & 0xffff'ffffU);
     }
 
 private:
@@ -172,6 +171,12 @@ bool BundleScanner::isUnchanged(const std::string& path, BundleKind kind, const 
     const Descriptor directory = openDirectory(path);
     return directory && isUnchanged({directory.get(), std::string(), path}, kind, known, Look::thorough,
                                     [](int, const std::string&) {});
+}
+
+std::uint64_t BundleScanner::listingEvidence(int directory) {
+    FileStates states;
+    states.add(Look::cursory, directory, {});
+    return states.evidence();
 }
 
 ScannedBundle BundleScanner::scan(int directory, const std::string& path, BundleKind kind,

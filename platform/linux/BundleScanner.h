@@ -70,6 +70,10 @@ public:
     static bool isUnchanged(int directory, const std::string& name, BundleKind kind, const BundleFacts& known,
                             Look look);
 
+    /// A digest of the state of an open directory, which differs when another name came to be in it, or one went. 0
+    /// when that cannot be told yet.
+    static std::uint64_t listingEvidence(int directory);
+
 private:
     class FileStates;
     /// A bundle by a path below an open directory, and by its name for `watch`.

@@ -84,6 +84,7 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     _plugIns = std::move(contents.plugIns);
     _registrations = std::move(contents.registrations);
     _exclusions = std::move(contents.exclusions);
+    _listings = std::move(contents.listings);
     _isKnowledgeUnsaved = !contents.knowledge;
     _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
     if (start == Start::watched || !contents.knowledge) rescan({everything}, Manifests::settled);
@@ -172,15 +173,38 @@ InstalledBundles::Places InstalledBundles::changedPlaces(Look look) const {
     return changed;
 }
 
+/// The names of the directories in a folder, sorted: what is known, where nothing came or went since. None when it
+/// cannot be read.
+std::optional<std::vector<std::string>> InstalledBundles::directoriesIn(int directory, const Folder& folder) const {
+    const std::uint64_t evidence = lookUp(_listings, folder.path);
+    if (evidence == 0 || evidence != BundleScanner::listingEvidence(directory)) {
+        auto listing = listDirectory(directory);
+        return listing ? std::optional(std::move(listing->directories)) : std::nullopt;
+    }
+    std::vector<std::string> names;
+    const std::string prefix = folder.path + "/";
+    const auto add = [&](const auto& known) {
+        for (auto next = known.lower_bound(prefix); next != known.end() && next->first.starts_with(prefix); ++next) {
+            if (next->first.find('/', prefix.size()) == std::string::npos)
+                names.push_back(next->first.substr(prefix.size()));
+        }
+        return static_cast<std::ptrdiff_t>(names.size());
+    };
+    const auto applications = add(_applications);
+    add(_listings);
+    std::ranges::inplace_merge(names, names.begin() + applications);
+    return names;
+}
+
 void InstalledBundles::compareFolder(int directory, const Folder& folder, std::size_t depth, Look look,
                                      Places& changed) const {
-    const auto listing = listDirectory(directory);
+    const auto listing = directoriesIn(directory, folder);
     if (!listing) {
         changed.insert(folder.path);
         return;
     }
     const std::string prefix = folder.path + "/";
-    const auto& names = listing->directories;
+    const auto& names = *listing;
     const auto compareUnknown = [&](const std::string& name) {
         const bool isPlain = folder.kind == FolderKind::applications && !isApplicationName(name);
         if (isPlain && depth >= maximumFolderDepth) return;
@@ -356,17 +380,23 @@ void InstalledBundles::scanPlace(const std::string& place, Found& found) {
 void InstalledBundles::scanFolder(int directory, const std::string& path, FolderKind kind, std::size_t depth,
                                   Found& found) {
     _watcher.watch(directory, path, RegistryWatcher::Role::content);
+    const std::uint64_t evidence = BundleScanner::listingEvidence(directory);
+    bool isEachKnown = true;
     for (const auto& name : directoriesIn(directory)) {
         const Descriptor entry = open(directory, name);
-        if (!entry) continue;
         const std::string entryPath = path + "/" + name;
-        if (kind == FolderKind::plugIns)
+        if (!entry) {
+            isEachKnown = false;
+        } else if (kind == FolderKind::plugIns) {
             scanPlugIn(entry.get(), entryPath, {}, found);
-        else if (isApplicationName(entryPath))
+        } else if (isApplicationName(entryPath)) {
             scanApplication(entry.get(), entryPath, found);
-        else if (depth < maximumFolderDepth)
+            isEachKnown = isEachKnown && found.applications.contains(entryPath);
+        } else if (depth < maximumFolderDepth) {
             scanFolder(entry.get(), entryPath, kind, depth + 1, found);
+        }
     }
+    if (kind == FolderKind::applications) found.listings[path] = isEachKnown ? evidence : 0;
 }
 
 void InstalledBundles::scanApplication(int directory, const std::string& path, Found& found) {
@@ -512,6 +542,7 @@ InstalledBundles::Change InstalledBundles::takeIn(const Places& places, const Fo
             _unsavedExclusions.insert(path);
         }
     }
+    takeInListings(places, found);
     Change change;
     change.isChanged = takeInApplications(places, found);
     takeInPlugIns(places, found, change);
@@ -523,6 +554,20 @@ InstalledBundles::Change InstalledBundles::takeIn(const Places& places, const Fo
         _isKnowledgeUnsaved = true;
     }
     return change;
+}
+
+void InstalledBundles::takeInListings(const Places& places, const Found& found) {
+    for (const auto& place : places) {
+        for (const auto& path : pathsBelow(_listings, place)) {
+            if (found.listings.contains(path)) continue;
+            _listings.erase(path);
+            _unsavedListings.insert(path);
+        }
+    }
+    for (const auto& [path, evidence] : found.listings) {
+        const auto [known, isNew] = _listings.try_emplace(path, evidence);
+        if (isNew || std::exchange(known->second, evidence) != evidence) _unsavedListings.insert(path);
+    }
 }
 
 bool InstalledBundles::takeInApplications(const Places& places, const Found& found) {
@@ -725,7 +770,7 @@ void InstalledBundles::identify(std::vector<std::shared_ptr<InstalledPlugIn>> ad
 
 void InstalledBundles::save() {
     if (_unsavedApplications.empty() && _unsavedPlugIns.empty() && _unsavedRegistrations.empty() &&
-        _unsavedExclusions.empty() && !_isKnowledgeUnsaved)
+        _unsavedExclusions.empty() && _unsavedListings.empty() && !_isKnowledgeUnsaved)
         return;
     const auto failure = _store.change([&] {
         for (const auto& path : _unsavedApplications) {
@@ -744,6 +789,10 @@ void InstalledBundles::save() {
             const auto exclusion = _exclusions.find(path);
             _store.setExcluded(path, exclusion == _exclusions.end() ? std::nullopt : std::optional(exclusion->second));
         }
+        for (const auto& path : _unsavedListings) {
+            const auto listing = _listings.find(path);
+            _store.setListing(path, listing == _listings.end() ? std::nullopt : std::optional(listing->second));
+        }
         for (const auto& removed : _unsavedRemoved) _store.remember(removed);
         for (const auto& uuid : _unsavedReturned) _store.forget(uuid);
         if (!_unsavedRemoved.empty()) _store.keepRemoved(_limits.removedPlugIns);
@@ -759,6 +808,7 @@ void InstalledBundles::save() {
     _unsavedPlugIns.clear();
     _unsavedRegistrations.clear();
     _unsavedExclusions.clear();
+    _unsavedListings.clear();
     _unsavedRemoved.clear();
     _unsavedReturned.clear();
     _isKnowledgeUnsaved = false;

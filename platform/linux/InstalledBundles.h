@@ -87,6 +87,7 @@ private:
     struct Found {
         std::map<std::string, BundleFactsRef> applications;
         std::map<std::string, FoundPlugIn> plugIns;
+        Listings listings;
     };
     enum class Manifests { settled, maybeBeingWritten };
 
@@ -97,6 +98,7 @@ private:
 
     // Comparing the disk with what is known.
     Places changedPlaces(Look look) const;
+    std::optional<std::vector<std::string>> directoriesIn(int directory, const Folder& folder) const;
     void compareFolder(int directory, const Folder& folder, std::size_t depth, Look look, Places& changed) const;
     Change compare();
 
@@ -116,6 +118,7 @@ private:
 
     // Taking in what was found.
     Change takeIn(const Places& places, const Found& found);
+    void takeInListings(const Places& places, const Found& found);
     bool takeInApplications(const Places& places, const Found& found);
     void takeInPlugIns(const Places& places, const Found& found, Change& change);
     bool repointPlugIns();
@@ -135,6 +138,7 @@ private:
     PlugIns _plugIns;
     std::set<std::string> _registrations; // registered by path; installed or awaited
     Exclusions _exclusions;               // unregistered although they lie where plug-ins are looked for
+    Listings _listings;
     Knowledge _knowledge;
     Stage _stage = Stage::stored;
 
@@ -150,6 +154,7 @@ private:
     std::set<std::string> _unsavedPlugIns;
     std::set<std::string> _unsavedRegistrations;
     std::set<std::string> _unsavedExclusions;
+    std::set<std::string> _unsavedListings;
     std::vector<RemovedPlugIn> _unsavedRemoved;
     std::vector<UUID> _unsavedReturned; // removed plug-ins that came back
     bool _isKnowledgeUnsaved = false;

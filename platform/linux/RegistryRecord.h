@@ -58,6 +58,8 @@ struct Knowledge {
 using Applications = std::map<std::string, InstalledApplicationRef>;
 using PlugIns = std::map<std::string, InstalledPlugInRef>;
 using Exclusions = std::map<std::string, DirectoryIdentity>;
+/// Each folder of applications with a digest of its state; 0 unless all that was in it is known.
+using Listings = std::map<std::string, std::uint64_t>;
 
 /// The manifest's plug-in dictionary: "VKExtension", else the older "Zembra".
 inline std::optional<Dictionary> plugInDictionary(const Dictionary& info) {

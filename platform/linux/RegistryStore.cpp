@@ -35,6 +35,13 @@ CREATE TABLE removed (
 CREATE INDEX removedPath ON removed (path);
 CREATE INDEX removedDirectory ON removed (inode, device);
 )";
+/// What files of the same version may lack.
+constexpr const char* laterSchema = R"(
+CREATE TABLE IF NOT EXISTS folder (path BLOB PRIMARY KEY, evidence INTEGER);
+CREATE TRIGGER IF NOT EXISTS applicationRemoved AFTER DELETE ON application BEGIN
+    UPDATE folder SET evidence = 0;
+END;
+)";
 
 // SQLite's integers are signed; the bits are kept.
 std::int64_t stored(std::uint64_t value) { return static_cast<std::int64_t>(value); }
@@ -167,10 +174,10 @@ Failure RegistryStore::openFile() {
     const Statement version = prepare("PRAGMA user_version");
     if (!version || sqlite3_step(version.get()) != SQLITE_ROW) return lastError();
     const int found = sqlite3_column_int(version.get(), 0);
-    if (found == schemaVersion) return std::nullopt;
+    if (found == schemaVersion) return execute(laterSchema) ? Failure() : lastError();
     if (found != 0)
         return Error{"SQLite", SQLITE_NOTADB, _path + ": written by another release (" + std::to_string(found) + ")"};
-    const bool isMade = execute("BEGIN IMMEDIATE") && execute(schema) &&
+    const bool isMade = execute("BEGIN IMMEDIATE") && execute(schema) && execute(laterSchema) &&
                         execute(("PRAGMA user_version = " + std::to_string(schemaVersion)).c_str()) &&
                         execute("COMMIT");
     return isMade ? Failure() : lastError();
@@ -227,6 +234,11 @@ Failure RegistryStore::read(Contents& contents) {
                  plugIn->uuid = *uuid;
                  const auto& path = plugIn->path;
                  contents.plugIns.emplace_hint(contents.plugIns.end(), path, plugIn);
+             }) &&
+        rows("SELECT path, evidence FROM folder",
+             [&](Row row) {
+                 auto path = row.text();
+                 contents.listings.emplace(std::move(path), row.bits());
              }) &&
         rows("SELECT path FROM registration", [&](Row row) { contents.registrations.insert(row.text()); }) &&
         rows("SELECT path, device, inode, birth FROM exclusion", [&](Row row) {
@@ -320,6 +332,11 @@ void RegistryStore::setExcluded(const std::string& path, const std::optional<Dir
     if (!identity) return run("DELETE FROM exclusion WHERE path = ?", path);
     run("INSERT OR REPLACE INTO exclusion VALUES (?, ?, ?, ?)", path, stored(identity->device), stored(identity->inode),
         identity->birth);
+}
+
+void RegistryStore::setListing(const std::string& path, const std::optional<std::uint64_t>& evidence) {
+    if (!evidence) return run("DELETE FROM folder WHERE path = ?", path);
+    run("INSERT OR REPLACE INTO folder VALUES (?, ?)", path, stored(*evidence));
 }
 
 void RegistryStore::remember(const RemovedPlugIn& removed) {

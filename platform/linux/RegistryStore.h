@@ -24,6 +24,7 @@ public:
         PlugIns plugIns;
         std::set<std::string> registrations;
         Exclusions exclusions;
+        Listings listings;
     };
 
     RegistryStore(std::string path, SharedStrings& strings);
@@ -51,6 +52,8 @@ public:
     void removePlugIn(const std::string& path);
     void setRegistered(const std::string& path, bool isRegistered);
     void setExcluded(const std::string& path, const std::optional<DirectoryIdentity>& identity);
+    /// None takes it out. (Each application that is removed sets all to 0, for of its return they would not tell.)
+    void setListing(const std::string& path, const std::optional<std::uint64_t>& evidence);
     void remember(const RemovedPlugIn& removed);
     void forget(const UUID& removed);
     /// Forgets the oldest of the removed plug-ins but for `count`.

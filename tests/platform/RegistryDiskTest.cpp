@@ -274,6 +274,7 @@ TEST(RegistryOnDisks, FirstAnswerKnowsWhatChangedWhileStopped) {
     const auto nothing = [](Disk&) {};
     const auto putHere = [&](Disk& on) { put(on.plugIn); };
     const auto putBeyond = [&](Disk& on) { put(on.two + "/PlugIns/a"); };
+    const auto putBeyondApplication = [&](Disk& on) { writeApplication(on.two), putBeyond(on); };
     const auto editWithinItsTime = [](Disk& on) {
         const auto time = fs::last_write_time(on.plugIn + "/Info.vlist");
         writeManifest(on.plugIn, infoOf("2"));
@@ -294,6 +295,15 @@ TEST(RegistryOnDisks, FirstAnswerKnowsWhatChangedWhileStopped) {
             {"new", putHere, "1N", nothing},
             {"of another kind", putHere, "1N", [](Disk& on) { writeManifest(on.plugIn, Dictionary()); }},
             {"application once none", [](Disk& on) { writeApplication(on.two); }, "1N", putBeyond},
+            {"application mended",
+             [](Disk& on) {
+                 on.start();
+                 on.settle();
+                 on.write(on.two, "no dictionary");
+                 on.registry.reset();
+                 writeApplication(on.two);
+             },
+             "1N", putBeyondApplication},
             {"first one in its application", putBeyond, "1N", [](Disk& on) { writeApplication(on.two); }},
             {"folder replaced",
              [&](Disk& on) { fs::rename(on.applications, on.away), writeApplication(on.app), putHere(on); }, "1N",
