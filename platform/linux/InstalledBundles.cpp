@@ -173,38 +173,29 @@ InstalledBundles::Places InstalledBundles::changedPlaces(Look look) const {
     return changed;
 }
 
-/// The names of the directories in a folder, sorted: what is known, where nothing came or went since. None when it
-/// cannot be read.
-std::optional<std::vector<std::string>> InstalledBundles::directoriesIn(int directory, const Folder& folder) const {
-    const std::uint64_t evidence = lookUp(_listings, folder.path);
-    if (evidence == 0 || evidence != BundleScanner::listingEvidence(directory)) {
-        auto listing = listDirectory(directory);
-        return listing ? std::optional(std::move(listing->directories)) : std::nullopt;
-    }
+/// The names of the known folders in one, sorted.
+std::vector<std::string> InstalledBundles::subfoldersOf(const std::string& prefix) const {
     std::vector<std::string> names;
-    const std::string prefix = folder.path + "/";
-    const auto add = [&](const auto& known) {
-        for (auto next = known.lower_bound(prefix); next != known.end() && next->first.starts_with(prefix); ++next) {
-            if (next->first.find('/', prefix.size()) == std::string::npos)
-                names.push_back(next->first.substr(prefix.size()));
-        }
-        return static_cast<std::ptrdiff_t>(names.size());
-    };
-    const auto applications = add(_applications);
-    add(_listings);
-    std::ranges::inplace_merge(names, names.begin() + applications);
+    for (auto next = _listings.lower_bound(prefix); next != _listings.end() && next->first.starts_with(prefix);
+         ++next) {
+        if (next->first.find('/', prefix.size()) == std::string::npos)
+            names.push_back(next->first.substr(prefix.size()));
+    }
     return names;
 }
 
 void InstalledBundles::compareFolder(int directory, const Folder& folder, std::size_t depth, Look look,
                                      Places& changed) const {
-    const auto listing = directoriesIn(directory, folder);
+    const std::string prefix = folder.path + "/";
+    const std::uint64_t evidence = lookUp(_listings, folder.path);
+    // Then all that is known is there, and beside it only subfolders: thousands of names need not be listed.
+    const bool isAsKnown = evidence != 0 && evidence == BundleScanner::listingEvidence(directory);
+    const auto listing = isAsKnown ? DirectoryListing{subfoldersOf(prefix), {}} : listDirectory(directory);
     if (!listing) {
         changed.insert(folder.path);
         return;
     }
-    const std::string prefix = folder.path + "/";
-    const auto& names = *listing;
+    const auto& names = listing->directories;
     const auto compareUnknown = [&](const std::string& name) {
         const bool isPlain = folder.kind == FolderKind::applications && !isApplicationName(name);
         if (isPlain && depth >= maximumFolderDepth) return;
@@ -226,9 +217,10 @@ void InstalledBundles::compareFolder(int directory, const Folder& folder, std::s
                 continue;
             }
             while (name != names.end() && *name < rest) compareUnknown(*name++);
-            const bool isThere = name != names.end() && *name == rest;
-            if (!isThere || !isUnchanged(*name, *known->second)) changed.insert(known->first);
-            if (isThere) ++name;
+            const bool isListed = name != names.end() && *name == rest;
+            if (isListed) ++name;
+            if (!(isListed || isAsKnown) || !isUnchanged(std::string(rest), *known->second))
+                changed.insert(known->first);
         }
         while (name != names.end()) compareUnknown(*name++);
     };

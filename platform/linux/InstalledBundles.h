@@ -98,7 +98,7 @@ private:
 
     // Comparing the disk with what is known.
     Places changedPlaces(Look look) const;
-    std::optional<std::vector<std::string>> directoriesIn(int directory, const Folder& folder) const;
+    std::vector<std::string> subfoldersOf(const std::string& prefix) const;
     void compareFolder(int directory, const Folder& folder, std::size_t depth, Look look, Places& changed) const;
     Change compare();
 

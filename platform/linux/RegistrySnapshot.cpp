@@ -94,22 +94,35 @@ void RegistrySnapshot::Recent<Question, Made>::keep(const Question& question, st
     if (_made.size() > maximumRecent) _made.pop_back();
 }
 
-std::shared_ptr<const RegistrySnapshot::Index> RegistrySnapshot::indexFor(const std::string& key) const {
+/// The index of the key of each test.
+std::vector<std::shared_ptr<const RegistrySnapshot::Index>>
+RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
     const std::lock_guard lock(_mutex); // held on: who asks for the same key meanwhile waits instead of making it too
-    if (auto known = _indexes.find(key)) return known;
-    auto index = std::make_shared<Index>();
-    index->reserve(_plugIns.size());
-    // By their paths, for so they lie in memory after a start.
-    for (const std::uint32_t position : _byPath) {
-        visitForEquality(*_plugIns[position], key,
-                         [&](std::string_view text) { index->push_back({hashForEquality(text), position}); });
+    std::vector<std::shared_ptr<const Index>> indexes;
+    std::vector<std::pair<const std::string*, std::shared_ptr<Index>>> missing;
+    for (const auto& test : tests) {
+        indexes.push_back(_indexes.find(test.key));
+        if (indexes.back()) continue;
+        const auto& made = missing.emplace_back(&test.key, std::make_shared<Index>());
+        made.second->reserve(_plugIns.size());
+        indexes.back() = made.second;
     }
-    std::ranges::sort(*index);
-    const auto doubles = std::ranges::unique(*index);
-    index->erase(doubles.begin(), doubles.end());
-    index->shrink_to_fit();
-    _indexes.keep(key, index);
-    return index;
+    if (missing.empty()) return indexes;
+    // All on one walk, and by the paths, for so the manifests lie in memory after a start.
+    for (const std::uint32_t position : _byPath) {
+        for (const auto& [key, index] : missing) {
+            visitForEquality(*_plugIns[position], *key,
+                             [&](std::string_view text) { index->push_back({hashForEquality(text), position}); });
+        }
+    }
+    for (const auto& [key, index] : missing) {
+        std::ranges::sort(*index);
+        const auto doubles = std::ranges::unique(*index);
+        index->erase(doubles.begin(), doubles.end());
+        index->shrink_to_fit();
+        _indexes.keep(*key, index);
+    }
+    return indexes;
 }
 
 RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vector<EqualityTest>& tests) const {
@@ -120,9 +133,10 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
         std::size_t size = 0;
     };
     std::vector<Answer> answers;
-    for (const auto& test : tests) {
-        Answer answer{indexFor(test.key), {}, 0};
-        for (const auto& value : test.values) {
+    const auto indexes = indexesFor(tests);
+    for (std::size_t i = 0; i < tests.size(); ++i) {
+        Answer answer{indexes[i], {}, 0};
+        for (const auto& value : tests[i].values) {
             const auto run = std::ranges::equal_range(*answer.index, hashForEquality(value), {}, &Posting::hash);
             answer.size += run.size();
             if (!run.empty()) answer.runs.emplace_back(run.begin(), run.end());

@@ -61,7 +61,7 @@ private:
         std::list<std::pair<Question, std::shared_ptr<const Made>>> _made; // the last used one first
     };
 
-    std::shared_ptr<const Index> indexFor(const std::string& key) const;
+    std::vector<std::shared_ptr<const Index>> indexesFor(const std::vector<EqualityTest>& tests) const;
     Positions positionsMatching(const std::vector<EqualityTest>& tests) const;
     static Positions positionsOf(const std::vector<Postings>& runs);
     static bool skipTo(Postings& rest, std::uint32_t position);
