@@ -335,6 +335,7 @@ private:
         while (_bundles.stage() < Stage::watched && !isStopping()) {
             if (_wanted.load() <= _bundles.stage()) awaitWake(startDelay);
             if (!isStopping()) publish(_bundles.catchUp());
+            awaitWake(0); // takes the wakes for what was done; `_wanted`, which is set before, tells of others
         }
         wake(); // for actions that ended a delay
         while (true) {
