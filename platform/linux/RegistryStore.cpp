@@ -6,6 +6,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
+#include <iterator>
 #include <span>
 #include <sqlite3.h>
 #include <utility>
@@ -222,12 +223,13 @@ Failure RegistryStore::read(Contents& contents) {
                  plugIn->originalIdentifier = row.optionalText();
                  plugIn->registered = Date{row.real()};
                  if (const auto path = row.bytes()) {
-                     // Mostly that of the row before, or the next one.
-                     if (application != contents.applications.end() && application->first != *path) ++application;
-                     if (application == contents.applications.end() || application->first != *path)
-                         application = contents.applications.find(std::string(*path));
+                     const auto end = contents.applications.cend();
+                     const auto isFound = [&] { return application != end && application->first == *path; };
+                     // Mostly it is that of the row before, or the next one.
+                     if (!isFound() && application != end) application = std::next(application);
+                     if (!isFound()) application = contents.applications.find(std::string(*path));
                      // Without its application the row tells nothing; the scan reads the bundle again.
-                     if (application == contents.applications.end()) return;
+                     if (application == end) return;
                      plugIn->application = application->second;
                  }
                  if (!uuid) return;
