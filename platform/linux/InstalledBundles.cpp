@@ -331,6 +331,7 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
         cx().error("short of descriptors or memory; bundles are looked at again later");
         _incomplete.insert(places.begin(), places.end());
         places.clear();
+        found.listings.clear(); // they may be incomplete
     } else {
         _watcher.endRound(places);
         for (const auto& place : places) _incomplete.erase(place);

@@ -40,7 +40,7 @@ CREATE INDEX removedDirectory ON removed (inode, device);
 constexpr const char* laterSchema = R"(
 CREATE TABLE IF NOT EXISTS folder (path BLOB PRIMARY KEY, evidence INTEGER);
 CREATE TRIGGER IF NOT EXISTS applicationRemoved AFTER DELETE ON application BEGIN
-    UPDATE folder SET evidence = 0;
+    UPDATE folder SET evidence = 0 WHERE evidence <> 0;
 END;
 )";
 
