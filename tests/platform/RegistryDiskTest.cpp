@@ -153,7 +153,9 @@ Dictionary infoOf(const char* version, const char* executable = "program") {
     return plugInInfo("a", {}, {{"VBBundleExecutable", executable}, {"VBBundleVersion", version}});
 }
 void writeTable(const std::string& bundle, const std::string& name, const Dictionary& strings) {
-    writeFile(bundle + "/Resources/" + name + ".vlist", *encodeXML(strings));
+    const std::string table = bundle + "/Resources/" + name;
+    writeFile(table, *encodeXML(strings));
+    fs::rename(table, table + ".vlist"); // whole, for the registry may look while it is written
 }
 void writeName(const std::string& bundle, const char* name) {
     writeTable(bundle, "en/InfoVlist", {{"VBBundleName", name}});
