@@ -9,19 +9,8 @@ namespace platform::linux_ {
 
 namespace {
 
-constexpr std::size_t maximumRecent = 16;
-
-/// Larger answers cost more to hand on than to find, and questions may be as large as a message.
-constexpr std::size_t maximumKeptAnswer = 4096;
-constexpr std::size_t maximumKeptQuestion = 4096; // bytes
-
-bool isWorthKeeping(const std::vector<EqualityTest>& tests) {
-    std::size_t size = 0;
-    for (const auto& test : tests) {
-        for (const auto& value : test.values) size += value.size() + 1;
-    }
-    return size <= maximumKeptQuestion;
-}
+/// Hosts choose the keys; an index costs eight bytes for each plug-in that has a value.
+constexpr std::size_t maximumIndexes = 16;
 
 } // namespace
 
@@ -80,18 +69,11 @@ std::vector<InstalledPlugInRef> RegistrySnapshot::plugInsOf(std::string_view app
     return answer;
 }
 
-template <class Question, class Made>
-std::shared_ptr<const Made> RegistrySnapshot::Recent<Question, Made>::find(const Question& question) {
-    const auto found = std::ranges::find(_made, question, [](const auto& entry) -> const auto& { return entry.first; });
-    if (found == _made.end()) return nullptr;
-    _made.splice(_made.begin(), _made, found);
+std::shared_ptr<const RegistrySnapshot::Index> RegistrySnapshot::knownIndex(const std::string& key) const {
+    const auto found = std::ranges::find(_indexes, key, &KeyIndex::first);
+    if (found == _indexes.end()) return nullptr;
+    _indexes.splice(_indexes.begin(), _indexes, found);
     return found->second;
-}
-
-template <class Question, class Made>
-void RegistrySnapshot::Recent<Question, Made>::keep(const Question& question, std::shared_ptr<const Made> made) {
-    _made.emplace_front(question, std::move(made));
-    if (_made.size() > maximumRecent) _made.pop_back();
 }
 
 /// The index of the key of each test.
@@ -101,7 +83,7 @@ RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
     std::vector<std::shared_ptr<const Index>> indexes;
     std::vector<std::pair<const std::string*, std::shared_ptr<Index>>> missing;
     for (const auto& test : tests) {
-        indexes.push_back(_indexes.find(test.key));
+        indexes.push_back(knownIndex(test.key));
         if (indexes.back()) continue;
         const auto& made = missing.emplace_back(&test.key, std::make_shared<Index>());
         made.second->reserve(_plugIns.size());
@@ -120,7 +102,8 @@ RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
         const auto doubles = std::ranges::unique(*index);
         index->erase(doubles.begin(), doubles.end());
         index->shrink_to_fit();
-        _indexes.keep(*key, index);
+        _indexes.emplace_front(*key, index);
+        if (_indexes.size() > maximumIndexes) _indexes.pop_back();
     }
     return indexes;
 }
@@ -195,20 +178,10 @@ bool RegistrySnapshot::skipTo(Postings& rest, std::uint32_t position) {
 
 std::vector<InstalledPlugInRef> RegistrySnapshot::matching(const std::vector<EqualityTest>& tests) const {
     if (tests.empty()) return _plugIns;
-    const bool mayKeep = isWorthKeeping(tests);
-    std::shared_ptr<const Positions> positions;
-    if (mayKeep) {
-        const std::lock_guard lock(_mutex);
-        positions = _answers.find(tests);
-    }
-    if (!positions) {
-        positions = std::make_shared<const Positions>(positionsMatching(tests));
-        const std::lock_guard lock(_mutex);
-        if (mayKeep && positions->size() <= maximumKeptAnswer) _answers.keep(tests, positions);
-    }
+    const Positions positions = positionsMatching(tests);
     std::vector<InstalledPlugInRef> plugIns;
-    plugIns.reserve(positions->size());
-    for (const auto position : *positions) plugIns.push_back(_plugIns[position]);
+    plugIns.reserve(positions.size());
+    for (const auto position : positions) plugIns.push_back(_plugIns[position]);
     return plugIns;
 }
 

@@ -33,9 +33,8 @@ public:
     std::vector<InstalledPlugInRef> plugInsOf(std::string_view applicationPath) const;
 
     /// The plug-ins that pass every one of the tests, and perhaps a few others, ordered by UUID; all of them when there
-    /// are no tests. Costs about the size of the smallest answer to one of the tests, once a key was asked for; never
-    /// more than the sizes of all together; and only its own size when the same was asked a short while ago, as hosts
-    /// do.
+    /// are no tests. Costs about the size of the smallest answer to one of the tests, once a key was asked for, and
+    /// never more than the sizes of all together.
     std::vector<InstalledPlugInRef> matching(const std::vector<EqualityTest>& tests) const;
 
 private:
@@ -50,17 +49,9 @@ private:
     using Index = std::vector<Posting>; // rising
     using Postings = std::span<const Posting>;
 
-    /// What was made for the last few questions: hosts choose these, and more of them than `maximumRecent` take turns.
-    template <class Question, class Made> class Recent {
-    public:
-        /// Null when it is not there.
-        std::shared_ptr<const Made> find(const Question& question);
-        void keep(const Question& question, std::shared_ptr<const Made> made);
+    using KeyIndex = std::pair<std::string, std::shared_ptr<const Index>>;
 
-    private:
-        std::list<std::pair<Question, std::shared_ptr<const Made>>> _made; // the last used one first
-    };
-
+    std::shared_ptr<const Index> knownIndex(const std::string& key) const;
     std::vector<std::shared_ptr<const Index>> indexesFor(const std::vector<EqualityTest>& tests) const;
     Positions positionsMatching(const std::vector<EqualityTest>& tests) const;
     static Positions positionsOf(const std::vector<Postings>& runs);
@@ -72,8 +63,7 @@ private:
     std::vector<InstalledApplicationRef> _applications; // ordered by path
 
     mutable std::mutex _mutex;
-    mutable Recent<std::string, Index> _indexes; // by key
-    mutable Recent<std::vector<EqualityTest>, Positions> _answers;
+    mutable std::list<KeyIndex> _indexes; // the last used one first
 };
 
 } // namespace platform::linux_
