@@ -21,7 +21,7 @@ struct TokenNeeds {
 /// What annotations and tokens were set with.
 struct FormCompletion {
     std::uint64_t annotationsVersion = 0; // as the annotation store counts, from 1
-    std::chrono::steady_clock::time_point time{};
+    std::chrono::steady_clock::time_point time;
 };
 
 /// When a kept form was completed last. Any thread.
@@ -42,7 +42,7 @@ public:
 
 private:
     mutable std::atomic<std::uint64_t> _annotationsVersion = 0;
-    mutable std::atomic<std::chrono::steady_clock::time_point> _time{};
+    mutable std::atomic<std::chrono::steady_clock::time_point> _time;
 };
 
 /// What of a plug-in does not change from answer to answer while its manifest stays the same, in one place: answers of
@@ -57,7 +57,7 @@ struct KeptForm {
     bool isDedicated = false;
     bool requiresEntitlement = false; // of its hosts
     bool replacesOthers = false;
-    LastCompletion lastCompletion{};
+    LastCompletion lastCompletion;
 };
 using KeptFormRef = std::shared_ptr<const KeptForm>;
 

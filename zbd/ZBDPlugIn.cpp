@@ -204,7 +204,8 @@ MutableDictionary ZBDPlugIn::currentForm(platform::Failure* error, const KeptFor
               .isContained = isContained(),
               .isDedicated = isDedicated(),
               .requiresEntitlement = requiresEntitlement(),
-              .replacesOthers = static_cast<bool>(valueForEntitlement(zembra::entitlement::replacePlugIn))});
+              .replacesOthers = static_cast<bool>(valueForEntitlement(zembra::entitlement::replacePlugIn)),
+              .lastCompletion = {}});
     _recentForms->keep(weak_from_this());
     return form;
 }
