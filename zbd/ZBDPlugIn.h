@@ -141,7 +141,12 @@ private:
     bool setupWithProxy(const platform::PlugInProxyRef& proxy);
     void refreshInfo() const;
     platform::Value currentInfo() const;
-    platform::Value valueForRule(std::string_view key) const;
+    /// Where rules look last, once a rule has looked there.
+    struct RuleFacts {
+        platform::Dictionary info;
+        platform::Dictionary attributes;
+    };
+    platform::Value valueForRule(std::string_view key, std::optional<RuleFacts>& facts) const;
     std::string userElection() const;
     const char* sandboxProfile() const;
     bool accepts(const MatchRule& rule, const platform::Value& value) const;

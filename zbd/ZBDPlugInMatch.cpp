@@ -1,4 +1,5 @@
 #include "Zembra/ZBLog.h"
+#include "Zembra/ZBManifest.h"
 #include "Zembra/ZBProtocol.h"
 #include "zbd/MatchOperators.h"
 #include "zbd/ZBDPlugIn.h"
@@ -25,18 +26,21 @@ bool ZBDPlugIn::match(const std::optional<Dictionary>& rules) const {
 }
 
 std::optional<RuleMismatch> ZBDPlugIn::mismatch(const MatchRules& rules) const {
+    std::optional<RuleFacts> facts; // looked up once for all rules: hosts may send a hundred thousand
     for (const MatchRule& rule : rules) {
-        Value value = valueForRule(*rule.key.string());
+        Value value = valueForRule(*rule.key.string(), facts);
         if (!accepts(rule, value)) return RuleMismatch{rule.key, rule.pattern, std::move(value)};
     }
     return std::nullopt;
 }
 
 bool ZBDPlugIn::matchKey(std::string_view key, const Value& pattern) const {
-    return accepts({Value(key), pattern, preparedAlternatives(pattern, _platform.typeConformance)}, valueForRule(key));
+    std::optional<RuleFacts> facts;
+    return accepts({Value(key), pattern, preparedAlternatives(pattern, _platform.typeConformance)},
+                   valueForRule(key, facts));
 }
 
-Value ZBDPlugIn::valueForRule(std::string_view key) const {
+Value ZBDPlugIn::valueForRule(std::string_view key, std::optional<RuleFacts>& facts) const {
     if (key.starts_with(ruleKey::entitlementPrefix)) {
         return valueForEntitlement(key.substr(ruleKey::entitlementPrefix.size()));
     }
@@ -45,9 +49,14 @@ Value ZBDPlugIn::valueForRule(std::string_view key) const {
     if (key == ruleKey::identifier) value = identifier();
     if (key == ruleKey::uuid) value = uuidText();
     if (key == ruleKey::userElection) value = userElection();
-    if (!value) value = attribute(key);
-    if (!value) value = infoKey(key);
-    return value;
+    if (value) return value;
+    if (!facts) {
+        const auto info = bundleInfoDictionary().value_or(Dictionary());
+        const auto declared = info.dictionary(zembra::manifest::extension).value_or(Dictionary());
+        facts = {info, declared.dictionary(zembra::manifest::attributes).value_or(Dictionary())};
+    }
+    value = facts->attributes[key];
+    return value ? value : facts->info[key];
 }
 
 std::string ZBDPlugIn::userElection() const {
@@ -57,7 +66,7 @@ std::string ZBDPlugIn::userElection() const {
 }
 
 bool ZBDPlugIn::accepts(const MatchRule& rule, const Value& value) const {
-    if (!value && rule.key == Value(ruleKey::containingApp)) return false;
+    if (!value && rule.key.string() == ruleKey::containingApp) return false;
     if (rule.pattern == Value(true)) return value && !(value == Value(false));
     if (rule.pattern == Value(false)) return !value || value == Value(false);
     if (!value) return false;

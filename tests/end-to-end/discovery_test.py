@@ -52,6 +52,26 @@ class Discovery(scratch.Case):
         table = self.zbctl(0, "match", "--all-versions", "--rules", "-", input='{"Tags": ["5"]}').stdout
         self.assertRegex(table, r"com\.example\.p +1\.2 +[0-9A-F-]{36}  - ")
 
+    def test_asked_again(self):
+        """At the usual level of the log, for forms are not kept where each is told of."""
+        self.stop()
+        self.daemon_environment["NORDANE_LOG"] = "stderr"
+        self.start()
+
+        def ask():
+            return self.match(ALL_VERSIONS, rules={"VKExtensionIdentifier": "com.example.p"})
+
+        for _ in range(4):
+            self.assertEqual(names(ask()), ["p 1.10", "p 1.2"])
+        self.request("annotate", uuids=[self.uuid(self.p)], annotations={"election": 1})
+        for _ in range(3):
+            self.assertEqual([form["annotations"] for form in ask()], [{"election": 1}] * 2)
+        scratch.write(self.p + "/Info.vlist", manifest("p", "1.3"))
+        self.until(lambda: names(ask()) == ["p 1.10", "p 1.3"], "the new version")
+        for _ in range(3):
+            self.assertEqual(names(ask()), ["p 1.10", "p 1.3"])
+        self.assertEqual(self.find(self.p)["annotations"], {"election": 1})
+
     def test_selection(self):
         manager = self.copy_of_zbctl(self.path("manager"), "-e", MANAGER)
         entitled = self.copy_of_zbctl(self.path("entitled"), "-e", "com.example.needed")
