@@ -65,12 +65,6 @@ public:
     /// Sets the form's "annotations" to what is stored for the plug-in, or to an empty dictionary.
     void addAnnotationForPlugIn(const ZBDPlugIn& plugIn, platform::MutableDictionary& form);
 
-    /// Sets the annotations and tokens of a form that `currentForm` made, unless it has those that it would get `now`.
-    void completeForm(const ZBDPlugIn& plugIn, platform::MutableDictionary& form, const KeptFormRef& kept,
-                      std::chrono::steady_clock::time_point now);
-
-    bool isComplete(const ZBDPlugIn& plugIn, const KeptForm& kept, std::chrono::steady_clock::time_point now) const;
-
     const std::shared_ptr<ZBDQmxClient>& client() const { return _client; }
     const platform::Dictionary& request() const { return _request; }
     platform::MutableDictionary& reply() { return _reply.content; }
@@ -84,6 +78,11 @@ private:
     ZBDPlugInRef findPlugInByUUID(const platform::UUID& uuid);
     ZBDPlugInRef findPlugInByPathURL(std::string_view text);
     ZBDPlugIns preferBundleRelativeForHost(const ZBDPlugIns& candidates);
+    /// Whether a form of that kept one has the annotations and tokens that it would get `now`.
+    bool isComplete(const ZBDPlugIn& plugIn, const KeptForm& kept, std::chrono::steady_clock::time_point now) const;
+    /// Sets the annotations and tokens of a form that `currentForm` made, unless it is complete.
+    void completeForm(const ZBDPlugIn& plugIn, platform::MutableDictionary& form, const KeptFormRef& kept,
+                      std::chrono::steady_clock::time_point now);
     void releaseHolds(const platform::Array& tokens);
     bool collectPlugInsToHold(std::uint64_t flags, std::vector<ZBDPlugInRef>& plugIns);
     bool mayRegister(const platform::URL& url) const;

@@ -144,30 +144,25 @@ void Transaction::matchPlugIns() {
     }
 
     platform::TypeConformance& types = server()->platform().typeConformance;
-    Selection selection{
-        .server = *server(),
-        .client = *_client,
-        .flags = flags,
-        .rules = MatchRules(rules, types),
-        .exclusions = readExclusions(server()->userPrefs().exclusions(), types),
-        .isRestricted = false,
-        .hasHolds = false,
-        .verdicts = nullptr,
-    };
+    const MatchRules prepared(rules, types);
+    auto exclusions = readExclusions(server()->userPrefs().exclusions(), types);
     ZBDPlugIns candidates = server()->findPlugIns(rules);
     if (!candidates) candidates = std::make_shared<const Candidates>();
     platform::trace::discoverRaw(static_cast<unsigned>(candidates->size()));
     logCandidates(*candidates);
     candidates = preferBundleRelativeForHost(candidates);
-    if ((flags & zembra::ZBDiscoverAll) == 0 && !candidates->empty()) {
-        selection.isRestricted =
-            static_cast<bool>(_client->entitlementValueForKey(zembra::entitlement::allowedPlugIns));
-        selection.hasHolds = server()->hasHolds();
-    }
-    if (rules) {
-        selection.verdicts = server()->recentVerdicts().verdictsOn(candidates, *rules, selection.rules,
-                                                                   server()->platform().registry.knowledgeUUID());
-    }
+    const bool isHostAsked = (flags & zembra::ZBDiscoverAll) == 0 && !candidates->empty();
+    const auto knowledge = server()->platform().registry.knowledgeUUID();
+    const Selection selection{
+        .server = *server(),
+        .client = *_client,
+        .flags = flags,
+        .rules = prepared,
+        .exclusions = std::move(exclusions),
+        .isRestricted = isHostAsked && _client->entitlementValueForKey(zembra::entitlement::allowedPlugIns),
+        .hasHolds = isHostAsked && server()->hasHolds(),
+        .verdicts = rules ? server()->recentVerdicts().verdictsOn(candidates, *rules, prepared, knowledge) : nullptr,
+    };
 
     // An older protocol has no forms in its reply, so none are too many.
     const auto fits = [&](std::size_t size) {

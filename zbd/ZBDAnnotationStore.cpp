@@ -76,12 +76,11 @@ void ZBDAnnotationStore::setAnnotations(std::span<const AnnotationChange> change
             log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, *failure);
         }
     }
-    ++_version;
+    ++_version; // also where it goes back: nobody reads meanwhile
     const auto bytes = encodedDatabase(_annotations);
     if (!bytes) {
         // Each was tried alone, so they are too large together; or the file had in it what no file of ours can hold.
         if (bytes.error().code == platform::fileWriteOutOfSpaceCode) _annotations = before;
-        ++_version;
         log::ops().error("unable to save annotations:%{public}@ error:%{public}@", _annotationsURL, bytes.error());
         return;
     }

@@ -141,10 +141,6 @@ private:
     sigset_t _before;
 };
 
-} // namespace
-
-namespace {
-
 bool isPrintable(std::string_view message, std::size_t limit) {
     return message.size() <= limit && plainLength(message) == message.size();
 }
