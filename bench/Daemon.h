@@ -2,6 +2,7 @@
 
 #include "Zembra/ZBProtocol.h"
 #include "bench/Load.h"
+#include "bench/ServiceManager.h"
 #include "platform/PropertyList.h"
 
 #include <cstdint>
@@ -51,8 +52,9 @@ inline platform::UUID uuidOf(const platform::Value& form) {
 /// A daemon on a scratch root, which logs as in service, to nowhere.
 class Daemon {
 public:
-    Daemon(const std::string& program, std::string root)
-        : _root(std::move(root)), _process({program}, {"NORDANE_ROOT=" + _root, "NORDANE_LOG=stderr"}) {}
+    Daemon(const std::string& program, std::string root, const ServiceManager& manager = {})
+        : _root(std::move(root)),
+          _process({program}, environment(manager.environment()), "/dev/null", manager.kept()) {}
     ~Daemon() {
         if (_process.stop() != 0) fail("the daemon did not end well");
     }
@@ -84,6 +86,11 @@ public:
     }
 
 private:
+    std::vector<std::string> environment(std::vector<std::string> more) const {
+        more.insert(more.end(), {"NORDANE_ROOT=" + _root, "NORDANE_LOG=stderr"});
+        return more;
+    }
+
     std::string _root;
     Process _process;
 };

@@ -23,12 +23,18 @@ namespace bench {
 
 [[noreturn]] inline void failSystem(const std::string& what) { fail(what + ": " + std::strerror(errno)); }
 
+/// A descriptor that a process is started with, as by a service manager (sd_listen_fds(3)).
+struct Passed {
+    std::string name;
+    int descriptor = -1; // negative: none
+};
+
 /// A child process that ends with this object, and with this process however that ends.
 class Process {
 public:
     /// Output of the program goes to `log`. Entries of `environment` are "NAME=value".
     Process(const std::vector<std::string>& command, const std::vector<std::string>& environment,
-            const std::string& log = "/dev/null") {
+            const std::string& log = "/dev/null", const Passed& passed = {}) {
         std::vector<char*> arguments;
         for (const auto& argument : command) arguments.push_back(const_cast<char*>(argument.c_str()));
         arguments.push_back(nullptr);
@@ -40,6 +46,14 @@ public:
         const int output = open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
         dup2(output, STDOUT_FILENO);
         dup2(output, STDERR_FILENO);
+        if (passed.descriptor >= 0) {
+            constexpr int first = 3;
+            dup2(passed.descriptor, first);
+            fcntl(first, F_SETFD, 0);
+            setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
+            setenv("LISTEN_FDS", "1", 1);
+            setenv("LISTEN_FDNAMES", passed.name.c_str(), 1);
+        }
         execvp(arguments.front(), arguments.data());
         _exit(127);
     }

@@ -49,7 +49,7 @@ std::optional<Options> parse(int argc, char** argv) {
 
 /// Ends the process without exit handlers: those of libraries take away what other threads are still using.
 [[noreturn]] void end(platform::linux_::LinuxPlatform& services, int status) {
-    services.removeNames();
+    services.leave();
     std::_Exit(status);
 }
 

@@ -2,11 +2,13 @@
 
 #include "platform/SystemLog.h"
 #include "platform/linux/DirectoryFiles.h"
+#include "platform/linux/FileStatus.h"
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <chrono>
+#include <fcntl.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
 #include <unordered_map>
@@ -26,6 +28,8 @@ constexpr std::ptrdiff_t maximumRegistrationDepth = 64;
 constexpr const char* everything = ""; // every path is below it
 /// More places than these are found sooner on a walk through everything.
 constexpr std::size_t maximumPlacesByPath = 1000;
+/// What the names of kept watches begin with. Each has another name: what one told, no other one tells.
+constexpr const char* watchPrefix = "catalix-";
 
 LogHandle& cx() {
     // The log belongs to the process and is set before the first service is made.
@@ -66,14 +70,16 @@ template <class Map> auto lookUp(const Map& map, const std::string& path) {
 
 } // namespace
 
-InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limits, Start start)
+InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limits, DescriptorStore* descriptors)
     : _top(root.directory()),
       _folders{{root.applications(), FolderKind::applications},
                {root.system() + "/Applications", FolderKind::applications},
                {root.system() + "/Library/PlugIns", FolderKind::plugIns}},
       _limits(limits),
       _store(root.database() + "/Catalix.sqlite", _strings),
-      _watcher(limits.watches),
+      _descriptors(descriptors),
+      _kept(descriptors != nullptr ? descriptors->take(watchPrefix) : DescriptorStore::Kept()),
+      _watcher(limits.watches, std::move(_kept.descriptor)),
       _scanner([this](int directory,
                       const std::string& path) { _watcher.watch(directory, path, RegistryWatcher::Role::content); },
                _strings) {
@@ -87,7 +93,46 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     _listings = std::move(contents.listings);
     _isKnowledgeUnsaved = !contents.knowledge;
     _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
-    if (start == Start::watched || !contents.knowledge) rescan({everything}, Manifests::settled);
+    if (!contents.knowledge) {
+        rescan({everything}, Manifests::settled);
+    } else if (contents.handedOver && *contents.handedOver == handedOverNow() && _watcher.isSilent()) {
+        cx().info("nothing changed on disk while the daemon was not running");
+        _stage = Stage::verified;
+    }
+}
+
+/// The watch, and the folders that are there now: it does not hear that others were mounted or moved into their place.
+HandedOver InstalledBundles::handedOverNow() const {
+    HandedOver now{_kept.name, 0};
+    for (const auto& folder : _folders) {
+        FileStatus status; // stays empty where there is none
+        (void)readFileStatus(AT_FDCWD, folder.path.c_str(), status);
+        const auto& [device, inode, seconds, nanoseconds] = status.identity;
+        for (const std::uint64_t part :
+             {device, inode, static_cast<std::uint64_t>(seconds), std::uint64_t{nanoseconds}})
+            now.folders = now.folders * 0x9e37'79b9'7f4a'7c15 + part;
+    }
+    return now;
+}
+
+/// Events are taken from now on, so what was handed over to this process holds for no later one.
+void InstalledBundles::takeOverWatch() {
+    const auto failure = _store.change([&] { _store.setHandedOver(std::nullopt); });
+    if (_descriptors == nullptr) return;
+    if (failure && !_kept.name.empty()) {
+        // Then none may have that name.
+        _descriptors->drop(_kept.name);
+        _kept.name.clear();
+    }
+    if (!_kept.name.empty()) return;
+    _kept.name = watchPrefix + UUID::random().text();
+    if (!_descriptors->keep(_kept.name, _watcher.descriptor())) _kept.name.clear();
+}
+
+void InstalledBundles::handOver() {
+    if (_stage < Stage::watched || _kept.name.empty() || !isSaved() || needsVerifying()) return;
+    // What happens from now on waits in the watch. Should this fail, the next start looks at everything.
+    (void)_store.change([&] { _store.setHandedOver(handedOverNow()); });
 }
 
 bool InstalledBundles::isUnchanged(const InstalledPlugIn& plugIn) const {
@@ -320,7 +365,10 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
         return all.contains(everything) ||
                std::ranges::any_of(ancestors(place), [&](const auto& directory) { return all.contains(directory); });
     });
-    if (places.contains(everything)) _stage = Stage::watched;
+    if (places.contains(everything)) {
+        if (_stage < Stage::watched) takeOverWatch();
+        _stage = Stage::watched;
+    }
     _manifests = manifests;
     _isShort = false;
     Found found;
@@ -761,10 +809,13 @@ void InstalledBundles::identify(std::vector<std::shared_ptr<InstalledPlugIn>> ad
     for (const auto& [path, plugIn] : gone) _unsavedRemoved.push_back(asRemoved(*plugIn));
 }
 
+bool InstalledBundles::isSaved() const {
+    return _unsavedApplications.empty() && _unsavedPlugIns.empty() && _unsavedRegistrations.empty() &&
+           _unsavedExclusions.empty() && _unsavedListings.empty() && !_isKnowledgeUnsaved;
+}
+
 void InstalledBundles::save() {
-    if (_unsavedApplications.empty() && _unsavedPlugIns.empty() && _unsavedRegistrations.empty() &&
-        _unsavedExclusions.empty() && _unsavedListings.empty() && !_isKnowledgeUnsaved)
-        return;
+    if (isSaved()) return;
     const auto failure = _store.change([&] {
         for (const auto& path : _unsavedApplications) {
             if (const auto application = lookUp(_applications, path))

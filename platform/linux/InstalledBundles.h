@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/linux/BundleScanner.h"
+#include "platform/linux/DescriptorStore.h"
 #include "platform/linux/Registry.h"
 #include "platform/linux/RegistryRecord.h"
 #include "platform/linux/RegistryStore.h"
@@ -31,21 +32,17 @@ public:
         bool isChanged = false; // anything that the registry tells about anything
     };
 
-    enum class Start {
-        watched, // what is known then is true
-        stored,  // what the database tells, when it tells anything; a few calls of `catchUp` make it true
-    };
-
     /// What was done since the start.
     enum class Stage {
-        stored,   // nothing
+        stored,   // nothing: what is known is what the database tells
         glanced,  // no plug-in came or went, and no manifest of one changed: what queries select by is true
         verified, // everything is true of the disk at the start, or later
         watched,  // and whatever changes is noticed
     };
 
-    /// Reads the database, and then, as `start` says, the disk. `root` has no symbolic links in it.
-    InstalledBundles(const Root& root, const RegistryLimits& limits, Start start = Start::watched);
+    /// Reads the database, or if that tells nothing the disk. `root` has no symbolic links in it. `descriptors`, if
+    /// any, keeps the watch, and may have kept one.
+    InstalledBundles(const Root& root, const RegistryLimits& limits, DescriptorStore* descriptors);
 
     Stage stage() const { return _stage; }
     /// Whether the plug-in's bundle, and its application's, are still on disk as they were read: for one that is asked
@@ -56,6 +53,10 @@ public:
     int descriptor() const { return _watcher.descriptor(); }
     /// Takes in everything that happened on disk until now. Before that is watched, goes one stage further or more.
     Change catchUp();
+    /// The last call: if the watch is kept, and all that was taken in is in the database, this is noted there, and the
+    /// next start needs to look at the disk only if the watch has anything to tell. What was taken in after that would
+    /// be hidden from it.
+    void handOver();
     /// Something may have changed that `catchUp` does not hear of; `verify` finds it.
     bool needsVerifying() const {
         return _stage < Stage::verified || !_watcher.unwatched().empty() || !_incomplete.empty();
@@ -124,13 +125,20 @@ private:
     bool repointPlugIns();
     void noteMoved(const std::vector<std::shared_ptr<InstalledPlugIn>>& added, Change& change) const;
     void identify(std::vector<std::shared_ptr<InstalledPlugIn>> added, const PlugIns& removed);
+    bool isSaved() const;
     void save();
+
+    // Between one process and the next.
+    HandedOver handedOverNow() const;
+    void takeOverWatch();
 
     const std::string _top;
     const std::vector<Folder> _folders;
     const RegistryLimits _limits;
     SharedStrings _strings;
     RegistryStore _store;
+    DescriptorStore* const _descriptors;
+    DescriptorStore::Kept _kept; // its name stays; empty when nobody keeps the watch
     RegistryWatcher _watcher;
     BundleScanner _scanner;
 

@@ -4,6 +4,7 @@
 #include "platform/linux/Bundles.h"
 #include "platform/linux/CodeSigning.h"
 #include "platform/linux/Containers.h"
+#include "platform/linux/DescriptorStore.h"
 #include "platform/linux/Files.h"
 #include "platform/linux/Interfaces.h"
 #include "platform/linux/Locale.h"
@@ -22,6 +23,7 @@
 #include "platform/linux/TypeConformance.h"
 #include "platform/linux/WorkQueue.h"
 
+#include <chrono>
 #include <csignal>
 #include <cstdlib>
 #include <fcntl.h>
@@ -46,7 +48,8 @@ struct LinuxPlatform::Services {
     Notifications notifications{root};
     Sandbox sandbox{root, SandboxRole::issuer};
     ServiceManager serviceManager{root, files};
-    Registry registry{root, locale, containers};
+    ServiceDescriptorStore descriptors;
+    Registry registry{root, locale, containers, {}, &descriptors};
     Transport transport{root};
     TypeConformance typeConformance{root};
     ActivationRules activationRules;
@@ -68,6 +71,9 @@ void fillStandardDescriptors() {
         if (open("/dev/null", O_RDWR | O_NOCTTY) != number) std::abort();
     }
 }
+
+/// How long the end of the process waits for the registry. Cut short, that loses nothing but time at the next start.
+constexpr std::chrono::milliseconds registryPatience{500};
 
 /// What an answer of many plug-ins took goes back to the system with it. Left alone, the allocator would take the
 /// largest one as the measure of what to hold on to.
@@ -112,9 +118,10 @@ Platform& LinuxPlatform::start() {
     return _services->platform;
 }
 
-void LinuxPlatform::removeNames() {
+void LinuxPlatform::leave() {
     _services->sandbox.removeBrokerName();
     _services->serviceManager.removeName();
+    _services->registry.stop(registryPatience);
 }
 
 } // namespace platform::linux_

@@ -18,9 +18,10 @@ public:
     /// Constructs the services: reads the registry and starts their threads. Once. The log works before.
     Platform& start();
 
-    /// Takes the process's other sockets out of the runtime directory (a listener takes its own when it is cancelled).
-    /// For the end of the process, which comes while threads still use the services.
-    void removeNames();
+    /// For the end of the process, which comes while threads still use the services: takes its other sockets out of
+    /// the runtime directory (a listener takes its own when it is cancelled), and leaves to the next process what is
+    /// known.
+    void leave();
 
 private:
     struct Services;

@@ -104,25 +104,35 @@ private:
 class Registry::Implementation {
 public:
     Implementation(const Root& root, platform::Locale& locale, platform::Containers& containers,
-                   const RegistryLimits& limits)
+                   const RegistryLimits& limits, DescriptorStore* descriptors)
         : _root(withoutLinks(root)),
           _locale(locale),
           _containers(containers),
-          _bundles(_root, limits, InstalledBundles::Start::stored),
+          _bundles(_root, limits, descriptors),
           _wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
         show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
-        _thread = startServiceThread("registry", [this] { run(); });
+        _thread = startServiceThread("registry", [this] {
+            run();
+            _bundles.handOver();
+            _ended.set_value();
+        });
         if (_thread) return;
         while (_bundles.stage() < Stage::watched) publish(_bundles.catchUp());
     }
 
     ~Implementation() {
+        stop({});
+        if (_thread) _thread->join();
+    }
+
+    void stop(std::chrono::milliseconds patience) {
         {
             const std::lock_guard lock(_mutex);
             _isStopping = true;
         }
         wake();
-        if (_thread) _thread->join();
+        // Until everything is watched there is nothing to wait for.
+        if (_thread && _stage.load() == Stage::watched) _end.wait_for(patience);
     }
 
     void addObserver(std::weak_ptr<RegistryObserver> observer) {
@@ -326,7 +336,8 @@ private:
     /// Returns after `timeout` milliseconds, or when something happened on disk. Negative for no time-out.
     void awaitWake(int timeout) {
         pollfd waiting[] = {{_wake.get(), POLLIN, 0}, {_bundles.descriptor(), POLLIN, 0}};
-        (void)poll(waiting, 2, timeout);
+        // What a kept watch has to tell is only heard when everything is watched.
+        (void)poll(waiting, _bundles.stage() < Stage::watched ? 1 : 2, timeout);
         std::uint64_t count = 0;
         (void)!read(_wake.get(), &count, sizeof count);
     }
@@ -552,11 +563,14 @@ private:
     std::atomic<bool> _isVerifyWanted = false;
     const Descriptor _wake;
     std::mutex _threadlessMutex;
+    std::promise<void> _ended;
+    const std::future<void> _end = _ended.get_future();
     std::optional<std::thread> _thread; // none when the system had no thread left: then nothing is noticed by itself
 };
 
-Registry::Registry(const Root& root, platform::Locale& locale, platform::Containers& containers, RegistryLimits limits)
-    : _implementation(std::make_unique<Implementation>(root, locale, containers, limits)) {}
+Registry::Registry(const Root& root, platform::Locale& locale, platform::Containers& containers, RegistryLimits limits,
+                   DescriptorStore* descriptors)
+    : _implementation(std::make_unique<Implementation>(root, locale, containers, limits, descriptors)) {}
 
 Registry::~Registry() = default;
 
@@ -639,5 +653,7 @@ std::optional<Dictionary> Registry::sdkDictionary(const std::string& extensionPo
 }
 
 void Registry::settle() { _implementation->settle(); }
+
+void Registry::stop(std::chrono::milliseconds patience) { _implementation->stop(patience); }
 
 } // namespace platform::linux_

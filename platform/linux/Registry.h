@@ -3,8 +3,10 @@
 #include "platform/Containers.h"
 #include "platform/Locale.h"
 #include "platform/Registry.h"
+#include "platform/linux/DescriptorStore.h"
 #include "platform/linux/Root.h"
 
+#include <chrono>
 #include <cstddef>
 #include <memory>
 
@@ -27,8 +29,11 @@ struct RegistryLimits {
 /// notices included, and are therefore a bug inside a notice.
 class Registry final : public platform::Registry {
 public:
-    /// Reads the database and brings it in line with the disk before returning. The services must outlive the registry.
-    Registry(const Root& root, platform::Locale& locale, platform::Containers& containers, RegistryLimits limits = {});
+    /// Reads the database; the disk is looked at as far as answers need it. The services must outlive the registry.
+    /// `descriptors`, if any, keeps the watch between one registry and the next, which then need not look at
+    /// everything.
+    Registry(const Root& root, platform::Locale& locale, platform::Containers& containers, RegistryLimits limits = {},
+             DescriptorStore* descriptors = nullptr);
     /// Returns when the thread has ended; a notice under way is finished, later changes are found at the next start.
     ~Registry() override;
     Registry(const Registry&) = delete;
@@ -53,6 +58,8 @@ public:
 
     /// Returns when everything that happened on disk before the call is known and its notices were given.
     void settle();
+    /// For the end of the process: nothing is taken in any more. Returns when the thread has ended, or after the time.
+    void stop(std::chrono::milliseconds patience);
 
 private:
     class Implementation;

@@ -54,6 +54,14 @@ struct Knowledge {
     std::uint64_t sequence = 0;
 };
 
+/// What a registry left to the next one that reads its database: a watch, by the name under which it is kept, that has
+/// everything to tell that the database does not.
+struct HandedOver {
+    std::string watch;
+    std::uint64_t folders = 0; // a digest of which directories bundles were looked for in
+    friend bool operator==(const HandedOver&, const HandedOver&) = default;
+};
+
 // Each ordered by path.
 using Applications = std::map<std::string, InstalledApplicationRef>;
 using PlugIns = std::map<std::string, InstalledPlugInRef>;

@@ -39,6 +39,7 @@ CREATE INDEX removedDirectory ON removed (inode, device);
 /// What files of the same version may lack.
 constexpr const char* laterSchema = R"(
 CREATE TABLE IF NOT EXISTS folder (path BLOB PRIMARY KEY, evidence INTEGER);
+CREATE TABLE IF NOT EXISTS handedOver (watch BLOB NOT NULL, folders INTEGER);
 CREATE TRIGGER IF NOT EXISTS applicationRemoved AFTER DELETE ON application BEGIN
     UPDATE folder SET evidence = 0 WHERE evidence <> 0;
 END;
@@ -242,6 +243,11 @@ Failure RegistryStore::read(Contents& contents) {
                  auto path = row.text();
                  contents.listings.emplace(std::move(path), row.bits());
              }) &&
+        rows("SELECT watch, folders FROM handedOver",
+             [&](Row row) {
+                 auto watch = row.text();
+                 contents.handedOver = HandedOver{std::move(watch), row.bits()};
+             }) &&
         rows("SELECT path FROM registration", [&](Row row) { contents.registrations.insert(row.text()); }) &&
         rows("SELECT path, device, inode, birth FROM exclusion", [&](Row row) {
             auto path = row.text();
@@ -339,6 +345,11 @@ void RegistryStore::setExcluded(const std::string& path, const std::optional<Dir
 void RegistryStore::setListing(const std::string& path, const std::optional<std::uint64_t>& evidence) {
     if (!evidence) return run("DELETE FROM folder WHERE path = ?", path);
     run("INSERT OR REPLACE INTO folder VALUES (?, ?)", path, stored(*evidence));
+}
+
+void RegistryStore::setHandedOver(const std::optional<HandedOver>& handedOver) {
+    run("DELETE FROM handedOver");
+    if (handedOver) run("INSERT INTO handedOver VALUES (?, ?)", handedOver->watch, stored(handedOver->folders));
 }
 
 void RegistryStore::remember(const RemovedPlugIn& removed) {

@@ -25,6 +25,7 @@ public:
         std::set<std::string> registrations;
         Exclusions exclusions;
         Listings listings;
+        std::optional<HandedOver> handedOver;
     };
 
     RegistryStore(std::string path, SharedStrings& strings);
@@ -54,6 +55,7 @@ public:
     void setExcluded(const std::string& path, const std::optional<DirectoryIdentity>& identity);
     /// None takes it out. (Each application that is removed sets all to 0, for of its return they would not tell.)
     void setListing(const std::string& path, const std::optional<std::uint64_t>& evidence);
+    void setHandedOver(const std::optional<HandedOver>& handedOver);
     void remember(const RemovedPlugIn& removed);
     void forget(const UUID& removed);
     /// Forgets the oldest of the removed plug-ins but for `count`.

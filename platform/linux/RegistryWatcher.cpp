@@ -10,6 +10,7 @@
 #include <sys/inotify.h>
 #include <sys/ioctl.h>
 #include <unistd.h>
+#include <utility>
 
 namespace platform::linux_ {
 
@@ -20,8 +21,13 @@ constexpr std::uint32_t contentEvents = passageEvents | IN_CLOSE_WRITE | IN_DELE
 
 } // namespace
 
-RegistryWatcher::RegistryWatcher(std::size_t limit)
-    : _limit(limit), _inotify(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {}
+RegistryWatcher::RegistryWatcher(std::size_t limit, Descriptor kept)
+    : _limit(limit), _inotify(kept ? std::move(kept) : Descriptor(inotify_init1(IN_NONBLOCK | IN_CLOEXEC))) {}
+
+bool RegistryWatcher::isSilent() const {
+    int waiting = 0;
+    return ioctl(_inotify.get(), FIONREAD, &waiting) == 0 && waiting == 0;
+}
 
 void RegistryWatcher::watch(int directory, const std::string& path, Role role) {
     const std::uint32_t events = (role == Role::content ? contentEvents : passageEvents) | IN_ONLYDIR | IN_MASK_ADD;
@@ -92,7 +98,11 @@ bool RegistryWatcher::read(std::vector<Event>& events) {
             at += sizeof event + event.len;
             if ((event.mask & IN_Q_OVERFLOW) != 0) isComplete = false;
             const auto watch = _byDescriptor.find(event.wd);
-            if (watch == _byDescriptor.end()) continue; // from before the watch was ended
+            if (watch == _byDescriptor.end()) {
+                // From before the watch was ended; or of one that was kept and that nobody wants any more.
+                inotify_rm_watch(_inotify.get(), event.wd);
+                continue;
+            }
             if ((event.mask & IN_IGNORED) != 0) {
                 forget(event.wd);
                 continue;

@@ -26,11 +26,15 @@ public:
         passage, // only entries that come and go
     };
 
-    /// Never watches more than `limit` directories.
-    explicit RegistryWatcher(std::size_t limit);
+    /// Never watches more than `limit` directories. `kept` is the descriptor of another process's watcher, or none.
+    explicit RegistryWatcher(std::size_t limit, Descriptor kept = {});
 
     /// Readable when events wait. Negative when the system has no inotify left.
     int descriptor() const { return _inotify.get(); }
+
+    /// No event waits: nothing happened in what this watcher, or the one that it was kept from, watches since that was
+    /// last read, and no event was lost.
+    bool isSilent() const;
 
     /// Watches the open directory under the name `path`, also when it is watched already.
     void watch(int directory, const std::string& path, Role role);

@@ -56,7 +56,7 @@ class Case(unittest.TestCase):
     def setUp(self):
         self.directory = self.enterContext(tempfile.TemporaryDirectory(prefix="zbd-", dir=os.path.realpath("/tmp")))
         self.environment = {name: value for name, value in os.environ.items()
-                            if not name.startswith(("NORDANE_", "LISTEN_"))}
+                            if not name.startswith(("NORDANE_", "LISTEN_", "NOTIFY_"))}
         self.environment["NORDANE_ROOT"] = self.path("")
         self.daemon_environment = {**self.environment, "NORDANE_LOG": "debug,private,stderr"}
         for below in ("Applications", "var/db", "run/nordane"):
@@ -81,11 +81,11 @@ class Case(unittest.TestCase):
 
     # The daemon.
 
-    def start(self, *options, service=SERVICE):
+    def start(self, *options, service=SERVICE, program=(ZBD,), **how):
         """Starts zbd and returns when the system accepts connections to its socket."""
         with open(self.directory + "/log", "wb") as log:
-            self.process = subprocess.Popen([ZBD, *options], stdin=subprocess.DEVNULL, stderr=log,
-                                            env=self.daemon_environment)
+            self.process = subprocess.Popen([*program, *options], stdin=subprocess.DEVNULL, stderr=log,
+                                            env=self.daemon_environment, **how)
         self.addCleanup(self.kill)
         self.addCleanup(lambda: self.process.poll() is None and self.stop())
 

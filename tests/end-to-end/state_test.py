@@ -4,6 +4,7 @@ import os
 import re
 import resource
 import shlex
+import socket
 import unittest
 from pathlib import Path
 
@@ -140,6 +141,27 @@ class State(scratch.Case):
             self.start()  # returns with the first accepted connection, while the daemon may be setting up
             self.stop()
             self.assertEqual([path for path in Path(self.path("run/nordane")).iterdir() if path.is_socket()], [])
+
+    def test_a_watch_that_the_service_manager_kept_tells_what_changed_meanwhile(self):
+        manager = self.enterContext(socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM))
+        manager.bind(self.directory + "/manager")
+        self.daemon_environment["NOTIFY_SOCKET"] = self.directory + "/manager"
+        self.start()
+        text, (watch,), _, _ = socket.recv_fds(manager, 4096, 1)
+        self.addCleanup(os.close, watch)
+        begin, name = text.decode().rsplit("=", 1)
+        self.assertEqual(begin, "FDSTORE=1\nFDNAME")
+        self.request("add", paths=[self.good])  # answered when all is watched
+        self.stop()
+        self.daemon_environment |= {"LISTEN_FDS": "1", "LISTEN_FDNAMES": name}
+        for version, is_silent in (("1.0", True), ("2.0", False), ("2.0", True)):
+            if not is_silent:
+                scratch.write(self.good + "/Info.vlist", vlist(manifest("good", version)))
+            self.start(program=("sh", "-c", 'LISTEN_PID=$$ exec "$0" "$@"', scratch.ZBD), pass_fds=[3],
+                       preexec_fn=lambda: os.dup2(watch, 3))
+            self.assertEqual(names(self.match()), ["good " + version])
+            self.request("add", paths=[self.good])  # answered when all is watched
+            self.assertEqual("nothing changed on disk while" in self.stop(), is_silent)
 
     def test_a_second_daemon_of_that_name_ends_with_the_reason(self):
         self.start()

@@ -1,6 +1,7 @@
 #include "platform/linux/BundleScanner.h"
 #include "platform/linux/Containers.h"
 #include "platform/linux/Entitlements.h"
+#include "platform/linux/InstalledBundles.h"
 #include "platform/linux/PeerProcess.h"
 #include "platform/linux/Registry.h"
 #include "platform/linux/RegistryStore.h"
@@ -64,13 +65,39 @@ private:
     Action _action;
 };
 
+/// Keeps a descriptor from one registry to the next.
+class KeepingManager final : public linux_::DescriptorStore {
+public:
+    Kept take(std::string_view prefix) override {
+        return name.starts_with(prefix) ? Kept{name, duplicate(_descriptor.get())} : Kept();
+    }
+    bool keep(const std::string& given, int descriptor) override {
+        name = given;
+        _descriptor = duplicate(descriptor);
+        return true;
+    }
+    void drop(const std::string& dropped) override {
+        if (dropped == name) forget();
+    }
+    void forget() {
+        name.clear();
+        _descriptor.reset();
+    }
+
+    std::string name;
+
+private:
+    static linux_::Descriptor duplicate(int descriptor) { return linux_::Descriptor(dup(descriptor)); }
+    linux_::Descriptor _descriptor;
+};
+
 /// The registry of a root, and what happens there.
 struct Disk {
     explicit Disk(const std::string& place = "/tmp") : scratch(place) { fs::create_directories(applications); }
 
     void start() {
         registry.reset();
-        registry.emplace(linux_::Root(scratch.path()), locale, containers);
+        registry.emplace(linux_::Root(scratch.path()), locale, containers, linux_::RegistryLimits(), &manager);
         observer->registry = &*registry;
         registry->addObserver(observer);
     }
@@ -140,6 +167,7 @@ struct Disk {
     const std::string two = applications + "/folder/Two.app";
     const std::string plugIn = inApp("a.appex");
     const std::string away = scratch / "away";
+    KeepingManager manager;
     FakeLocale locale;
     linux_::Containers containers{linux_::Root(scratch.path())};
     const std::shared_ptr<Observer> observer = std::make_shared<Observer>();
@@ -282,8 +310,8 @@ TEST(RegistryOnDisks, FirstAnswerKnowsWhatChangedWhileStopped) {
         writeManifest(on.plugIn, infoOf("2"));
         fs::last_write_time(on.plugIn + "/Info.vlist", time);
     };
-    // By identifier, and by UUID or, where there was none, among all.
-    for (const bool isByIdentifier : {true, false}) {
+    // By identifier, and by UUID or, where there was none, among all; with a watch that was kept and without.
+    for (const auto& [isByIdentifier, isKept] : {std::pair(true, true), {true, false}, {false, true}, {false, false}}) {
         const std::vector<Change> changes{
             {"nothing", nothing, "1N"},
             {"deleted", [](Disk& on) { fs::remove_all(on.plugIn); }, "none"},
@@ -316,9 +344,12 @@ TEST(RegistryOnDisks, FirstAnswerKnowsWhatChangedWhileStopped) {
         }
         for (const auto& change : changes) change.disk->stop(); // the files of all get old at once
         for (const auto& [what, make, answer, before, disk] : changes) {
-            SCOPED_TRACE(what + (isByIdentifier ? ", by identifier" : ""));
+            SCOPED_TRACE(what + (isByIdentifier ? ", by identifier" : "") + (isKept ? ", kept" : ""));
             make(*disk);
+            if (!isKept) disk->manager.forget();
+            processLog.clear();
             disk->start();
+            EXPECT_EQ(logged(LogLevel::info, "nothing changed on disk", "cx"), isKept && what == "nothing");
             std::string found = "none";
             for (const auto& proxy : isByIdentifier ? disk->matching("a")
                                      : before       ? *disk->registry->installedPlugIns()
@@ -332,6 +363,51 @@ TEST(RegistryOnDisks, FirstAnswerKnowsWhatChangedWhileStopped) {
             EXPECT_EQ(disk->registry->knowledgeUUID() == disk->knowledge, what == "nothing");
         }
     }
+}
+
+/// The first registry has all at hand that it was told by a watch; the second one decides whether to believe it.
+TEST_F(RegistryOnDisk, WatchIsBelievedOnlyIfItIsTheOneThatWasHandedOver) {
+    using linux_::InstalledBundles;
+    using Stage = InstalledBundles::Stage;
+    writeApplication(app, {"a"});
+    const linux_::Root root(scratch.path());
+    const ScratchDirectory aside;
+    linux_::RegistryLimits limits;
+    const auto made = [&] { return std::make_unique<InstalledBundles>(root, limits, &manager); };
+    const auto watched = [&] {
+        auto bundles = made();
+        while (bundles->stage() < Stage::watched) bundles->catchUp();
+        return bundles;
+    };
+    const auto next = [&] { return made()->stage(); };
+    const auto nothing = [](InstalledBundles&) {};
+    const std::vector<std::tuple<std::string, std::function<void(InstalledBundles&)>, Action, Stage>> cases{
+        {"handed over", [](auto& bundles) { bundles.handOver(); }, [] {}, Stage::verified},
+        {"ended without that", nothing, [] {}, Stage::stored},
+        {"something was not taken in",
+         [&](auto& bundles) { writeFile(app + "/PlugIns/a.appex/x", ""), bundles.handOver(); }, [] {}, Stage::stored},
+        {"another watch", [](auto& bundles) { bundles.handOver(); }, [&] { manager.name += "x"; }, Stage::stored},
+        {"none", [](auto& bundles) { bundles.handOver(); }, [&] { manager.forget(); }, Stage::stored},
+        // No watch hears of what happens above the root.
+        {"other folders", [](auto& bundles) { bundles.handOver(); },
+         [&] {
+             fs::rename(root.directory(), aside.path() + "/root");
+             fs::copy(aside.path() + "/root", root.directory(), fs::copy_options::recursive);
+         },
+         Stage::stored},
+    };
+    for (const auto& [what, end, meanwhile, stage] : cases) {
+        end(*watched());
+        meanwhile();
+        EXPECT_EQ(next(), stage) << what;
+        EXPECT_EQ(next(), stage) << what << ": as long as nothing was taken in";
+    }
+    watched()->handOver();
+    (void)watched();
+    EXPECT_EQ(next(), Stage::stored) << "it holds for one";
+    limits.watches = 3;
+    watched()->handOver();
+    EXPECT_EQ(next(), Stage::stored) << "not all is watched";
 }
 
 TEST_F(RegistryOnDisk, RegistrationByPath) {
