@@ -2,6 +2,7 @@
 
 #include "platform/linux/EncodedDictionary.h"
 
+#include <algorithm>
 #include <functional>
 #include <vector>
 
@@ -11,6 +12,8 @@ namespace {
 
 /// What is longer is a text for people, and stands in one manifest only.
 constexpr std::size_t maximumSharedString = 64;
+/// What is no longer met is gone after as many others.
+constexpr unsigned maximumCount = 16;
 
 } // namespace
 
@@ -37,9 +40,16 @@ Value SharedStrings::shareLocked(const Value& value) {
     }
     const auto text = value.string();
     if (!text || text->size() > maximumSharedString) return value;
-    Value& known = _strings[std::hash<std::string_view>()(*text) % _strings.size()];
-    if (known.string() != text) known = value;
-    return known;
+    auto& [known, count] = _strings[std::hash<std::string_view>()(*text) % _strings.size()];
+    if (known.string() == text) {
+        count = std::min(count + 1, maximumCount);
+        return known;
+    }
+    if (count > 0)
+        --count;
+    else
+        known = value;
+    return value;
 }
 
 Value StoredDictionary::content() const {

@@ -28,10 +28,15 @@ private:
     Dictionary shareLocked(const Dictionary& dictionary);
     Value shareLocked(const Value& value);
 
+    /// A text at the place that its hash names. Each time it is met again counts against one time that another one
+    /// would take its place: what many manifests hold stays, whatever each of them has for itself.
+    struct Known {
+        Value text;
+        unsigned count = 0;
+    };
+
     std::mutex _mutex;
-    /// Each text at the place that its hash names, where a later one takes over. So what many manifests hold is mostly
-    /// there, and what strangers make up does not stay.
-    std::array<Value, 4096> _strings;
+    std::array<Known, 4096> _strings;
 };
 
 /// A dictionary of a bundle, in its compact encoding until somebody asks for it: most are never looked at. Any thread.

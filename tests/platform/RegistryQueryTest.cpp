@@ -43,6 +43,24 @@ bool accepts(const InstalledPlugIn& plugIn, const Dictionary& query) {
     });
 }
 
+TEST(StoredDictionary, WhatManyHoldIsHeldOnceAmongAnyNumberOfOtherTexts) {
+    std::vector<std::unique_ptr<StoredDictionary>> all;
+    for (int i = 0; i < 10'000; ++i) {
+        MutableDictionary content{{"own", "text " + std::to_string(i)}};
+        for (int key = 0; key < 10; ++key) content.set(std::to_string(key), "common " + std::to_string(key));
+        std::string encoded;
+        appendCompact(encoded, content);
+        all.push_back(std::make_unique<StoredDictionary>(encoded, strings, StoredDictionary::Keeps::whatWasAskedFor));
+        (void)all.back()->dictionary();
+    }
+    const auto addressIn = [](const StoredDictionary& stored, const std::string& key) {
+        return stored.dictionary().string(key)->data();
+    };
+    // The first ones may meet a text that is about to go.
+    for (int key = 0; key < 10; ++key)
+        EXPECT_EQ(addressIn(*all[5'000], std::to_string(key)), addressIn(*all.back(), std::to_string(key))) << key;
+}
+
 TEST(RegistrySnapshot, MatchingLeavesOutNothingThatMatches) {
     const std::vector<std::string> keys{"k1", "k2", "k3", "VKExtensionIdentifier", "VKExtensionPointIdentifier"};
     const std::vector<std::string> texts{"a",    "A",   "",    "1",    "01",   "10", "0",   "00",  "1.0", "1.00",
