@@ -79,40 +79,56 @@ std::shared_ptr<const RegistrySnapshot::Index> RegistrySnapshot::knownIndex(cons
 /// The index of the key of each test.
 std::vector<std::shared_ptr<const RegistrySnapshot::Index>>
 RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
+    /// An index that nobody has made yet.
+    struct Missing {
+        const std::string* key;
+        std::shared_ptr<Index> index;
+        std::vector<std::pair<std::uint32_t, std::uint32_t>> pairs; // a hash and a position
+    };
     const std::lock_guard lock(_mutex); // held on: who asks for the same key meanwhile waits instead of making it too
     std::vector<std::shared_ptr<const Index>> indexes;
-    std::vector<std::pair<const std::string*, std::shared_ptr<Index>>> missing;
+    std::vector<Missing> missing;
     for (const auto& test : tests) {
         indexes.push_back(knownIndex(test.key));
         if (indexes.back()) continue;
-        const auto& made = missing.emplace_back(&test.key, std::make_shared<Index>());
-        made.second->reserve(_plugIns.size());
-        indexes.back() = made.second;
+        auto& made = missing.emplace_back(&test.key, std::make_shared<Index>());
+        made.pairs.reserve(_plugIns.size());
+        indexes.back() = made.index;
     }
     if (missing.empty()) return indexes;
     // All on one walk, and by the paths, for so the manifests lie in memory after a start.
     for (const std::uint32_t position : _byPath) {
-        for (const auto& [key, index] : missing) {
+        for (auto& [key, index, pairs] : missing) {
             visitForEquality(*_plugIns[position], *key,
-                             [&](std::string_view text) { index->push_back({hashForEquality(text), position}); });
+                             [&](std::string_view text) { pairs.emplace_back(hashForEquality(text), position); });
         }
     }
-    for (const auto& [key, index] : missing) {
-        std::ranges::sort(*index);
-        const auto doubles = std::ranges::unique(*index);
-        index->erase(doubles.begin(), doubles.end());
-        index->shrink_to_fit();
+    for (auto& [key, index, pairs] : missing) {
+        std::ranges::sort(pairs);
+        const auto doubles = std::ranges::unique(pairs);
+        pairs.erase(doubles.begin(), doubles.end());
+        index->hashes.reserve(pairs.size());
+        index->positions.reserve(pairs.size());
+        for (const auto& [hash, position] : pairs) {
+            index->hashes.push_back(hash);
+            index->positions.push_back(position);
+        }
         _indexes.emplace_front(*key, index);
         if (_indexes.size() > maximumIndexes) _indexes.pop_back();
     }
     return indexes;
 }
 
+RegistrySnapshot::Run RegistrySnapshot::Index::run(std::uint32_t hash) const {
+    const auto found = std::ranges::equal_range(hashes, hash);
+    return Run(positions).subspan(static_cast<std::size_t>(found.begin() - hashes.begin()), found.size());
+}
+
 RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vector<EqualityTest>& tests) const {
-    /// What passes one test: a run of postings, rising by position, for each of its values.
+    /// What passes one test: a run for each of its values.
     struct Answer {
         std::shared_ptr<const Index> index;
-        std::vector<Postings> runs;
+        std::vector<Run> runs;
         std::size_t size = 0;
     };
     std::vector<Answer> answers;
@@ -120,43 +136,50 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsMatching(const std::vecto
     for (std::size_t i = 0; i < tests.size(); ++i) {
         Answer answer{indexes[i], {}, 0};
         for (const auto& value : tests[i].values) {
-            const auto run = std::ranges::equal_range(*answer.index, hashForEquality(value), {}, &Posting::hash);
+            const Run run = answer.index->run(hashForEquality(value));
             answer.size += run.size();
-            if (!run.empty()) answer.runs.emplace_back(run.begin(), run.end());
+            if (!run.empty()) answer.runs.push_back(run);
         }
         if (answer.runs.empty()) return {};
         answers.push_back(std::move(answer));
     }
     std::ranges::sort(answers, {}, &Answer::size);
-    Positions positions = positionsOf(answers.front().runs);
+    const Answer& smallest = answers.front();
+    Positions positions;
+    Run left = smallest.runs.front(); // of what passes all tests so far
+    if (smallest.runs.size() > 1 || answers.size() == 1) left = positions = positionsOf(smallest.runs, smallest.size);
     for (const auto& other : std::span(answers).subspan(1)) {
-        // Few are looked for in each run. Many would be walked for each run again, so one is made of these first.
-        const bool areFew = other.runs.size() == 1 || positions.size() * other.runs.size() <= other.size;
         Positions both;
-        if (areFew) {
-            std::vector<char> isIn(positions.size());
-            for (Postings rest : other.runs) {
-                for (std::size_t i = 0; i < positions.size(); ++i) {
-                    if (skipTo(rest, positions[i])) isIn[i] = 1;
+        if (other.runs.size() == 1) {
+            Run rest = other.runs.front();
+            for (const auto position : left) {
+                if (skipTo(rest, position)) both.push_back(position);
+            }
+        } else if (left.size() * other.runs.size() <= other.size) {
+            // Few are looked for in each run. Many would be walked for each run again.
+            std::vector<char> isIn(left.size());
+            for (Run rest : other.runs) {
+                for (std::size_t i = 0; i < left.size(); ++i) {
+                    if (skipTo(rest, left[i])) isIn[i] = 1;
                 }
             }
-            for (std::size_t i = 0; i < positions.size(); ++i) {
-                if (isIn[i] != 0) both.push_back(positions[i]);
+            for (std::size_t i = 0; i < left.size(); ++i) {
+                if (isIn[i] != 0) both.push_back(left[i]);
             }
         } else {
-            std::ranges::set_intersection(positions, positionsOf(other.runs), std::back_inserter(both));
+            std::ranges::set_intersection(left, positionsOf(other.runs, other.size), std::back_inserter(both));
         }
-        positions = std::move(both);
+        left = positions = std::move(both);
     }
     return positions;
 }
 
-/// Rising, each once: several values, or several elements of one, may name the same plug-in.
-RegistrySnapshot::Positions RegistrySnapshot::positionsOf(const std::vector<Postings>& runs) {
+/// Rising, each once: several values, or several elements of one, may name the same plug-in. `size` is that of all
+/// runs.
+RegistrySnapshot::Positions RegistrySnapshot::positionsOf(const std::vector<Run>& runs, std::size_t size) {
     Positions positions;
-    for (const auto& run : runs) {
-        for (const auto& posting : run) positions.push_back(posting.position);
-    }
+    positions.reserve(size);
+    for (const Run run : runs) positions.insert(positions.end(), run.begin(), run.end());
     if (!std::ranges::is_sorted(positions)) std::ranges::sort(positions);
     const auto doubles = std::ranges::unique(positions);
     positions.erase(doubles.begin(), doubles.end());
@@ -165,15 +188,13 @@ RegistrySnapshot::Positions RegistrySnapshot::positionsOf(const std::vector<Post
 
 /// Leaves out what lies before `position`, in steps that double: answers of like sizes are walked side by side, and of
 /// a long one most is never looked at. True when `position` comes next.
-bool RegistrySnapshot::skipTo(Postings& rest, std::uint32_t position) {
+bool RegistrySnapshot::skipTo(Run& rest, std::uint32_t position) {
     std::size_t step = 1;
-    while (step < rest.size() && rest[step].position < position) step *= 2;
+    while (step < rest.size() && rest[step] < position) step *= 2;
     const auto end = rest.begin() + static_cast<std::ptrdiff_t>(std::min(step + 1, rest.size()));
-    const auto next =
-        std::lower_bound(rest.begin() + static_cast<std::ptrdiff_t>(std::min(step / 2, rest.size())), end, position,
-                         [](const Posting& posting, std::uint32_t wanted) { return posting.position < wanted; });
-    rest = {next, rest.end()};
-    return !rest.empty() && rest.front().position == position;
+    const auto begin = rest.begin() + static_cast<std::ptrdiff_t>(std::min(step / 2, rest.size()));
+    rest = {std::lower_bound(begin, end, position), rest.end()};
+    return !rest.empty() && rest.front() == position;
 }
 
 std::vector<InstalledPlugInRef> RegistrySnapshot::matching(const std::vector<EqualityTest>& tests) const {

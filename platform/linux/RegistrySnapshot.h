@@ -39,23 +39,24 @@ public:
 
 private:
     using Positions = std::vector<std::uint32_t>; // in `_plugIns`
-    /// A plug-in under one of its values for a key. The value by its hash alone: it takes a tenth of the memory, and
-    /// two values with one hash make an answer larger, never smaller.
-    struct Posting {
-        std::uint32_t hash;
-        std::uint32_t position;
-        friend auto operator<=>(const Posting&, const Posting&) = default;
+    using Run = std::span<const std::uint32_t>;   // positions, rising
+    /// The plug-ins under each of their values for a key. The values by their hashes alone: these take a tenth of the
+    /// memory, and two values with one hash make an answer larger, never smaller. Two arrays side by side, each pair of
+    /// elements once and rising: the positions of one value lie close together.
+    struct Index {
+        std::vector<std::uint32_t> hashes;
+        Positions positions;
+
+        Run run(std::uint32_t hash) const;
     };
-    using Index = std::vector<Posting>; // rising
-    using Postings = std::span<const Posting>;
 
     using KeyIndex = std::pair<std::string, std::shared_ptr<const Index>>;
 
     std::shared_ptr<const Index> knownIndex(const std::string& key) const;
     std::vector<std::shared_ptr<const Index>> indexesFor(const std::vector<EqualityTest>& tests) const;
     Positions positionsMatching(const std::vector<EqualityTest>& tests) const;
-    static Positions positionsOf(const std::vector<Postings>& runs);
-    static bool skipTo(Postings& rest, std::uint32_t position);
+    static Positions positionsOf(const std::vector<Run>& runs, std::size_t size);
+    static bool skipTo(Run& rest, std::uint32_t position);
 
     const Knowledge _knowledge;
     std::vector<InstalledPlugInRef> _plugIns;
