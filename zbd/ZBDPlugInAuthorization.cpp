@@ -20,7 +20,8 @@ std::optional<std::string> ZBDPlugIn::allowForClient(const ZBDQmxClient& host) c
         // A name that is no text is one that no host can hold.
         const auto name = required.string();
         if (!name || !host.hasEntitlement(*name)) {
-            return platform::format("the host does not have the \"%@\" entitlement", required);
+            return platform::format("the host does not have the \"%@\" entitlement",
+                                    name ? std::string(*name) : required.description());
         }
     }
     return std::nullopt;

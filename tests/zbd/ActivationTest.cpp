@@ -76,7 +76,8 @@ TEST_F(Activation, ExtensionPointsChooseTheProfile) {
 
 TEST_F(Activation, NothingIsEnabledUnlessEverythingIsAllowed) {
     const Dictionary data{{"VKExtensionProtocol", "#Data"}, {"VKExtensionHostEntitlement", "needed"}};
-    install({described(1), described(2, guarded), described(3), described(4, data)});
+    const Dictionary split{{"VKExtensionHostEntitlement", "two\nlines"}};
+    install({described(1), described(2, guarded), described(3), described(4, data), described(5, split)});
     hold(3);
     EXPECT_EQ(ready({uuid(4)}), succeeded) << "data runs nothing, so nothing is checked";
     const std::string refusal =
@@ -89,6 +90,11 @@ TEST_F(Activation, NothingIsEnabledUnlessEverythingIsAllowed) {
         expectLogged(standard, "denied access to 77 for plugin " + name + "(" + idOf(number) + "): " + reason);
     }
     EXPECT_TRUE(ready({uuid(1), uuid(9)})["error"]);
+    EXPECT_TRUE(ready({uuid(5)}).string("error")->ends_with("have the \"two\nlines\" entitlement"));
+    grant({{"com.nordane.developer.zembra.allowedplugins", Dictionary{{"VKExtensionIdentifier", "other"}}}});
+    EXPECT_TRUE(
+        ready({uuid(2)}).string("error")->ends_with("the host's plug-in entitlement does not allow this plug-in"))
+        << "before what the plug-in needs";
     EXPECT_TRUE(fake.serviceManager.additions().empty());
 }
 
