@@ -92,10 +92,10 @@ std::optional<Rejection> rejectionOf(const Selection& selection, const Candidate
     return std::nullopt;
 }
 
-std::vector<MatchRules> readExclusions(const platform::Value& stored, platform::TypeConformance& types) {
+std::vector<MatchRules> readExclusions(const platform::Value& stored) {
     std::vector<MatchRules> exclusions;
     for (const platform::Value& element : stored.array().value_or(platform::Array())) {
-        if (const auto rules = element.dictionary()) exclusions.emplace_back(rules, types);
+        if (const auto rules = element.dictionary()) exclusions.emplace_back(rules);
     }
     return exclusions;
 }

@@ -56,6 +56,6 @@ std::span<const SelectionTest> selectionTests();
 std::optional<Rejection> rejectionOf(const Selection& selection, const Candidate& candidate);
 
 /// The dictionaries in the user's exclusions; whatever else is stored there is ignored.
-std::vector<MatchRules> readExclusions(const platform::Value& stored, platform::TypeConformance& types);
+std::vector<MatchRules> readExclusions(const platform::Value& stored);
 
 } // namespace zbd

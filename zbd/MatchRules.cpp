@@ -1,5 +1,7 @@
 #include "zbd/MatchRules.h"
 
+#include <utility>
+
 namespace zbd {
 
 using platform::Value;
@@ -11,16 +13,20 @@ constexpr std::size_t manyPatterns = 16;
 
 } // namespace
 
-std::shared_ptr<const MatchAlternatives> preparedAlternatives(const Value& pattern, platform::TypeConformance& types) {
-    const auto patterns = pattern.array();
-    if (!patterns || patterns->size() <= manyPatterns) return nullptr;
-    return std::make_shared<const MatchAlternatives>(*patterns, types);
+MatchRule::MatchRule(Value key, Value pattern) : _key(std::move(key)), _pattern(std::move(pattern)) {
+    const auto patterns = _pattern.array();
+    _isLong = patterns && patterns->size() > manyPatterns;
 }
 
-MatchRules::MatchRules(const std::optional<platform::Dictionary>& rules, platform::TypeConformance& types) {
+const MatchAlternatives* MatchRule::alternatives(platform::TypeConformance& types) const {
+    if (_isLong && !_alternatives) _alternatives = std::make_shared<const MatchAlternatives>(*_pattern.array(), types);
+    return _alternatives.get();
+}
+
+MatchRules::MatchRules(const std::optional<platform::Dictionary>& rules) {
     if (!rules) return;
     _rules.reserve(rules->size());
-    for (const auto& rule : *rules) _rules.push_back({rule.key, rule.value, preparedAlternatives(rule.value, types)});
+    for (const auto& [key, pattern] : *rules) _rules.emplace_back(key, pattern);
 }
 
 } // namespace zbd

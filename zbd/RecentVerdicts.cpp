@@ -23,10 +23,10 @@ bool isPlainPattern(const Value& pattern) {
 
 /// Whether the same manifest always gives the same verdict, and nothing is logged on the way.
 bool isJudgedByManifest(const MatchRule& rule) {
-    if (rule.key == Value(zembra::ruleKey::userElection)) return false;
-    if (rule.pattern.boolean()) return true;
-    const auto patterns = rule.pattern.array();
-    return patterns ? std::ranges::all_of(*patterns, isPlainPattern) : isPlainPattern(rule.pattern);
+    if (rule.key() == Value(zembra::ruleKey::userElection)) return false;
+    if (rule.pattern().boolean()) return true;
+    const auto patterns = rule.pattern().array();
+    return patterns ? std::ranges::all_of(*patterns, isPlainPattern) : isPlainPattern(rule.pattern());
 }
 
 } // namespace

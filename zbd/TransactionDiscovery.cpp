@@ -143,9 +143,8 @@ void Transaction::matchPlugIns() {
         return fail(code::notPermitted, "unauthorized discovery flag (ZBDiscoverAll)");
     }
 
-    platform::TypeConformance& types = server()->platform().typeConformance;
-    const MatchRules prepared(rules, types);
-    auto exclusions = readExclusions(server()->userPrefs().exclusions(), types);
+    const MatchRules prepared(rules);
+    auto exclusions = readExclusions(server()->userPrefs().exclusions());
     ZBDPlugIns candidates = server()->findPlugIns(rules);
     if (!candidates) candidates = std::make_shared<const Candidates>();
     platform::trace::discoverRaw(static_cast<unsigned>(candidates->size()));

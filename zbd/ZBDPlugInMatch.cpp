@@ -21,23 +21,20 @@ constexpr std::int64_t unseenElectionBits = 0xFF00;
 
 } // namespace
 
-bool ZBDPlugIn::match(const std::optional<Dictionary>& rules) const {
-    return !mismatch(MatchRules(rules, _platform.typeConformance));
-}
+bool ZBDPlugIn::match(const std::optional<Dictionary>& rules) const { return !mismatch(MatchRules(rules)); }
 
 std::optional<RuleMismatch> ZBDPlugIn::mismatch(const MatchRules& rules) const {
     std::optional<RuleFacts> facts; // looked up once for all rules: hosts may send a hundred thousand
     for (const MatchRule& rule : rules) {
-        Value value = valueForRule(*rule.key.string(), facts);
-        if (!accepts(rule, value)) return RuleMismatch{rule.key, rule.pattern, std::move(value)};
+        Value value = valueForRule(*rule.key().string(), facts);
+        if (!accepts(rule, value)) return RuleMismatch{rule.key(), rule.pattern(), std::move(value)};
     }
     return std::nullopt;
 }
 
 bool ZBDPlugIn::matchKey(std::string_view key, const Value& pattern) const {
     std::optional<RuleFacts> facts;
-    return accepts({Value(key), pattern, preparedAlternatives(pattern, _platform.typeConformance)},
-                   valueForRule(key, facts));
+    return accepts({Value(key), pattern}, valueForRule(key, facts));
 }
 
 Value ZBDPlugIn::valueForRule(std::string_view key, std::optional<RuleFacts>& facts) const {
@@ -66,15 +63,16 @@ std::string ZBDPlugIn::userElection() const {
 }
 
 bool ZBDPlugIn::accepts(const MatchRule& rule, const Value& value) const {
-    if (!value && rule.key.string() == ruleKey::containingApp) return false;
-    if (rule.pattern == Value(true)) return value && !(value == Value(false));
-    if (rule.pattern == Value(false)) return !value || value == Value(false);
+    if (!value && rule.key().string() == ruleKey::containingApp) return false;
+    if (rule.pattern() == Value(true)) return value && !(value == Value(false));
+    if (rule.pattern() == Value(false)) return !value || value == Value(false);
     if (!value) return false;
-    if (const auto items = rule.pattern.dictionary()) return matchDictionary(value, *items);
+    if (const auto items = rule.pattern().dictionary()) return matchDictionary(value, *items);
     const auto fits = [&](const Value& single) {
         const auto text = single.string();
         if (!text) return false;
-        return rule.alternatives ? rule.alternatives->accepts(*text) : matchValue(*text, rule.pattern);
+        const auto* alternatives = rule.alternatives(_platform.typeConformance);
+        return alternatives != nullptr ? alternatives->accepts(*text) : matchValue(*text, rule.pattern());
     };
     if (const auto elements = value.array()) return std::any_of(elements->begin(), elements->end(), fits);
     return fits(value);

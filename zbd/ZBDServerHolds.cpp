@@ -57,8 +57,8 @@ void ZBDServer::unholdClient(const std::shared_ptr<ZBDQmxClient>& client) {
     _syncQueue->sync([&] {
         const auto found = _holdsByClient.find(client);
         if (found == _holdsByClient.end()) return;
-        const std::int32_t pid = client->pid();
-        for (const auto& hold : Holds(found->second)) { // a copy: the list goes with its last hold
+        const std::int32_t pid = client->auditToken().pid; // the connection may be gone
+        for (const auto& hold : Holds(found->second)) {    // a copy: the list goes with its last hold
             log::ops().debug("releasing plug-in hold %{public}@ for dead client pid %d", hold->uuid(), pid);
             removeHold(hold->uuid());
         }

@@ -90,6 +90,18 @@ TEST_F(Match, ManyAlternativesAnswerLikeOneByOne) {
             ASSERT_EQ(alternatives.accepts(value), plugIn->matchValue(value, Value(patterns)))
                 << value << " against " << Value(patterns).description();
     }
+    MutableArray many;
+    for (int i = 0; i < 20; ++i) many.append(i == 7 ? "?many" : std::to_string(i));
+    const zbd::MatchRules rules(Dictionary{{"key", many}});
+    const auto told = [] {
+        return std::ranges::count(support::processLog.messages("ops"), "unrecognized match operator:?many");
+    };
+    withAttributes({});
+    EXPECT_TRUE(plugIn->mismatch(rules));
+    EXPECT_EQ(told(), 0) << "nothing was compared";
+    withAttributes({{"key", "19"}});
+    EXPECT_FALSE(plugIn->mismatch(rules) || plugIn->mismatch(rules));
+    EXPECT_EQ(told(), 1);
 }
 
 } // namespace

@@ -92,6 +92,9 @@ TEST_F(Lock, BusyInstancesRefuseItWhenAsked) {
     refusal.set("conflicts", Array{Dictionary{{"VBBundleIdentifier", "com.example.2"}}});
     EXPECT_EQ(lock(client, application, 2), refusal);
     EXPECT_TRUE(daemon.server->holds().empty());
+    fake.processAssertions.addIncomplete("com.example.1");
+    EXPECT_TRUE((*lock(client, pathOf(1), 3))["uuids"].uuid()) << "an instance that does not say whose it is";
+    EXPECT_TRUE(support::logged(error, "vigild reported incomplete bundle for plug-in com.example.1/" + idOf(1)));
 }
 
 TEST_F(Lock, ForcedHoldIsAnsweredAfterEveryTermination) {
