@@ -29,6 +29,8 @@ constexpr std::size_t pathBufferSize = 1024; // a host at a longer path has no b
 
 /// What is left of the longest message for "matches", with room for what stands around it in the reply.
 constexpr std::size_t maximumMatchesSize = platform::maximumMessageSize - 1024;
+/// More may be gathered on the way, for newer versions replace older ones; but not any amount.
+constexpr std::size_t maximumGatheredSize = 4 * maximumMatchesSize;
 constexpr std::string_view tooLong = "the matching plug-ins are too many for one reply";
 
 using Candidates = std::vector<ZBDPlugInRef>;
@@ -164,8 +166,8 @@ void Transaction::matchPlugIns() {
     };
 
     // An older protocol has no forms in its reply, so none are too many.
-    const auto fits = [&](std::size_t size) {
-        return size <= maximumMatchesSize || _version != static_cast<std::uint64_t>(zembra::currentVersion);
+    const auto fits = [&](std::size_t size, std::size_t limit = maximumMatchesSize) {
+        return size <= limit || _version != static_cast<std::uint64_t>(zembra::currentVersion);
     };
     const auto now = std::chrono::steady_clock::now();
     SameIdentifierReduction results(flags);
@@ -189,8 +191,9 @@ void Transaction::matchPlugIns() {
             noteOverrides(*candidate, form, overrides);
             results.add(facts, std::move(form));
         }
-        if (!fits(results.encodedSize())) return fail(code::malformed, tooLong);
+        if (!fits(results.encodedSize(), maximumGatheredSize)) return fail(code::malformed, tooLong);
     }
+    if (!fits(results.encodedSize())) return fail(code::malformed, tooLong);
     auto forms = results.takeForms();
     markOverrides(forms, overrides);
     logResults(forms);

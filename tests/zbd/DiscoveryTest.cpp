@@ -113,6 +113,12 @@ TEST_F(Discovery, AnAnswerThatNoMessageHoldsIsAnError) {
     const Value filler = std::string(std::size_t{8} << 20U, 'x'); // twice in each form
     for (int number = 1; number <= 5; ++number) install({described(number, {{"Filler", filler}})});
     EXPECT_EQ(daemon.ask("match"), errorReply(4, "the matching plug-ins are too many for one reply"));
+    for (const int number : {4, 5}) {
+        const Dictionary newer{{"VKExtensionVersion", "9"}};
+        install({described(number + 2, {{"VKExtensionIdentifier", "com.example." + std::to_string(number)},
+                                        {"VKExtensionAttributes", newer}})});
+    }
+    EXPECT_EQ(answer(), "12367") << "what is replaced does not count";
 }
 
 TEST_F(Discovery, WhatIsAskedAgainFollowsEveryChange) {
