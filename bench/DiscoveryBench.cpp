@@ -307,6 +307,7 @@ void measureStartAndMemory(const Settings& settings, const std::string& director
             Started started(settings, root, requestType::match, groupRules(), manager);
             matched.add(started.milliseconds);
             started.daemon.ask(requestType::add, settle);
+            manager.receive(started.daemon.process());
         }
         {
             // It knows nothing of the watch, and what was handed over holds no longer.
@@ -318,6 +319,7 @@ void measureStartAndMemory(const Settings& settings, const std::string& director
             Started started(settings, root, requestType::find, {{key::uuids, uuid}}, manager);
             found.add(started.milliseconds);
             started.daemon.ask(requestType::add, settle);
+            manager.receive(started.daemon.process());
             installed.add(residentMemory(started.daemon.process()));
             if (decodedMatches(started.daemon.ask(requestType::match)).array()->size() != manyBundles)
                 fail("some plug-ins are missing");

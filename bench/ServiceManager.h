@@ -29,8 +29,18 @@ public:
     }
     Passed kept() const { return {_name, _descriptor.get()}; }
 
-    /// Returns when the service has given something to keep.
+    /// Returns when the service has given something to keep, in place of what is kept.
     void receive(Process& service) {
+        std::string text;
+        while (!text.starts_with(begin)) text = next(service);
+        _name = text.substr(begin.size());
+    }
+
+private:
+    static constexpr std::string_view begin = "FDSTORE=1\nFDNAME=";
+
+    /// Another notification. Takes the descriptor that comes with it.
+    std::string next(Process& service) {
         pollfd waiting{_socket.get(), POLLIN, 0};
         while (poll(&waiting, 1, 100) <= 0) {
             if (!service.isRunning()) fail("the service ended");
@@ -44,16 +54,15 @@ public:
         message.msg_control = control.data();
         message.msg_controllen = control.size();
         const ssize_t size = recvmsg(_socket.get(), &message, MSG_CMSG_CLOEXEC);
-        const cmsghdr* rights = size > 0 ? CMSG_FIRSTHDR(&message) : nullptr;
-        constexpr std::string_view begin = "FDSTORE=1\nFDNAME=";
-        if (rights == nullptr || !text.starts_with(begin)) fail("nothing to keep");
-        int descriptor = -1;
-        std::memcpy(&descriptor, CMSG_DATA(rights), sizeof descriptor);
-        _descriptor.reset(descriptor);
-        _name = text.substr(begin.size(), static_cast<std::size_t>(size) - begin.size());
+        if (size < 0) failSystem("recvmsg");
+        if (const cmsghdr* rights = CMSG_FIRSTHDR(&message)) {
+            int descriptor = -1;
+            std::memcpy(&descriptor, CMSG_DATA(rights), sizeof descriptor);
+            _descriptor.reset(descriptor);
+        }
+        return text.substr(0, static_cast<std::size_t>(size));
     }
 
-private:
     const std::string _path;
     const Descriptor _socket;
     std::string _name;

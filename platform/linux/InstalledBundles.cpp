@@ -3,6 +3,7 @@
 #include "platform/SystemLog.h"
 #include "platform/linux/DirectoryFiles.h"
 #include "platform/linux/FileStatus.h"
+#include "platform/linux/Mounts.h"
 
 #include <algorithm>
 #include <array>
@@ -28,7 +29,7 @@ constexpr std::ptrdiff_t maximumRegistrationDepth = 64;
 constexpr const char* everything = ""; // every path is below it
 /// More places than these are found sooner on a walk through everything.
 constexpr std::size_t maximumPlacesByPath = 1000;
-/// What the names of kept watches begin with. Each has another name: what one told, no other one tells.
+/// What the names of kept watches begin with.
 constexpr const char* watchPrefix = "catalix-";
 
 LogHandle& cx() {
@@ -78,8 +79,7 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
       _limits(limits),
       _store(root.database() + "/Catalix.sqlite", _strings),
       _descriptors(descriptors),
-      _kept(descriptors != nullptr ? descriptors->take(watchPrefix) : DescriptorStore::Kept()),
-      _watcher(limits.watches, std::move(_kept.descriptor)),
+      _watcher(limits.watches),
       _scanner([this](int directory,
                       const std::string& path) { _watcher.watch(directory, path, RegistryWatcher::Role::content); },
                _strings) {
@@ -93,46 +93,61 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     _listings = std::move(contents.listings);
     _isKnowledgeUnsaved = !contents.knowledge;
     _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
-    if (!contents.knowledge) {
-        rescan({everything}, Manifests::settled);
-    } else if (contents.handedOver && *contents.handedOver == handedOverNow() && _watcher.isSilent()) {
+    auto kept = descriptors != nullptr ? descriptors->take(watchPrefix) : DescriptorStore::Kept();
+    if (contents.handedOver && contents.handedOver->watch == kept.name && contents.handedOver->places == placesNow() &&
+        RegistryWatcher::isSilent(kept.descriptor.get())) {
         cx().info("nothing changed on disk while the daemon was not running");
+        _watcher.become(std::move(kept.descriptor));
+        _watchName = std::move(kept.name);
         _stage = Stage::verified;
+    } else if (!kept.name.empty()) {
+        descriptors->drop(kept.name); // with all that it watches, before the same is watched anew
     }
+    if (!contents.knowledge) rescan({everything}, Manifests::settled);
 }
 
-/// The watch, and the folders that are there now: it does not hear that others were mounted or moved into their place.
-HandedOver InstalledBundles::handedOverNow() const {
-    HandedOver now{_kept.name, 0};
-    for (const auto& folder : _folders) {
+/// The directories that bundles are looked for in, for a watch does not hear that others come to be in their places.
+std::string InstalledBundles::placesNow() const {
+    std::string places;
+    const auto add = [&](const std::string& path) {
         FileStatus status; // stays empty where there is none
-        (void)readFileStatus(AT_FDCWD, folder.path.c_str(), status);
-        const auto& [device, inode, seconds, nanoseconds] = status.identity;
-        for (const std::uint64_t part :
-             {device, inode, static_cast<std::uint64_t>(seconds), std::uint64_t{nanoseconds}})
-            now.folders = now.folders * 0x9e37'79b9'7f4a'7c15 + part;
+        (void)readFileStatus(AT_FDCWD, path.c_str(), status);
+        const auto& identity = status.identity;
+        for (const auto part : {identity.device, identity.inode, static_cast<std::uint64_t>(identity.bornSeconds),
+                                std::uint64_t{identity.bornNanoseconds}})
+            places += std::to_string(part) + ' ';
+        places += path + '\n';
+    };
+    for (const auto& folder : _folders) {
+        add(folder.path);
+        places += mountsAtAndBelow(folder.path);
     }
-    return now;
+    for (const auto& registration : _registrations) add(registration);
+    return places;
 }
 
 /// Events are taken from now on, so what was handed over to this process holds for no later one.
 void InstalledBundles::takeOverWatch() {
     const auto failure = _store.change([&] { _store.setHandedOver(std::nullopt); });
-    if (_descriptors == nullptr) return;
-    if (failure && !_kept.name.empty()) {
-        // Then none may have that name.
-        _descriptors->drop(_kept.name);
-        _kept.name.clear();
+    if (failure && !_watchName.empty()) {
+        // Then it stays true as it is: of a watch that nobody reads.
+        _watcher.become({});
+        _watchName.clear();
+        return;
     }
-    if (!_kept.name.empty()) return;
-    _kept.name = watchPrefix + UUID::random().text();
-    if (!_descriptors->keep(_kept.name, _watcher.descriptor())) _kept.name.clear();
+    if (_descriptors == nullptr) return;
+    // Under another name, so that no old copy of the database speaks of it.
+    if (!_watchName.empty()) _descriptors->drop(_watchName);
+    _watchName = watchPrefix + UUID::random().text();
+    if (!_descriptors->keep(_watchName, _watcher.descriptor())) _watchName.clear();
 }
 
 void InstalledBundles::handOver() {
-    if (_stage < Stage::watched || _kept.name.empty() || !isSaved() || needsVerifying()) return;
+    if (_stage < Stage::watched || _watchName.empty() || !isSaved() || needsVerifying()) return;
+    // Where something else came to lie meanwhile, other directories are watched than those that are there.
+    if (placesNow() != _placesWatched) return;
     // What happens from now on waits in the watch. Should this fail, the next start looks at everything.
-    (void)_store.change([&] { _store.setHandedOver(handedOverNow()); });
+    (void)_store.change([&] { _store.setHandedOver(HandedOver{_watchName, _placesWatched}); });
 }
 
 bool InstalledBundles::isUnchanged(const InstalledPlugIn& plugIn) const {
@@ -368,6 +383,7 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
     if (places.contains(everything)) {
         if (_stage < Stage::watched) takeOverWatch();
         _stage = Stage::watched;
+        _placesWatched = placesNow();
     }
     _manifests = manifests;
     _isShort = false;
@@ -837,6 +853,7 @@ void InstalledBundles::save() {
             const auto listing = _listings.find(path);
             _store.setListing(path, listing == _listings.end() ? std::nullopt : std::optional(listing->second));
         }
+        _store.setHandedOver(std::nullopt);
         for (const auto& removed : _unsavedRemoved) _store.remember(removed);
         for (const auto& uuid : _unsavedReturned) _store.forget(uuid);
         if (!_unsavedRemoved.empty()) _store.keepRemoved(_limits.removedPlugIns);

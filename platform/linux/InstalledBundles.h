@@ -129,7 +129,7 @@ private:
     void save();
 
     // Between one process and the next.
-    HandedOver handedOverNow() const;
+    std::string placesNow() const;
     void takeOverWatch();
 
     const std::string _top;
@@ -138,7 +138,7 @@ private:
     SharedStrings _strings;
     RegistryStore _store;
     DescriptorStore* const _descriptors;
-    DescriptorStore::Kept _kept; // its name stays; empty when nobody keeps the watch
+    std::string _watchName; // under which the watch is kept; empty when nobody keeps it
     RegistryWatcher _watcher;
     BundleScanner _scanner;
 
@@ -149,6 +149,7 @@ private:
     Listings _listings;
     Knowledge _knowledge;
     Stage _stage = Stage::stored;
+    std::string _placesWatched; // as they were when everything was looked at
 
     Manifests _manifests = Manifests::settled;    // during a scan
     bool _isShort = false;                        // during a scan: something could not be looked at

@@ -58,7 +58,7 @@ struct Knowledge {
 /// everything to tell that the database does not.
 struct HandedOver {
     std::string watch;
-    std::uint64_t folders = 0; // a digest of which directories bundles were looked for in
+    std::string places; // which directories bundles were looked for in, as text
     friend bool operator==(const HandedOver&, const HandedOver&) = default;
 };
 

@@ -39,7 +39,7 @@ CREATE INDEX removedDirectory ON removed (inode, device);
 /// What files of the same version may lack.
 constexpr const char* laterSchema = R"(
 CREATE TABLE IF NOT EXISTS folder (path BLOB PRIMARY KEY, evidence INTEGER);
-CREATE TABLE IF NOT EXISTS handedOver (watch BLOB NOT NULL, folders INTEGER);
+CREATE TABLE IF NOT EXISTS handedOver (watch BLOB NOT NULL, places BLOB NOT NULL);
 CREATE TRIGGER IF NOT EXISTS applicationRemoved AFTER DELETE ON application BEGIN
     UPDATE folder SET evidence = 0 WHERE evidence <> 0;
 END;
@@ -243,10 +243,10 @@ Failure RegistryStore::read(Contents& contents) {
                  auto path = row.text();
                  contents.listings.emplace(std::move(path), row.bits());
              }) &&
-        rows("SELECT watch, folders FROM handedOver",
+        rows("SELECT watch, places FROM handedOver",
              [&](Row row) {
                  auto watch = row.text();
-                 contents.handedOver = HandedOver{std::move(watch), row.bits()};
+                 contents.handedOver = HandedOver{std::move(watch), row.text()};
              }) &&
         rows("SELECT path FROM registration", [&](Row row) { contents.registrations.insert(row.text()); }) &&
         rows("SELECT path, device, inode, birth FROM exclusion", [&](Row row) {
@@ -349,7 +349,7 @@ void RegistryStore::setListing(const std::string& path, const std::optional<std:
 
 void RegistryStore::setHandedOver(const std::optional<HandedOver>& handedOver) {
     run("DELETE FROM handedOver");
-    if (handedOver) run("INSERT INTO handedOver VALUES (?, ?)", handedOver->watch, stored(handedOver->folders));
+    if (handedOver) run("INSERT INTO handedOver VALUES (?, ?)", handedOver->watch, handedOver->places);
 }
 
 void RegistryStore::remember(const RemovedPlugIn& removed) {

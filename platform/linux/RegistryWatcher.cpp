@@ -7,6 +7,7 @@
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
 #include <sys/inotify.h>
 #include <sys/ioctl.h>
 #include <unistd.h>
@@ -21,12 +22,17 @@ constexpr std::uint32_t contentEvents = passageEvents | IN_CLOSE_WRITE | IN_DELE
 
 } // namespace
 
-RegistryWatcher::RegistryWatcher(std::size_t limit, Descriptor kept)
-    : _limit(limit), _inotify(kept ? std::move(kept) : Descriptor(inotify_init1(IN_NONBLOCK | IN_CLOEXEC))) {}
+RegistryWatcher::RegistryWatcher(std::size_t limit) : _limit(limit) { become({}); }
 
-bool RegistryWatcher::isSilent() const {
+bool RegistryWatcher::isSilent(int descriptor) {
+    std::error_code error;
+    const auto kind = std::filesystem::read_symlink(procPath(descriptor), error);
     int waiting = 0;
-    return ioctl(_inotify.get(), FIONREAD, &waiting) == 0 && waiting == 0;
+    return kind == "anon_inode:inotify" && ioctl(descriptor, FIONREAD, &waiting) == 0 && waiting == 0;
+}
+
+void RegistryWatcher::become(Descriptor inotify) {
+    _inotify = inotify ? std::move(inotify) : Descriptor(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
 }
 
 void RegistryWatcher::watch(int directory, const std::string& path, Role role) {
@@ -98,11 +104,7 @@ bool RegistryWatcher::read(std::vector<Event>& events) {
             at += sizeof event + event.len;
             if ((event.mask & IN_Q_OVERFLOW) != 0) isComplete = false;
             const auto watch = _byDescriptor.find(event.wd);
-            if (watch == _byDescriptor.end()) {
-                // From before the watch was ended; or of one that was kept and that nobody wants any more.
-                inotify_rm_watch(_inotify.get(), event.wd);
-                continue;
-            }
+            if (watch == _byDescriptor.end()) continue; // from before the watch was ended
             if ((event.mask & IN_IGNORED) != 0) {
                 forget(event.wd);
                 continue;

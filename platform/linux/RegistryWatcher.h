@@ -26,15 +26,17 @@ public:
         passage, // only entries that come and go
     };
 
-    /// Never watches more than `limit` directories. `kept` is the descriptor of another process's watcher, or none.
-    explicit RegistryWatcher(std::size_t limit, Descriptor kept = {});
+    /// Never watches more than `limit` directories.
+    explicit RegistryWatcher(std::size_t limit);
 
     /// Readable when events wait. Negative when the system has no inotify left.
     int descriptor() const { return _inotify.get(); }
 
-    /// No event waits: nothing happened in what this watcher, or the one that it was kept from, watches since that was
-    /// last read, and no event was lost.
-    bool isSilent() const;
+    /// Whether it is the descriptor of a watcher with no event waiting: nothing happened in what that one watches since
+    /// it was last read.
+    static bool isSilent(int descriptor);
+    /// From here on this watcher is the one with that descriptor; with none, a new one. Before anything is watched.
+    void become(Descriptor inotify);
 
     /// Watches the open directory under the name `path`, also when it is watched already.
     void watch(int directory, const std::string& path, Role role);

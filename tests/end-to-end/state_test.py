@@ -146,22 +146,30 @@ class State(scratch.Case):
         manager = self.enterContext(socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM))
         manager.bind(self.directory + "/manager")
         self.daemon_environment["NOTIFY_SOCKET"] = self.directory + "/manager"
+        store = {}
+        self.addCleanup(lambda: [os.close(watch) for watch in store.values()])
+
+        def stop():
+            """When all is watched, what "add" waits for. Answers the log."""
+            self.request("add", paths=[self.good])
+            text, descriptors, _, _ = socket.recv_fds(manager, 4096, 1)
+            if text.startswith(b"FDSTOREREMOVE=1"):
+                os.close(store.pop(text))
+                text, descriptors, _, _ = socket.recv_fds(manager, 4096, 1)
+            store[text.replace(b"FDSTORE=1", b"FDSTOREREMOVE=1")] = descriptors[0]
+            name = text.decode().removeprefix("FDSTORE=1\nFDNAME=")
+            self.daemon_environment |= {"LISTEN_FDS": "1", "LISTEN_FDNAMES": name}
+            return self.stop()
+
         self.start()
-        text, (watch,), _, _ = socket.recv_fds(manager, 4096, 1)
-        self.addCleanup(os.close, watch)
-        begin, name = text.decode().rsplit("=", 1)
-        self.assertEqual(begin, "FDSTORE=1\nFDNAME")
-        self.request("add", paths=[self.good])  # answered when all is watched
-        self.stop()
-        self.daemon_environment |= {"LISTEN_FDS": "1", "LISTEN_FDNAMES": name}
+        stop()
         for version, is_silent in (("1.0", True), ("2.0", False), ("2.0", True)):
             if not is_silent:
                 scratch.write(self.good + "/Info.vlist", vlist(manifest("good", version)))
             self.start(program=("sh", "-c", 'LISTEN_PID=$$ exec "$0" "$@"', scratch.ZBD), pass_fds=[3],
-                       preexec_fn=lambda: os.dup2(watch, 3))
+                       preexec_fn=lambda: os.dup2(*store.values(), 3))
             self.assertEqual(names(self.match()), ["good " + version])
-            self.request("add", paths=[self.good])  # answered when all is watched
-            self.assertEqual("nothing changed on disk while" in self.stop(), is_silent)
+            self.assertEqual("nothing changed on disk while" in stop(), is_silent)
 
     def test_a_second_daemon_of_that_name_ends_with_the_reason(self):
         self.start()

@@ -15,6 +15,8 @@
 #include <gtest/gtest.h>
 #include <iterator>
 #include <sstream>
+#include <sys/eventfd.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <thread>
 #include <tuple>
@@ -72,12 +74,13 @@ public:
         return name.starts_with(prefix) ? Kept{name, duplicate(_descriptor.get())} : Kept();
     }
     bool keep(const std::string& given, int descriptor) override {
+        if (isDeaf) return false;
         name = given;
         _descriptor = duplicate(descriptor);
         return true;
     }
     void drop(const std::string& dropped) override {
-        if (dropped == name) forget();
+        if (dropped == name && !isDeaf) forget();
     }
     void forget() {
         name.clear();
@@ -85,6 +88,7 @@ public:
     }
 
     std::string name;
+    bool isDeaf = false;
 
 private:
     static linux_::Descriptor duplicate(int descriptor) { return linux_::Descriptor(dup(descriptor)); }
@@ -380,34 +384,83 @@ TEST_F(RegistryOnDisk, WatchIsBelievedOnlyIfItIsTheOneThatWasHandedOver) {
         return bundles;
     };
     const auto next = [&] { return made()->stage(); };
-    const auto nothing = [](InstalledBundles&) {};
-    const std::vector<std::tuple<std::string, std::function<void(InstalledBundles&)>, Action, Stage>> cases{
-        {"handed over", [](auto& bundles) { bundles.handOver(); }, [] {}, Stage::verified},
-        {"ended without that", nothing, [] {}, Stage::stored},
-        {"something was not taken in",
-         [&](auto& bundles) { writeFile(app + "/PlugIns/a.appex/x", ""), bundles.handOver(); }, [] {}, Stage::stored},
-        {"another watch", [](auto& bundles) { bundles.handOver(); }, [&] { manager.name += "x"; }, Stage::stored},
-        {"none", [](auto& bundles) { bundles.handOver(); }, [&] { manager.forget(); }, Stage::stored},
+    const auto edit = [&] { writeManifest(plugIn, infoOf("2")); };
+    const std::string subfolder = applications + "/a folder";
+    fs::create_directory(subfolder);
+    const auto mountThere = [&] { return mount("none", subfolder.c_str(), "tmpfs", 0, nullptr) == 0; }; // if one may
+    const auto handedOver = [&] {
+        linux_::SharedStrings strings;
+        std::optional<std::string> problem;
+        return linux_::RegistryStore(database, strings).open(problem).handedOver;
+    };
+    /// What happens after something was handed over, and before the next start.
+    const std::vector<std::pair<std::string, Action>> cases{
+        {"an edit", edit},
+        {"an edit that another one was told, which was not to hand over", [&] { (void)watched(); }},
+        {"another watch", [&] { manager.name += "x"; }},
+        {"none", [&] { manager.forget(); }},
+        {"something else", [&] { manager.keep(manager.name, linux_::Descriptor(eventfd(0, EFD_CLOEXEC)).get()); }},
         // No watch hears of what happens above the root.
-        {"other folders", [](auto& bundles) { bundles.handOver(); },
+        {"other folders",
          [&] {
              fs::rename(root.directory(), aside.path() + "/root");
              fs::copy(aside.path() + "/root", root.directory(), fs::copy_options::recursive);
-         },
-         Stage::stored},
+         }},
+        {"an older copy of the database",
+         [&] {
+             fs::copy_file(database, aside.path() + "/copy");
+             auto bundles = watched();
+             edit();
+             bundles->catchUp();
+             bundles->handOver();
+             bundles.reset();
+             EXPECT_EQ(next(), Stage::verified);
+             fs::copy_file(aside.path() + "/copy", database, fs::copy_options::overwrite_existing);
+         }},
+        {"a database that nobody can write for a while",
+         [&] {
+             linux_::SharedStrings strings;
+             std::optional<std::string> problem;
+             linux_::RegistryStore other(database, strings);
+             other.open(problem);
+             manager.isDeaf = true;
+             (void)other.change([&] {
+                 const auto bundles = watched();
+                 edit();
+                 bundles->catchUp();
+             });
+             manager.isDeaf = false;
+         }},
+        {"a mount",
+         [&] {
+             if (!mountThere()) edit();
+         }},
     };
-    for (const auto& [what, end, meanwhile, stage] : cases) {
-        end(*watched());
-        meanwhile();
-        EXPECT_EQ(next(), stage) << what;
-        EXPECT_EQ(next(), stage) << what << ": as long as nothing was taken in";
+    for (const auto& [what, happen] : cases) {
+        SCOPED_TRACE(what);
+        watched()->handOver();
+        EXPECT_EQ(next(), Stage::verified);
+        EXPECT_EQ(next(), Stage::verified) << "as long as nothing is taken in";
+        happen();
+        auto bundles = made();
+        EXPECT_EQ(bundles->stage(), Stage::stored);
+        EXPECT_EQ(manager.name, "") << "nobody reads it any more";
+        if (what != "an edit") continue;
+        bundles->catchUp();
+        EXPECT_EQ(bundles->stage(), Stage::verified);
+        EXPECT_FALSE(handedOver()) << "it spoke of other rows";
     }
-    watched()->handOver();
-    (void)watched();
-    EXPECT_EQ(next(), Stage::stored) << "it holds for one";
+    umount(subfolder.c_str());
+    auto bundles = watched();
+    if (mountThere()) {
+        bundles->handOver();
+        umount(subfolder.c_str());
+        EXPECT_FALSE(handedOver()) << "what lies there is not what is watched";
+    }
+    bundles.reset();
     limits.watches = 3;
     watched()->handOver();
-    EXPECT_EQ(next(), Stage::stored) << "not all is watched";
+    EXPECT_FALSE(handedOver()) << "not all is watched";
 }
 
 TEST_F(RegistryOnDisk, RegistrationByPath) {
