@@ -14,6 +14,7 @@
 #include <sys/stat.h>
 #include <unordered_map>
 #include <unordered_set>
+#include <utility>
 
 namespace platform::linux_ {
 
@@ -88,6 +89,7 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     if (problem) cx().error("the registry's database was not usable: %{public}s", *problem);
     _applications = std::move(contents.applications);
     _plugIns = std::move(contents.plugIns);
+    _stored = std::move(contents.inOrder);
     _registrations = std::move(contents.registrations);
     _exclusions = std::move(contents.exclusions);
     _listings = std::move(contents.listings);
@@ -104,6 +106,19 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
         descriptors->drop(kept.name); // with all that it watches, before the same is watched anew
     }
     if (!contents.knowledge) rescan({everything}, Manifests::settled);
+}
+
+Installed InstalledBundles::installed(const PlugIns& hidden) {
+    // Walking through the maps takes far longer after a start: their nodes lie all over what was read.
+    if (_stored && hidden.empty()) return *std::exchange(_stored, std::nullopt);
+    Installed installed;
+    installed.plugIns.reserve(_plugIns.size());
+    for (const auto& [path, plugIn] : _plugIns) {
+        if (!hidden.contains(path)) installed.plugIns.push_back(plugIn);
+    }
+    installed.applications.reserve(_applications.size());
+    for (const auto& [path, application] : _applications) installed.applications.push_back(application);
+    return installed;
 }
 
 /// The directories that bundles are looked for in, for a watch does not hear that others come to be in their places.
@@ -405,6 +420,7 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
         cx().error("cannot watch %lu directories; raise fs.inotify.max_user_watches", _watcher.unwatched().size());
     _hasToldOfUnwatched = isUnwatched;
     auto change = takeIn(places, found);
+    if (change.isChanged) _stored.reset();
     save();
     return change;
 }

@@ -70,7 +70,8 @@ public:
     bool unregisterPlugIn(const std::string& path, const Tell& tell);
 
     const PlugIns& plugIns() const { return _plugIns; }
-    const Applications& applications() const { return _applications; }
+    /// All but the plug-ins at the paths in `hidden`.
+    Installed installed(const PlugIns& hidden = {});
     const Knowledge& knowledge() const { return _knowledge; }
 
 private:
@@ -149,7 +150,8 @@ private:
     Listings _listings;
     Knowledge _knowledge;
     Stage _stage = Stage::stored;
-    std::string _placesWatched; // as they were when everything was looked at
+    std::optional<Installed> _stored; // what was read from the database, until it is asked for or not true any more
+    std::string _placesWatched;       // as they were when everything was looked at
 
     Manifests _manifests = Manifests::settled;    // during a scan
     bool _isShort = false;                        // during a scan: something could not be looked at

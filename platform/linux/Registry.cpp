@@ -110,7 +110,7 @@ public:
           _containers(containers),
           _bundles(_root, limits, descriptors),
           _wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
-        show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
+        show(std::make_shared<RegistrySnapshot>(_bundles.installed(), _bundles.knowledge()));
         _thread = startServiceThread("registry", [this] {
             run();
             _bundles.handOver();
@@ -404,13 +404,11 @@ private:
         const bool isStart = _stage.load(std::memory_order_relaxed) < Stage::verified;
         if (!change.removed.empty() && !change.installed.empty() && !isStart) {
             // What takes the place of another one is seen only after that one's end was told: the two may share a UUID.
-            const auto observers =
-                show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(),
-                                                        Knowledge{UUID::random(), sequence - 1}, change.installed));
+            const auto observers = show(std::make_shared<RegistrySnapshot>(_bundles.installed(change.installed),
+                                                                           Knowledge{UUID::random(), sequence - 1}));
             tellRemoved(observers, change.removed);
         }
-        const auto observers =
-            show(std::make_shared<RegistrySnapshot>(_bundles.plugIns(), _bundles.applications(), _bundles.knowledge()));
+        const auto observers = show(std::make_shared<RegistrySnapshot>(_bundles.installed(), _bundles.knowledge()));
         if (change.installed.empty() || isStart) tellRemoved(observers, change.removed);
         // Whoever made something of the old content has to hear that it is gone: an entitlement that was withdrawn must
         // not live on in a record.

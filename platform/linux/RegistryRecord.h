@@ -8,6 +8,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace platform::linux_ {
 
@@ -68,6 +69,12 @@ using PlugIns = std::map<std::string, InstalledPlugInRef>;
 using Exclusions = std::map<std::string, DirectoryIdentity>;
 /// Each folder of applications with a digest of its state; 0 unless all that was in it is known.
 using Listings = std::map<std::string, std::uint64_t>;
+
+/// All that is installed, each in the order of the paths.
+struct Installed {
+    std::vector<InstalledPlugInRef> plugIns;
+    std::vector<InstalledApplicationRef> applications;
+};
 
 /// The manifest's plug-in dictionary: "VKExtension", else the older "Zembra".
 inline std::optional<Dictionary> plugInDictionary(const Dictionary& info) {

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <iterator>
+#include <utility>
 
 namespace platform::linux_ {
 
@@ -14,29 +15,23 @@ constexpr std::size_t maximumIndexes = 16;
 
 } // namespace
 
-RegistrySnapshot::RegistrySnapshot(const PlugIns& plugIns, const Applications& applications, Knowledge knowledge,
-                                   const PlugIns& hidden)
-    : _knowledge(knowledge) {
+RegistrySnapshot::RegistrySnapshot(Installed installed, Knowledge knowledge)
+    : _knowledge(knowledge), _applications(std::move(installed.applications)) {
     struct Place {
         UUID uuid;
         std::uint32_t byPath; // the number of the plug-in in the order of the paths
-        const InstalledPlugInRef* plugIn;
     };
     std::vector<Place> places;
-    places.reserve(plugIns.size());
-    for (const auto& [path, plugIn] : plugIns) {
-        if (!hidden.contains(path))
-            places.push_back({plugIn->uuid, static_cast<std::uint32_t>(places.size()), &plugIn});
-    }
+    places.reserve(installed.plugIns.size());
+    for (const auto& plugIn : installed.plugIns)
+        places.push_back({plugIn->uuid, static_cast<std::uint32_t>(places.size())});
     std::ranges::sort(places, {}, &Place::uuid);
     _plugIns.reserve(places.size());
     _byPath.resize(places.size());
-    for (const auto& place : places) {
-        _byPath[place.byPath] = static_cast<std::uint32_t>(_plugIns.size());
-        _plugIns.push_back(*place.plugIn);
+    for (const auto& [uuid, byPath] : places) {
+        _byPath[byPath] = static_cast<std::uint32_t>(_plugIns.size());
+        _plugIns.push_back(std::move(installed.plugIns[byPath]));
     }
-    _applications.reserve(applications.size());
-    for (const auto& [path, application] : applications) _applications.push_back(application);
 }
 
 InstalledPlugInRef RegistrySnapshot::plugIn(const UUID& uuid) const {
@@ -83,7 +78,7 @@ RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
     struct Missing {
         const std::string* key;
         std::shared_ptr<Index> index;
-        std::vector<std::pair<std::uint32_t, std::uint32_t>> pairs; // a hash and a position
+        std::vector<std::uint64_t> pairs; // a hash, and in the lower half a position
     };
     const std::lock_guard lock(_mutex); // held on: who asks for the same key meanwhile waits instead of making it too
     std::vector<std::shared_ptr<const Index>> indexes;
@@ -99,8 +94,9 @@ RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
     // All on one walk, and by the paths, for so the manifests lie in memory after a start.
     for (const std::uint32_t position : _byPath) {
         for (auto& [key, index, pairs] : missing) {
-            visitForEquality(*_plugIns[position], *key,
-                             [&](std::string_view text) { pairs.emplace_back(hashForEquality(text), position); });
+            visitForEquality(*_plugIns[position], *key, [&](std::string_view text) {
+                pairs.push_back(std::uint64_t{hashForEquality(text)} << 32U | position);
+            });
         }
     }
     for (auto& [key, index, pairs] : missing) {
@@ -109,9 +105,9 @@ RegistrySnapshot::indexesFor(const std::vector<EqualityTest>& tests) const {
         pairs.erase(doubles.begin(), doubles.end());
         index->hashes.reserve(pairs.size());
         index->positions.reserve(pairs.size());
-        for (const auto& [hash, position] : pairs) {
-            index->hashes.push_back(hash);
-            index->positions.push_back(position);
+        for (const auto pair : pairs) {
+            index->hashes.push_back(static_cast<std::uint32_t>(pair >> 32U));
+            index->positions.push_back(static_cast<std::uint32_t>(pair));
         }
         _indexes.emplace_front(*key, index);
         if (_indexes.size() > maximumIndexes) _indexes.pop_back();

@@ -19,9 +19,7 @@ namespace platform::linux_ {
 /// Everything the registry knew at one moment, for any number of readers on any threads.
 class RegistrySnapshot {
 public:
-    /// Without the plug-ins at the paths in `hidden`.
-    RegistrySnapshot(const PlugIns& plugIns, const Applications& applications, Knowledge knowledge,
-                     const PlugIns& hidden = {});
+    RegistrySnapshot(Installed installed, Knowledge knowledge);
 
     const Knowledge& knowledge() const { return _knowledge; }
     /// Ordered by UUID.

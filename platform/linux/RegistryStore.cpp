@@ -193,51 +193,13 @@ Failure RegistryStore::read(Contents& contents) {
         while ((code = sqlite3_step(statement.get())) == SQLITE_ROW) take(Row(statement.get()));
         return code == SQLITE_DONE;
     };
-    std::error_code ignored; // then there is little to read, or nothing
-    const auto size = std::filesystem::file_size(_path, ignored);
-    const HeapGrowth growth(ignored ? 0 : size + size / 2); // about what the records take up
-    // In the order of the rows, which is nearly that of the paths, so that most go to the end of their map: the order
-    // of the paths would take a look-up of each row by its index.
     const bool isRead =
         rows("SELECT uuid, sequence FROM knowledge",
              [&](Row row) {
                  const auto uuid = row.uuid();
                  if (uuid) contents.knowledge = Knowledge{*uuid, row.bits()};
              }) &&
-        rows("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements "
-             "FROM application",
-             [&](Row row) {
-                 auto application = std::make_shared<InstalledApplication>();
-                 application->path = row.text();
-                 application->facts = row.facts(_strings, StoredDictionary::Keeps::encoding);
-                 const auto& path = application->path;
-                 contents.applications.emplace_hint(contents.applications.end(), path, application);
-             }) &&
-        rows("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements, "
-             "uuid, identifier, originalIdentifier, registered, application FROM plugIn",
-             [&, application = contents.applications.cbegin()](Row row) mutable {
-                 auto plugIn = std::make_shared<InstalledPlugIn>();
-                 plugIn->path = row.text();
-                 plugIn->facts = row.facts(_strings, StoredDictionary::Keeps::whatWasAskedFor);
-                 const auto uuid = row.uuid();
-                 plugIn->identifier = row.optionalText();
-                 plugIn->originalIdentifier = row.optionalText();
-                 plugIn->registered = Date{row.real()};
-                 if (const auto path = row.bytes()) {
-                     const auto end = contents.applications.cend();
-                     const auto isFound = [&] { return application != end && application->first == *path; };
-                     // Mostly it is that of the row before, or the next one.
-                     if (!isFound() && application != end) application = std::next(application);
-                     if (!isFound()) application = contents.applications.find(std::string(*path));
-                     // Without its application the row tells nothing; the scan reads the bundle again.
-                     if (application == end) return;
-                     plugIn->application = application->second;
-                 }
-                 if (!uuid) return;
-                 plugIn->uuid = *uuid;
-                 const auto& path = plugIn->path;
-                 contents.plugIns.emplace_hint(contents.plugIns.end(), path, plugIn);
-             }) &&
+        readBundles(contents) &&
         rows("SELECT path, evidence FROM folder",
              [&](Row row) {
                  auto path = row.text();
@@ -254,6 +216,73 @@ Failure RegistryStore::read(Contents& contents) {
             contents.exclusions.emplace(std::move(path), row.identity());
         });
     return isRead ? Failure() : lastError();
+}
+
+/// Applications and plug-ins in the order of their rows, which is nearly that of the paths: so most go to the end of
+/// their map, and a plug-in's application is mostly the one that was read last. (The order of the paths would take a
+/// look-up of each row by its index.)
+bool RegistryStore::readBundles(Contents& contents) {
+    std::error_code ignored; // then there is little to read, or nothing
+    const auto size = std::filesystem::file_size(_path, ignored);
+    const HeapGrowth growth(ignored ? 0 : size + size / 2); // about what the records take up
+    const Statement applications =
+        prepare("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements "
+                "FROM application");
+    const Statement plugIns =
+        prepare("SELECT path, device, inode, birth, evidence, fingerprint, resources, executable, info, entitlements, "
+                "uuid, identifier, originalIdentifier, registered, application FROM plugIn");
+    if (!applications || !plugIns) return false;
+    Installed inOrder;
+    bool isInOrder = true;
+    const auto add = [&](auto& map, auto& list, auto record) {
+        if (!list.empty() && list.back()->path >= record->path) isInOrder = false;
+        map.emplace_hint(map.end(), record->path, record);
+        list.push_back(std::move(record));
+    };
+    int applicationCode = SQLITE_ROW;
+    const auto nextApplication = [&] {
+        // Past its end a statement would begin anew.
+        if (applicationCode == SQLITE_ROW) applicationCode = sqlite3_step(applications.get());
+        if (applicationCode != SQLITE_ROW) return false;
+        Row row(applications.get());
+        auto application = std::make_shared<InstalledApplication>();
+        application->path = row.text();
+        application->facts = row.facts(_strings, StoredDictionary::Keeps::encoding);
+        add(contents.applications, inOrder.applications, std::move(application));
+        return true;
+    };
+    const auto applicationAt = [&](std::string_view path) -> InstalledApplicationRef {
+        const auto isLast = [&] { return !inOrder.applications.empty() && inOrder.applications.back()->path == path; };
+        if (isLast() || (nextApplication() && isLast())) return inOrder.applications.back();
+        const auto found = contents.applications.find(std::string(path));
+        if (found != contents.applications.end()) return found->second;
+        while (nextApplication()) {
+            if (isLast()) return inOrder.applications.back();
+        }
+        return nullptr;
+    };
+    int code = SQLITE_ROW;
+    while ((code = sqlite3_step(plugIns.get())) == SQLITE_ROW) {
+        Row row(plugIns.get());
+        auto plugIn = std::make_shared<InstalledPlugIn>();
+        plugIn->path = row.text();
+        plugIn->facts = row.facts(_strings, StoredDictionary::Keeps::whatWasAskedFor);
+        const auto uuid = row.uuid();
+        plugIn->identifier = row.optionalText();
+        plugIn->originalIdentifier = row.optionalText();
+        plugIn->registered = Date{row.real()};
+        if (const auto path = row.bytes()) {
+            plugIn->application = applicationAt(*path);
+            // Without its application the row tells nothing; the scan reads the bundle again.
+            if (!plugIn->application) continue;
+        }
+        if (!uuid) continue;
+        plugIn->uuid = *uuid;
+        add(contents.plugIns, inOrder.plugIns, std::move(plugIn));
+    }
+    while (applicationCode == SQLITE_ROW) nextApplication();
+    if (isInOrder) contents.inOrder = std::move(inOrder);
+    return code == SQLITE_DONE && applicationCode == SQLITE_DONE;
 }
 
 void RegistryStore::moveAside() {

@@ -22,6 +22,7 @@ public:
         std::optional<Knowledge> knowledge;
         Applications applications;
         PlugIns plugIns;
+        std::optional<Installed> inOrder; // the same, if it was read in the order of the paths, as it mostly is
         std::set<std::string> registrations;
         Exclusions exclusions;
         Listings listings;
@@ -76,6 +77,7 @@ private:
 
     Failure openFile();
     Failure read(Contents& contents);
+    bool readBundles(Contents& contents);
     void moveAside();
     Failure begin();
     Failure end();

@@ -266,10 +266,13 @@ TEST_F(RegistryOnDisk, ChangeInPlaceKeepsTheUUIDAndIsToldWhenAnythingShows) {
 
 TEST_F(RegistryOnDisk, StatePersists) {
     writeApplication(app, {"a"});
+    writeApplication(two, {"b"});
     writeManifest(away, plugInInfo("tool"));
     start();
     add(away);
     write(plugIn, plugInInfo("renamed"));
+    writeName(app, "App"); // after the other one, in the database too
+    settle();
     const auto identity = identityAt(plugIn);
     const auto tool = identityAt(away);
     knowledge = registry->knowledgeUUID();
@@ -278,10 +281,12 @@ TEST_F(RegistryOnDisk, StatePersists) {
     EXPECT_EQ(registry->knowledgeUUID(), knowledge);
     EXPECT_EQ(identityAt(plugIn), identity);
     EXPECT_EQ(identityAt(away), tool);
+    EXPECT_EQ(at(plugIn)->containingBundle->localizedName, "App");
+    EXPECT_EQ(at(two + "/PlugIns/b.appex")->containingBundle->bundleURL, URL::file(two));
     registry.reset();
     fs::remove_all(away);
     start();
-    EXPECT_EQ(count(), 1U);
+    EXPECT_EQ(count(), 2U);
     settle();
     EXPECT_EQ(write(away, plugInInfo("tool")), "+tool") << "a registration outlives its bundle";
     EXPECT_EQ(uuidAt(away), *std::get<0>(tool));

@@ -92,7 +92,9 @@ TEST(RegistrySnapshot, MatchingLeavesOutNothingThatMatches) {
         plugIn->facts = facts;
         plugIns["/p" + std::to_string(i)] = plugIn;
     }
-    const RegistrySnapshot snapshot(plugIns, {}, {});
+    Installed installed;
+    for (const auto& [path, plugIn] : plugIns) installed.plugIns.push_back(plugIn);
+    const RegistrySnapshot snapshot(installed, {});
     std::size_t left = 0;
     std::size_t wanted = 0;
     for (int round = 0; round < 500; ++round) {
