@@ -96,7 +96,8 @@ InstalledBundles::InstalledBundles(const Root& root, const RegistryLimits& limit
     _isKnowledgeUnsaved = !contents.knowledge;
     _knowledge = contents.knowledge.value_or(Knowledge{UUID::random(), 1});
     auto kept = descriptors != nullptr ? descriptors->take(watchPrefix) : DescriptorStore::Kept();
-    if (contents.handedOver && contents.handedOver->watch == kept.name && contents.handedOver->places == placesNow() &&
+    if (contents.handedOver && contents.handedOver->watch == kept.name &&
+        contents.handedOver->places == textOf(surroundings({everything})) &&
         RegistryWatcher::isSilent(kept.descriptor.get())) {
         cx().info("nothing changed on disk while the daemon was not running");
         _watcher.become(std::move(kept.descriptor));
@@ -121,24 +122,31 @@ Installed InstalledBundles::installed(const PlugIns& hidden) {
     return installed;
 }
 
-/// The directories that bundles are looked for in, for a watch does not hear that others come to be in their places.
-std::string InstalledBundles::placesNow() const {
-    std::string places;
+/// Which directories are there now where bundles are looked for, at and below `places`: a watch does not hear that
+/// others come to be there.
+InstalledBundles::Surroundings InstalledBundles::surroundings(const Places& places) const {
+    Surroundings found;
     const auto add = [&](const std::string& path) {
+        if (std::ranges::none_of(places, [&](const auto& place) { return isAtOrBelow(path, place); })) return false;
         FileStatus status; // stays empty where there is none
         (void)readFileStatus(AT_FDCWD, path.c_str(), status);
         const auto& identity = status.identity;
         for (const auto part : {identity.device, identity.inode, static_cast<std::uint64_t>(identity.bornSeconds),
                                 std::uint64_t{identity.bornNanoseconds}})
-            places += std::to_string(part) + ' ';
-        places += path + '\n';
+            found[path] += std::to_string(part) + ' ';
+        return true;
     };
     for (const auto& folder : _folders) {
-        add(folder.path);
-        places += mountsAtAndBelow(folder.path);
+        if (add(folder.path)) found[folder.path] += mountsAtAndBelow(folder.path);
     }
     for (const auto& registration : _registrations) add(registration);
-    return places;
+    return found;
+}
+
+std::string InstalledBundles::textOf(const Surroundings& surroundings) {
+    std::string text;
+    for (const auto& [path, state] : surroundings) text.append(path).append(": ").append(state).append("\n");
+    return text;
 }
 
 /// Events are taken from now on, so what was handed over to this process holds for no later one.
@@ -160,9 +168,9 @@ void InstalledBundles::takeOverWatch() {
 void InstalledBundles::handOver() {
     if (_stage < Stage::watched || _watchName.empty() || !isSaved() || needsVerifying()) return;
     // Where something else came to lie meanwhile, other directories are watched than those that are there.
-    if (placesNow() != _placesWatched) return;
+    if (surroundings({everything}) != _surroundings) return;
     // What happens from now on waits in the watch. Should this fail, the next start looks at everything.
-    (void)_store.change([&] { _store.setHandedOver(HandedOver{_watchName, _placesWatched}); });
+    (void)_store.change([&] { _store.setHandedOver(HandedOver{_watchName, textOf(_surroundings)}); });
 }
 
 bool InstalledBundles::isUnchanged(const InstalledPlugIn& plugIn) const {
@@ -398,8 +406,11 @@ InstalledBundles::Change InstalledBundles::rescan(Places places, Manifests manif
     if (places.contains(everything)) {
         if (_stage < Stage::watched) takeOverWatch();
         _stage = Stage::watched;
-        _placesWatched = placesNow();
     }
+    std::erase_if(_surroundings, [&](const auto& known) {
+        return std::ranges::any_of(places, [&](const auto& place) { return isAtOrBelow(known.first, place); });
+    });
+    _surroundings.merge(surroundings(places));
     _manifests = manifests;
     _isShort = false;
     Found found;

@@ -76,6 +76,7 @@ public:
 
 private:
     using Places = std::set<std::string>;
+    using Surroundings = std::map<std::string, std::string>; // a directory's path, and which one it is
     enum class FolderKind { applications, plugIns };
     struct Folder {
         std::string path;
@@ -130,7 +131,8 @@ private:
     void save();
 
     // Between one process and the next.
-    std::string placesNow() const;
+    Surroundings surroundings(const Places& places) const;
+    static std::string textOf(const Surroundings& surroundings);
     void takeOverWatch();
 
     const std::string _top;
@@ -151,7 +153,7 @@ private:
     Knowledge _knowledge;
     Stage _stage = Stage::stored;
     std::optional<Installed> _stored; // what was read from the database, until it is asked for or not true any more
-    std::string _placesWatched;       // as they were when everything was looked at
+    Surroundings _surroundings;       // as they were when they were last looked at
 
     Manifests _manifests = Manifests::settled;    // during a scan
     bool _isShort = false;                        // during a scan: something could not be looked at

@@ -267,12 +267,11 @@ TEST_F(RegistryOnDisk, ChangeInPlaceKeepsTheUUIDAndIsToldWhenAnythingShows) {
 TEST_F(RegistryOnDisk, StatePersists) {
     writeApplication(app, {"a"});
     writeApplication(two, {"b"});
+    writeName(app, "App");
     writeManifest(away, plugInInfo("tool"));
     start();
     add(away);
-    write(plugIn, plugInInfo("renamed"));
-    writeName(app, "App"); // after the other one, in the database too
-    settle();
+    write(plugIn, plugInInfo("renamed")); // in the database it is behind that of the other application now
     const auto identity = identityAt(plugIn);
     const auto tool = identityAt(away);
     knowledge = registry->knowledgeUUID();
