@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <sys/inotify.h>
 #include <sys/ioctl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 #include <utility>
 
@@ -19,6 +20,13 @@ namespace {
 
 constexpr std::uint32_t passageEvents = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_ATTRIB;
 constexpr std::uint32_t contentEvents = passageEvents | IN_CLOSE_WRITE | IN_DELETE_SELF | IN_MOVE_SELF;
+
+bool leadsTo(const std::string& path, int directory) {
+    struct stat there{};
+    struct stat here{};
+    return stat(path.c_str(), &there) == 0 && fstat(directory, &here) == 0 && there.st_ino == here.st_ino &&
+           there.st_dev == here.st_dev;
+}
 
 } // namespace
 
@@ -51,7 +59,11 @@ void RegistryWatcher::watch(int directory, const std::string& path, Role role) {
         known->second.round = _round;
         return;
     }
-    // Another directory stands at the path, or the directory stood at another path: a watch belongs to the directory.
+    // A watch belongs to the directory. One that lies under two paths is heard of under the later one only.
+    const auto other = _byDescriptor.find(descriptor);
+    if (other != _byDescriptor.end() && leadsTo(other->second->first, directory))
+        _unwatched.insert(other->second->first);
+    // Another directory stands at the path, or the directory stood at another path.
     if (known != _watches.end()) {
         inotify_rm_watch(_inotify.get(), known->second.descriptor);
         forget(known->second.descriptor);

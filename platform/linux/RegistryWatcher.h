@@ -48,7 +48,7 @@ public:
     /// Takes the events that wait now. False when some were lost.
     bool read(std::vector<Event>& events);
 
-    /// The directories for which no watch could be had.
+    /// The directories for which no watch could be had, or not one under each of two paths.
     const std::set<std::string>& unwatched() const { return _unwatched; }
 
 private:

@@ -461,6 +461,16 @@ TEST_F(RegistryOnDisk, WatchIsBelievedOnlyIfItIsTheOneThatWasHandedOver) {
         umount(subfolder.c_str());
         EXPECT_FALSE(handedOver()) << "what lies there is not what is watched";
     }
+    bundles = watched();
+    const std::string alias = aside.path() + "/alias";
+    fs::create_directory(alias);
+    if (mount(applications.c_str(), alias.c_str(), nullptr, MS_BIND, nullptr) == 0) {
+        EXPECT_TRUE(bundles->registerPlugIn(alias + "/One.app/PlugIns/a.appex", [](const auto&) {}));
+        EXPECT_TRUE(bundles->needsVerifying());
+        bundles->handOver();
+        umount(alias.c_str());
+        EXPECT_FALSE(handedOver()) << "of two paths to a directory one is heard of";
+    }
     bundles.reset();
     limits.watches = 3;
     watched()->handOver();
