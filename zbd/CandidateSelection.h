@@ -21,7 +21,7 @@ struct Selection {
     ZBDServer& server;
     const ZBDQmxClient& client;
     std::uint64_t flags = 0; // DiscoveryFlags
-    MatchRules rules;
+    const MatchRules& rules;
     std::vector<MatchRules> exclusions; // the user's, as read for this request
     bool isRestricted = true;           // whether the host may be entitled to a part of the plug-ins only
     bool hasHolds = true;               // whether a plug-in may be on hold
