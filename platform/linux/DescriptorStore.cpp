@@ -7,21 +7,25 @@
 
 namespace platform::linux_ {
 
-DescriptorStore::Kept ServiceDescriptorStore::take(std::string_view prefix) {
-    Kept kept;
+std::vector<PassedDescriptor> passedDescriptors() {
+    std::vector<PassedDescriptor> passed;
     char** names = nullptr;
-    const int count = sd_listen_fds_with_names(0, &names); // the environment is left for the sockets in it
-    for (int i = 0; i < count && names != nullptr; ++i) {
-        if (!std::string_view(names[i]).starts_with(prefix) || kept.descriptor) continue;
-        // A duplicate is ours to close; the number itself stays with the environment that names it.
-        Descriptor duplicate(fcntl(SD_LISTEN_FDS_START + i, F_DUPFD_CLOEXEC, 0));
-        if (duplicate) kept = {names[i], std::move(duplicate)};
-    }
+    const int count = sd_listen_fds_with_names(0, &names); // the environment is left for others who ask
+    for (int i = 0; i < count; ++i) passed.push_back({names != nullptr ? names[i] : "", SD_LISTEN_FDS_START + i});
     if (names != nullptr) {
         for (char** name = names; *name != nullptr; ++name) std::free(*name);
         std::free(names);
     }
-    return kept;
+    return passed;
+}
+
+DescriptorStore::Kept ServiceDescriptorStore::take(std::string_view prefix) {
+    for (auto& [name, number] : passedDescriptors()) {
+        if (!name.starts_with(prefix)) continue;
+        Descriptor duplicate(fcntl(number, F_DUPFD_CLOEXEC, 0));
+        if (duplicate) return {std::move(name), std::move(duplicate)};
+    }
+    return {};
 }
 
 bool ServiceDescriptorStore::keep(const std::string& name, int descriptor) {

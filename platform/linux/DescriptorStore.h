@@ -4,8 +4,16 @@
 
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace platform::linux_ {
+
+/// A descriptor that this process was started with, and its name, if it has one (sd_listen_fds_with_names(3)).
+struct PassedDescriptor {
+    std::string name;
+    int number = -1; // stays with the environment that names it: who wants to close it makes a duplicate
+};
+std::vector<PassedDescriptor> passedDescriptors();
 
 /// Keeps descriptors when the process ends, and hands them to the next one. Any thread.
 class DescriptorStore {
@@ -26,8 +34,7 @@ public:
     virtual void drop(const std::string& name) = 0;
 };
 
-/// The service manager's (sd_pid_notify_with_fds(3), sd_listen_fds_with_names(3), FileDescriptorStoreMax= in
-/// systemd.service(5)).
+/// The service manager's (sd_pid_notify_with_fds(3), FileDescriptorStoreMax= in systemd.service(5)).
 class ServiceDescriptorStore final : public DescriptorStore {
 public:
     Kept take(std::string_view prefix) override;

@@ -1,5 +1,6 @@
 #include "platform/linux/TransportListener.h"
 
+#include "platform/linux/DescriptorStore.h"
 #include "platform/linux/PeerProcess.h"
 #include "platform/linux/TransportFrame.h"
 #include "platform/linux/TransportLimits.h"
@@ -7,7 +8,6 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
@@ -154,22 +154,12 @@ void StreamListener::open(const std::string& directory, const std::string& servi
 
 /// The socket that the service manager listens on for this service, by its name or its path.
 bool StreamListener::adopt(const std::string& path, const std::string& serviceName) {
-    char** names = nullptr;
-    const int count = ::sd_listen_fds_with_names(0, &names); // the environment is left for other services
     int found = -1;
-    for (int i = 0; i < count; ++i) {
-        const int descriptor = SD_LISTEN_FDS_START + i;
-        const bool isNamed = names != nullptr && serviceName == names[i];
-        if (::sd_is_socket_unix(descriptor, SOCK_STREAM, 1, isNamed ? nullptr : path.c_str(), 0) > 0 && found < 0) {
-            found = descriptor;
-        }
-    }
-    if (names != nullptr) {
-        for (char** name = names; *name != nullptr; ++name) std::free(*name);
-        std::free(names);
+    for (const auto& [name, number] : passedDescriptors()) {
+        const char* const expected = serviceName == name ? nullptr : path.c_str();
+        if (found < 0 && ::sd_is_socket_unix(number, SOCK_STREAM, 1, expected, 0) > 0) found = number;
     }
     if (found < 0) return false;
-    // A duplicate is ours to close; the number itself stays with the environment that names it.
     _socket = Descriptor(::fcntl(found, F_DUPFD_CLOEXEC, 0));
     if (!_socket) return false;
     const int flags = ::fcntl(_socket.get(), F_GETFL);
