@@ -348,6 +348,7 @@ private:
             if (!isStopping()) publish(_bundles.catchUp());
             awaitWake(0); // takes the wakes for what was done; `_wanted`, which is set before, tells of others
         }
+        // A look now would serve nobody, and what was handed over still holds for the next registry.
         if (_bundles.stage() < Stage::watched) return;
         wake(); // for actions that ended a delay
         while (true) {

@@ -60,7 +60,6 @@ struct Knowledge {
 struct HandedOver {
     std::string watch;
     std::string places; // which directories bundles were looked for in, as text
-    friend bool operator==(const HandedOver&, const HandedOver&) = default;
 };
 
 // Each ordered by path.

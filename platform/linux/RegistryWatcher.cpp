@@ -1,16 +1,17 @@
 #include "platform/linux/RegistryWatcher.h"
 
 #include "platform/linux/DirectoryFiles.h"
+#include "platform/linux/FileStatus.h"
 #include "platform/linux/ProcPath.h"
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <fcntl.h>
 #include <filesystem>
 #include <sys/inotify.h>
 #include <sys/ioctl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 #include <utility>
 
@@ -22,10 +23,10 @@ constexpr std::uint32_t passageEvents = IN_CREATE | IN_DELETE | IN_MOVED_FROM | 
 constexpr std::uint32_t contentEvents = passageEvents | IN_CLOSE_WRITE | IN_DELETE_SELF | IN_MOVE_SELF;
 
 bool leadsTo(const std::string& path, int directory) {
-    struct stat there{};
-    struct stat here{};
-    return stat(path.c_str(), &there) == 0 && fstat(directory, &here) == 0 && there.st_ino == here.st_ino &&
-           there.st_dev == here.st_dev;
+    FileStatus there;
+    FileStatus here;
+    return readFileStatus(AT_FDCWD, path.c_str(), there) == 0 && readFileStatus(directory, "", here) == 0 &&
+           there.identity == here.identity;
 }
 
 } // namespace

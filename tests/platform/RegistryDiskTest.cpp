@@ -400,7 +400,7 @@ TEST_F(RegistryOnDisk, WatchIsBelievedOnlyIfItIsTheOneThatWasHandedOver) {
     /// What happens after something was handed over, and before the next start.
     const std::vector<std::pair<std::string, Action>> cases{
         {"an edit", edit},
-        {"an edit that another one was told, which was not to hand over", [&] { (void)watched(); }},
+        {"another one that ended without handing over", [&] { (void)watched(); }},
         {"another watch", [&] { manager.name += "x"; }},
         {"none", [&] { manager.forget(); }},
         {"something else", [&] { manager.keep(manager.name, linux_::Descriptor(eventfd(0, EFD_CLOEXEC)).get()); }},
