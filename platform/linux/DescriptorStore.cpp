@@ -1,5 +1,7 @@
 #include "platform/linux/DescriptorStore.h"
 
+#include <algorithm>
+#include <cstddef>
 #include <cstdlib>
 #include <fcntl.h>
 #include <systemd/sd-daemon.h>
@@ -11,6 +13,7 @@ std::vector<PassedDescriptor> passedDescriptors() {
     std::vector<PassedDescriptor> passed;
     char** names = nullptr;
     const int count = sd_listen_fds_with_names(0, &names); // the environment is left for others who ask
+    passed.reserve(static_cast<std::size_t>(std::max(count, 0))); // negative: nothing that can be read
     for (int i = 0; i < count; ++i) passed.push_back({names != nullptr ? names[i] : "", SD_LISTEN_FDS_START + i});
     if (names != nullptr) {
         for (char** name = names; *name != nullptr; ++name) std::free(*name);
