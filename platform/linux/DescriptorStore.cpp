@@ -12,7 +12,7 @@ namespace platform::linux_ {
 std::vector<PassedDescriptor> passedDescriptors() {
     std::vector<PassedDescriptor> passed;
     char** names = nullptr;
-    const int count = sd_listen_fds_with_names(0, &names); // the environment is left for others who ask
+    const int count = sd_listen_fds_with_names(0, &names);        // the environment is left for others who ask
     passed.reserve(static_cast<std::size_t>(std::max(count, 0))); // negative: nothing that can be read
     for (int i = 0; i < count; ++i) passed.push_back({names != nullptr ? names[i] : "", SD_LISTEN_FDS_START + i});
     if (names != nullptr) {
